@@ -1,0 +1,325 @@
+// The event server: listener, per-connection packet assembly, handler calls
+// and replies, all inside the daemon's libevent loop.
+#include "quvaidx/daemon.h"
+
+#include <errno.h>
+#include <string.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <exception>
+
+#include <event2/buffer.h>
+#include <event2/bufferevent.h>
+#include <event2/event.h>
+#include <event2/listener.h>
+#include <event2/util.h>
+
+#include "ipc/packet_codec.h"
+#include "quvaidx/ipc.h"
+#include "quvaidx/log.h"
+
+struct evconnlistener* g_listener = nullptr;
+int32_t g_conn_count = 0;
+
+namespace {
+
+constexpr char kModule[] = "quvaidx_daemon";
+
+// Re-enables the listener after accepting paused for lack of descriptors.
+// Lives as long as the listener.
+struct event* g_accept_resume = nullptr;
+
+const char* DaemonName(void* args) {
+  const EventArgs* event_args = static_cast<const EventArgs*>(args);
+  return event_args != nullptr && event_args->name != nullptr
+             ? event_args->name
+             : "";
+}
+
+void CloseConnection(struct bufferevent* bev) {
+  --g_conn_count;
+  bufferevent_free(bev);  // closes the socket
+}
+
+bool IsOutOfDescriptors(int err) {
+  return err == EMFILE || err == ENFILE || err == ENOBUFS || err == ENOMEM;
+}
+
+void ResumeAccepting(evutil_socket_t, short, void* listener) {
+  evconnlistener_enable(static_cast<struct evconnlistener*>(listener));
+}
+
+// Queues `value` as one packet. Returns 0, -1 when it cannot be queued, and
+// sets *too_large (with nothing queued) when its text exceeds a packet.
+int QueuePacket(struct bufferevent* bev, const Json::Value& value,
+                bool* too_large) {
+  char packet[kPacketBufferSize];
+  size_t size = 0;
+  *too_large = false;
+  switch (quvaidx::EncodePacket(value, packet, &size)) {
+    case quvaidx::EncodeStatus::kOk:
+      break;
+    case quvaidx::EncodeStatus::kTooLarge:
+      AppLogError(3, "%s:%d [Error] reply too large: %zu bytes, limit %zu",
+                  kModule, __LINE__, size, kMaxSendBody);
+      *too_large = true;
+      return -1;
+    case quvaidx::EncodeStatus::kFailed:
+      AppLogError(3, "%s:%d [Error] cannot serialise reply", kModule,
+                  __LINE__);
+      return -1;
+  }
+  if (bufferevent_write(bev, packet, size) != 0) {
+    AppLogError(3, "%s:%d bufferevent_write", kModule, __LINE__);
+    return -1;
+  }
+  return 0;
+}
+
+// Calls the daemon's handler; an exception counts as a request to close.
+int CallHandler(EventArgs* args, Json::Value& request, Json::Value& reply) {
+  if (args == nullptr || args->handler == nullptr) return -1;
+  try {
+    return args->handler(request, reply, args);
+  } catch (const std::exception& e) {
+    AppLogError(3, "%s:%d [Error] [%s] handler threw: %s", kModule, __LINE__,
+                DaemonName(args), e.what());
+  } catch (...) {
+    AppLogError(3, "%s:%d [Error] [%s] handler threw", kModule, __LINE__,
+                DaemonName(args));
+  }
+  return -1;
+}
+
+enum class PacketOutcome { kAnswered, kWaiting, kClosed };
+
+// Handles the packet at the head of the connection's input, if it is
+// complete: parse, handler, reply.
+PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
+  struct evbuffer* input = bufferevent_get_input(bev);
+  if (evbuffer_get_length(input) >= kPacketHeaderSize) {
+    unsigned char header[kPacketHeaderSize];
+    evbuffer_copyout(input, header, sizeof(header));
+    size_t length = quvaidx::DecodeBodyLength(header);
+    if (length > kMaxRecvBody) {
+      AppLogError(3, "%s:%d [Error] [%s] packet too large: %zu bytes, fd = %d",
+                  kModule, __LINE__, DaemonName(args), length,
+                  static_cast<int>(bufferevent_getfd(bev)));
+      CloseConnection(bev);
+      return PacketOutcome::kClosed;
+    }
+  }
+  if (CheckBufferevent(bev) != 1) return PacketOutcome::kWaiting;
+
+  Json::Value request(Json::objectValue);
+  Json::Value reply(Json::objectValue);
+  RecvPacketEv(bev, request);
+  if (CallHandler(args, request, reply) != 0) {
+    CloseConnection(bev);
+    return PacketOutcome::kClosed;
+  }
+  bool too_large = false;
+  if (QueuePacket(bev, reply, &too_large) != 0 && too_large) {
+    // Answer anyway, so the client is not left waiting for ever.
+    QueuePacket(bev, MakeResponse(false, "reply too large"), &too_large);
+  }
+  return PacketOutcome::kAnswered;
+}
+
+}  // namespace
+
+int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
+  if (path == nullptr || strlen(path) > kMaxSocketPath) {
+    AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
+                path != nullptr ? path : "(null)");
+    return -1;
+  }
+  if (g_listener != nullptr) {
+    AppLogError(3, "%s:%d [Error] a server is already running, not at %s",
+                kModule, __LINE__, path);
+    return -1;
+  }
+  if (unlink(path) != 0 && errno != ENOENT) {
+    AppLogError(3, "%s:%d [Error] remove %s", kModule, __LINE__, path);
+    return -1;
+  }
+  struct sockaddr_un address;
+  memset(&address, 0, sizeof(address));
+  address.sun_family = AF_UNIX;
+  memcpy(address.sun_path, path, strlen(path));
+
+  // Children a daemon starts must not inherit its sockets.
+  const unsigned flags =
+      LEV_OPT_CLOSE_ON_FREE | LEV_OPT_REUSEABLE | LEV_OPT_CLOSE_ON_EXEC;
+  g_listener = evconnlistener_new_bind(
+      base, OnAccept, args, flags, 16,
+      reinterpret_cast<struct sockaddr*>(&address), sizeof(address));
+  if (g_listener == nullptr) {
+    AppLogError(3, "%s:%d [Error] Could not create a listener: %s", kModule,
+                __LINE__, path);
+    return -1;
+  }
+  evconnlistener_set_error_cb(g_listener, OnAcceptError);
+  return 0;
+}
+
+int StopServer(const char* path) {
+  if (g_listener == nullptr) return 0;
+  if (g_accept_resume != nullptr) {
+    event_free(g_accept_resume);
+    g_accept_resume = nullptr;
+  }
+  evconnlistener_free(g_listener);
+  g_listener = nullptr;
+  if (path != nullptr) unlink(path);  // don't care if this fails
+  return 0;
+}
+
+int GetCurrentConnCount() { return g_conn_count; }
+
+Json::Value MakeResponse(bool success, const char* reason) {
+  Json::Value response(Json::objectValue);
+  response["success"] = success;
+  if (reason != nullptr) response["reason"] = reason;
+  return response;
+}
+
+int CheckBufferevent(struct bufferevent* bev) {
+  struct evbuffer* input = bufferevent_get_input(bev);
+  size_t n = evbuffer_get_length(input);
+  if (n < kPacketHeaderSize) {
+    AppLogError(3, "%s:%d bufferevent at least %d bytes [%d bytes]", kModule,
+                __LINE__, static_cast<int>(kPacketHeaderSize),
+                static_cast<int>(n));
+    return 0;
+  }
+  unsigned char header[kPacketHeaderSize];
+  evbuffer_copyout(input, header, sizeof(header));
+  size_t total = quvaidx::DecodeBodyLength(header) + kPacketHeaderSize;
+  if (n >= total) return 1;
+  AppLogError(6,
+              "%s:%d bufferevent hasn't arrived completely, and wait "
+              "[arrived=%d, total=%d]",
+              kModule, __LINE__, static_cast<int>(n), static_cast<int>(total));
+  return 0;
+}
+
+int RecvPacketEv(struct bufferevent* bev, Json::Value& value) {
+  unsigned char header[kPacketHeaderSize];
+  size_t got = bufferevent_read(bev, header, sizeof(header));
+  if (got != sizeof(header)) {
+    AppLogError(3, "%s:%d bufferevent_read, %d, %d", kModule, __LINE__,
+                static_cast<int>(got), static_cast<int>(sizeof(header)));
+    return -1;
+  }
+  size_t length = quvaidx::DecodeBodyLength(header);
+  if (length > kMaxRecvBody) {
+    AppLogError(3, "%s:%d [Error] packet too large: %zu bytes, limit %zu",
+                kModule, __LINE__, length, kMaxRecvBody);
+    return -1;
+  }
+  char body[kPacketBufferSize];
+  got = bufferevent_read(bev, body, length);
+  if (got != length) {
+    AppLogError(3, "%s:%d bufferevent_read, %d, %d", kModule, __LINE__,
+                static_cast<int>(got), static_cast<int>(length));
+    return -1;
+  }
+  quvaidx::ParsePacketBody(body, length, value);
+  return 0;
+}
+
+int SendPacketEv(struct bufferevent* bev, Json::Value& value) {
+  bool too_large = false;
+  return QueuePacket(bev, value, &too_large);
+}
+
+void OnAccept(struct evconnlistener* listener, int fd, struct sockaddr*, int,
+              void* args) {
+  ++g_conn_count;
+  struct bufferevent* bev = bufferevent_socket_new(
+      evconnlistener_get_base(listener), fd, BEV_OPT_CLOSE_ON_FREE);
+  if (bev == nullptr) {
+    AppLogError(3, "%s:%d [Error] [%s] bufferevent_socket_new: fd = %d",
+                kModule, __LINE__, DaemonName(args), fd);
+    --g_conn_count;
+    close(fd);  // nobody else owns it
+    return;
+  }
+  bufferevent_setcb(bev, onRead, onWrite, onEvent, args);
+  bufferevent_enable(bev, EV_READ);
+}
+
+void OnAcceptError(struct evconnlistener* listener, void*) {
+  int err = EVUTIL_SOCKET_ERROR();
+  struct event_base* base = evconnlistener_get_base(listener);
+  if (IsOutOfDescriptors(err)) {
+    // Any local user could otherwise stop the daemon by holding connections
+    // open: pause accepting and try again shortly.
+    AppLogError(3, "%s:%d [Error] accept: %d, %s; pausing for %d ms", kModule,
+                __LINE__, err, evutil_socket_error_to_string(err),
+                kAcceptPauseMs);
+    if (g_accept_resume == nullptr) {
+      g_accept_resume = evtimer_new(base, ResumeAccepting, listener);
+    }
+    if (g_accept_resume != nullptr) {
+      struct timeval pause = {0, kAcceptPauseMs * 1000};
+      evconnlistener_disable(listener);
+      evtimer_add(g_accept_resume, &pause);
+      return;
+    }
+  }
+  event_base_loopexit(base, nullptr);
+  AppLogError(3, "%s:%d [Error] OnAcceptError: %d, %s", kModule, __LINE__, err,
+              evutil_socket_error_to_string(err));
+}
+
+void onRead(struct bufferevent* bev, void* ptr) {
+  EventArgs* args = static_cast<EventArgs*>(ptr);
+  struct evbuffer* input = bufferevent_get_input(bev);
+  struct evbuffer* output = bufferevent_get_output(bev);
+  // Every complete request already buffered is answered now: libevent calls
+  // again only when more bytes arrive, which may be never.
+  do {
+    if (HandleOnePacket(bev, args) != PacketOutcome::kAnswered) return;
+    if (evbuffer_get_length(output) > kMaxPendingOutput) {
+      // The peer is not reading its replies; stop reading its requests until
+      // onWrite sees the output drained.
+      bufferevent_disable(bev, EV_READ);
+      return;
+    }
+  } while (evbuffer_get_length(input) > 0);
+}
+
+void onWrite(struct bufferevent* bev, void* args) {
+  // Called when the output has drained. Resume a connection that was paused
+  // for backpressure, and answer what it had already sent.
+  if ((bufferevent_get_enabled(bev) & EV_READ) != 0) return;
+  bufferevent_enable(bev, EV_READ);
+  if (evbuffer_get_length(bufferevent_get_input(bev)) > 0) onRead(bev, args);
+}
+
+void onEvent(struct bufferevent* bev, short events, void* args) {
+  const char* name = DaemonName(args);
+  int fd = static_cast<int>(bufferevent_getfd(bev));
+  if (events & BEV_EVENT_EOF) {
+    AppLogError(7, "%s:%d [%s] BEV_EVENT_EOF: fd = %d", kModule, __LINE__,
+                name, fd);
+  } else if (events & BEV_EVENT_READING) {
+    AppLogError(3, "%s:%d [%s] BEV_EVENT_READING: fd = %d", kModule, __LINE__,
+                name, fd);
+  } else if (events & BEV_EVENT_WRITING) {
+    AppLogError(3, "%s:%d [%s] BEV_EVENT_WRITING: fd = %d", kModule, __LINE__,
+                name, fd);
+  } else if (events & BEV_EVENT_ERROR) {
+    AppLogError(3, "%s:%d [%s] BEV_EVENT_ERROR: fd = %d", kModule, __LINE__,
+                name, fd);
+  } else if (events & BEV_EVENT_TIMEOUT) {
+    AppLogError(3, "%s:%d [%s] BEV_EVENT_TIMEOUT: fd = %d", kModule, __LINE__,
+                name, fd);
+  } else {
+    AppLogError(3, "%s:%d [%s] unknown: fd = %d", kModule, __LINE__, name, fd);
+  }
+  CloseConnection(bev);
+}

@@ -1,0 +1,132 @@
+// Client side of a connection to an index daemon: connect with attempts,
+// handshake, one-call exchanges.
+#include <errno.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "ipc/packet_codec.h"
+#include "quvaidx/ipc.h"
+#include "quvaidx/log.h"
+#include "util/hooks.h"
+
+namespace {
+
+constexpr char kModule[] = "quvaidx_ipc_core";
+
+// Closes a descriptor this module opened.
+void CloseSocket(int fd) {
+  close(fd);  // nothing useful to do if this fails
+}
+
+}  // namespace
+
+int ConnectPeer(const char* path, bool handshake, int attempts) {
+  if (path == nullptr || strlen(path) > kMaxSocketPath) {
+    AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
+                path != nullptr ? path : "(null)");
+    return -1;
+  }
+  struct sockaddr_un address;
+  memset(&address, 0, sizeof(address));
+  address.sun_family = AF_UNIX;
+  memcpy(address.sun_path, path, strlen(path));
+
+  for (int i = 0; i < attempts; ++i) {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+      int err = errno;
+      AppLogError(3, "%s:%d [Error] create socket: %s, %s", kModule, __LINE__,
+                  path, strerror(err));
+      quvaidx::SleepSeconds(1);
+      continue;
+    }
+    if (connect(fd, reinterpret_cast<struct sockaddr*>(&address),
+                sizeof(address)) != 0) {
+      AppLogError(7, "%s:%d [Error] connect server: %d, %s", kModule,
+                  __LINE__, i, path);
+      CloseSocket(fd);
+      quvaidx::SleepSeconds(1);
+      continue;
+    }
+    if (!handshake || Handshake(fd) != -1) return fd;
+    AppLogError(7, "%s:%d [Error] app level handshake: %d, %s", kModule,
+                __LINE__, i, path);
+    CloseSocket(fd);
+    quvaidx::SleepSeconds(1);
+  }
+  AppLogError(3, "%s:%d [Error] connect server: %s", kModule, __LINE__, path);
+  return -1;
+}
+
+int Handshake(int fd) {
+  Json::Value value(Json::objectValue);
+  value["command"] = "HANDSHAKE";
+  if (SendPacket(fd, value) != 0) return -1;
+  if (RecvPacket(fd, value) != 0) return -1;
+  return 0;
+}
+
+int DisconnectPeer(int fd) {
+  if (fd >= 0) CloseSocket(fd);
+  return 0;
+}
+
+namespace {
+
+// One connection, one request, optionally one reply; restarted when the
+// daemon closed or reset the connection. The reply, when one is wanted,
+// replaces `value`; without a reply `value` becomes null.
+int ExchangeByPath(const char* path, Json::Value& value, int attempts,
+                   bool want_reply) {
+  for (int restarts = 0;; ++restarts) {
+    int fd = ConnectPeer(path, /*handshake=*/!want_reply, attempts);
+    if (fd < 0) break;
+    Json::Value reply;
+    int result = SendPacket(fd, value);
+    if (result == 0 && want_reply) result = RecvPacket(fd, reply);
+    CloseSocket(fd);
+    if (result == 0) {
+      value.swap(reply);
+      return 0;
+    }
+    if (result != -2) break;
+    if (restarts == kMaxExchangeRestarts) {
+      AppLogError(3, "%s:%d [Error] connection to %s lost %d times, giving up",
+                  kModule, __LINE__, path, restarts + 1);
+      break;
+    }
+  }
+  quvaidx::EmptyValue(value);
+  return -1;
+}
+
+}  // namespace
+
+int AutoSendPacket(const char* path, Json::Value& value, int attempts) {
+  return ExchangeByPath(path, value, attempts, /*want_reply=*/false);
+}
+
+int AutoSendRecvPacketBySocketPath(const char* path, Json::Value& value,
+                                   int attempts) {
+  return ExchangeByPath(path, value, attempts, /*want_reply=*/true);
+}
+
+int AutoSendRecvPacketByFd(int fd, Json::Value& value, int /*unused*/) {
+  Json::Value reply;
+  int result = SendPacket(fd, value);
+  if (result == 0) result = RecvPacket(fd, reply);
+  if (result == 0) {
+    value.swap(reply);
+    return 0;
+  }
+  quvaidx::EmptyValue(value);
+  return result;
+}
+
+int AutoSendRecvPacket(const char* path, int fd, Json::Value& value,
+                       int attempts) {
+  if (fd == -1) return AutoSendRecvPacketBySocketPath(path, value, attempts);
+  return AutoSendRecvPacketByFd(fd, value, attempts);
+}

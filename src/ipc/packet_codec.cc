@@ -1,0 +1,59 @@
+#include "ipc/packet_codec.h"
+
+#include <string.h>
+
+#include <string>
+
+#include "quvaidx/ipc.h"
+
+namespace quvaidx {
+
+EncodeStatus EncodePacket(const Json::Value& value, char* packet,
+                          size_t* size) {
+  // A writer and reader per thread keep their buffers between packets.
+  thread_local Json::FastWriter writer;
+  std::string text;
+  try {
+    text = writer.write(value);
+  } catch (...) {
+    return EncodeStatus::kFailed;
+  }
+  if (text.size() > kMaxSendBody) {
+    *size = text.size();
+    return EncodeStatus::kTooLarge;
+  }
+  packet[0] = static_cast<char>((kPacketMagic >> 8) & 0xff);
+  packet[1] = static_cast<char>(kPacketMagic & 0xff);
+  packet[2] = static_cast<char>((text.size() >> 8) & 0xff);
+  packet[3] = static_cast<char>(text.size() & 0xff);
+  memcpy(packet + kPacketHeaderSize, text.data(), text.size());
+  *size = kPacketHeaderSize + text.size();
+  return EncodeStatus::kOk;
+}
+
+size_t DecodeBodyLength(const unsigned char* header) {
+  return (static_cast<size_t>(header[2]) << 8) | header[3];
+}
+
+void ParsePacketBody(const char* body, size_t length, Json::Value& value) {
+  thread_local Json::Reader reader;
+  const void* zero = memchr(body, '\0', length);
+  const char* end = zero != nullptr ? static_cast<const char*>(zero)
+                                    : body + length;
+  try {
+    reader.parse(body, end, value, true);
+  } catch (...) {
+    // Nesting beyond the reader's limit throws; such a body counts as
+    // malformed, like any other.
+  }
+}
+
+void EmptyValue(Json::Value& value) {
+  if (value.isArray() || value.isObject()) {
+    value.clear();
+  } else {
+    value = Json::Value();
+  }
+}
+
+}  // namespace quvaidx

@@ -1,0 +1,42 @@
+// The one packet encoder and decoder, shared by the blocking client side and
+// the event server. Not exported.
+#ifndef QUVAIDX_IPC_PACKET_CODEC_H_
+#define QUVAIDX_IPC_PACKET_CODEC_H_
+
+#include <stddef.h>
+
+#include <json/json.h>
+
+namespace quvaidx {
+
+enum class EncodeStatus {
+  kOk,        // packet written
+  kTooLarge,  // the text is longer than kMaxSendBody; nothing written
+  kFailed,    // the value could not be serialised (out of memory)
+};
+
+// Serialises `value` with Json::FastWriter and lays header and body out in
+// `packet`, which must hold kPacketBufferSize bytes. On kOk, *size is the
+// packet's length (header included); on kTooLarge, the text's length.
+// Never throws.
+EncodeStatus EncodePacket(const Json::Value& value, char* packet,
+                          size_t* size);
+
+// Returns the body length announced by a 4-byte header. The magic is not
+// examined.
+size_t DecodeBodyLength(const unsigned char* header);
+
+// Parses body[0, length) up to its first zero byte into `value` with
+// Json::Reader, collecting comments. The parse result is not examined: on
+// malformed or too deeply nested input `value` holds what the parser left.
+// Never throws.
+void ParsePacketBody(const char* body, size_t length, Json::Value& value);
+
+// Empties `value` after a failed exchange: an array or object loses its
+// members and keeps its type, any other value becomes null. (Json::Value's
+// own clear() throws on scalars.)
+void EmptyValue(Json::Value& value);
+
+}  // namespace quvaidx
+
+#endif  // QUVAIDX_IPC_PACKET_CODEC_H_

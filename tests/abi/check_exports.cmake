@@ -1,0 +1,38 @@
+# Compares the dynamic symbols that LIBRARY defines with the list in EXPECTED
+# (one demangled name per line; '#' starts a comment). Fails on any symbol
+# missing from either side.
+execute_process(COMMAND nm -D --defined-only ${LIBRARY}
+                COMMAND c++filt
+                OUTPUT_VARIABLE nm_out RESULT_VARIABLE rc)
+if(NOT rc EQUAL 0)
+  message(FATAL_ERROR "nm failed on ${LIBRARY}")
+endif()
+string(REPLACE "\n" ";" nm_lines "${nm_out}")
+set(actual "")
+foreach(line IN LISTS nm_lines)
+  # "<address> <type> <name>"; the name may hold spaces.
+  if(line MATCHES "^[0-9a-f]+ [A-Za-z] (.+)$")
+    list(APPEND actual "${CMAKE_MATCH_1}")
+  endif()
+endforeach()
+file(STRINGS ${EXPECTED} expected_lines)
+set(expected "")
+foreach(line IN LISTS expected_lines)
+  string(STRIP "${line}" line)
+  if(NOT line STREQUAL "" AND NOT line MATCHES "^#")
+    list(APPEND expected "${line}")
+  endif()
+endforeach()
+list(SORT actual)
+list(SORT expected)
+set(unexpected ${actual})
+list(REMOVE_ITEM unexpected ${expected})
+set(missing ${expected})
+list(REMOVE_ITEM missing ${actual})
+if(unexpected OR missing)
+  string(REPLACE ";" "\n  " unexpected_text "${unexpected}")
+  string(REPLACE ";" "\n  " missing_text "${missing}")
+  message(FATAL_ERROR "Exported symbols differ.\nUnexpected:\n  ${unexpected_text}\nMissing:\n  ${missing_text}")
+endif()
+list(LENGTH actual n)
+message(STATUS "${n} exported symbols, as expected")
