@@ -133,7 +133,7 @@ QUVAIDX_API int AutoSendRecvPacketByFd(int fd, Json::Value& value, int unused);
 // With fd == -1, AutoSendRecvPacketBySocketPath(path, value, attempts);
 // otherwise AutoSendRecvPacketByFd(fd, value, attempts), without looking at
 // the path.
-QUVAIDX_API int AutoSendRecvPacket(const char* path, int fd,
-                                   Json::Value& value, int attempts);
+QUVAIDX_API int AutoSendRecvPacket(const char* path, int fd, Json::Value& value,
+                                   int attempts);
 
 #endif  // QUVAIDX_IPC_H_

@@ -32,9 +32,8 @@ struct event* g_accept_resume = nullptr;
 
 const char* DaemonName(void* args) {
   const EventArgs* event_args = static_cast<const EventArgs*>(args);
-  return event_args != nullptr && event_args->name != nullptr
-             ? event_args->name
-             : "";
+  return event_args != nullptr && event_args->name != nullptr ? event_args->name
+                                                              : "";
 }
 
 void CloseConnection(struct bufferevent* bev) {
@@ -66,8 +65,7 @@ int QueuePacket(struct bufferevent* bev, const Json::Value& value,
       *too_large = true;
       return -1;
     case quvaidx::EncodeStatus::kFailed:
-      AppLogError(3, "%s:%d [Error] cannot serialise reply", kModule,
-                  __LINE__);
+      AppLogError(3, "%s:%d [Error] cannot serialise reply", kModule, __LINE__);
       return -1;
   }
   if (bufferevent_write(bev, packet, size) != 0) {
@@ -304,8 +302,8 @@ void onEvent(struct bufferevent* bev, short events, void* args) {
   const char* name = DaemonName(args);
   int fd = static_cast<int>(bufferevent_getfd(bev));
   if (events & BEV_EVENT_EOF) {
-    AppLogError(7, "%s:%d [%s] BEV_EVENT_EOF: fd = %d", kModule, __LINE__,
-                name, fd);
+    AppLogError(7, "%s:%d [%s] BEV_EVENT_EOF: fd = %d", kModule, __LINE__, name,
+                fd);
   } else if (events & BEV_EVENT_READING) {
     AppLogError(3, "%s:%d [%s] BEV_EVENT_READING: fd = %d", kModule, __LINE__,
                 name, fd);

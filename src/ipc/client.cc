@@ -44,8 +44,8 @@ int ConnectPeer(const char* path, bool handshake, int attempts) {
     }
     if (connect(fd, reinterpret_cast<struct sockaddr*>(&address),
                 sizeof(address)) != 0) {
-      AppLogError(7, "%s:%d [Error] connect server: %d, %s", kModule,
-                  __LINE__, i, path);
+      AppLogError(7, "%s:%d [Error] connect server: %d, %s", kModule, __LINE__,
+                  i, path);
       CloseSocket(fd);
       quvaidx::SleepSeconds(1);
       continue;

@@ -38,8 +38,8 @@ size_t DecodeBodyLength(const unsigned char* header) {
 void ParsePacketBody(const char* body, size_t length, Json::Value& value) {
   thread_local Json::Reader reader;
   const void* zero = memchr(body, '\0', length);
-  const char* end = zero != nullptr ? static_cast<const char*>(zero)
-                                    : body + length;
+  const char* end =
+      zero != nullptr ? static_cast<const char*>(zero) : body + length;
   try {
     reader.parse(body, end, value, true);
   } catch (...) {

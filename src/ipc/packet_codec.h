@@ -19,8 +19,7 @@ enum class EncodeStatus {
 // `packet`, which must hold kPacketBufferSize bytes. On kOk, *size is the
 // packet's length (header included); on kTooLarge, the text's length.
 // Never throws.
-EncodeStatus EncodePacket(const Json::Value& value, char* packet,
-                          size_t* size);
+EncodeStatus EncodePacket(const Json::Value& value, char* packet, size_t* size);
 
 // Returns the body length announced by a 4-byte header. The magic is not
 // examined.

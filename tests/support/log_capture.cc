@@ -36,7 +36,8 @@ const std::vector<LogLine>& LogCapture::lines() const { return Captured(); }
 
 std::vector<std::string> LogCapture::Normalized() const {
   std::vector<std::string> out;
-  for (const LogLine& line : Captured()) out.push_back(NormalizeLine(line.text));
+  for (const LogLine& line : Captured())
+    out.push_back(NormalizeLine(line.text));
   return out;
 }
 
