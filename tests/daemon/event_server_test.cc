@@ -10,6 +10,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <map>
@@ -321,13 +322,15 @@ TEST_F(EventServerTest, ClientExchangeEndToEnd) {
   value["command"] = "GET_MEDIA_INFO";
   value["path"] = "/share/Multimedia/a.jpg";
   int result = -9;
+  std::atomic<bool> done{false};
   std::thread client([&] {
     result = AutoSendRecvPacketBySocketPath(path_.c_str(), value, 1);
     int fd = ConnectPeer(path_.c_str(), true, 1);
     if (fd >= 0) result += 10;
     DisconnectPeer(fd);
+    done = true;
   });
-  while (result == -9) RunFor(1);
+  while (!done) RunFor(1);
   client.join();
   RunFor(5);
   EXPECT_EQ(result, 10);
