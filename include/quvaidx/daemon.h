@@ -72,7 +72,9 @@ QUVAIDX_API extern int32_t g_conn_count;
 
 // Removes whatever file is at `path` (a socket left from an earlier run) and
 // listens there, on `base`, with a backlog of 16. The socket file gets the
-// process's file-creation mask.
+// process's file-creation mask. When SIGPIPE still has its default action
+// (ending the process), it is set to be ignored: a client that goes away
+// while its reply is being written must not end the daemon.
 // Returns 0 with g_listener set. Returns -1 when the old file cannot be
 // removed, when the listener cannot be created (g_listener stays null), or
 // when the path is longer than kMaxSocketPath bytes (no file is removed or

@@ -3,6 +3,7 @@
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
+#include <signal.h>
 #include <string.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -43,6 +44,17 @@ void CloseConnection(struct bufferevent* bev) {
 
 bool IsOutOfDescriptors(int err) {
   return err == EMFILE || err == ENFILE || err == ENOBUFS || err == ENOMEM;
+}
+
+// libevent writes replies with writev(2), which raises SIGPIPE when a client
+// has gone away; its default action would end the daemon. A disposition the
+// daemon chose itself is left alone.
+void IgnoreBrokenPipes() {
+  struct sigaction current;
+  if (sigaction(SIGPIPE, nullptr, &current) == 0 &&
+      current.sa_handler == SIG_DFL && !(current.sa_flags & SA_SIGINFO)) {
+    signal(SIGPIPE, SIG_IGN);
+  }
 }
 
 void ResumeAccepting(evutil_socket_t, short, void* listener) {
@@ -159,6 +171,7 @@ int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
     return -1;
   }
   evconnlistener_set_error_cb(g_listener, OnAcceptError);
+  IgnoreBrokenPipes();
   return 0;
 }
 

@@ -4,6 +4,7 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -336,6 +337,28 @@ TEST_F(EventServerTest, ClientExchangeEndToEnd) {
   EXPECT_EQ(result, 10);
   EXPECT_TRUE(value["success"].asBool());
   EXPECT_EQ(value["path"].asString(), "/share/Multimedia/a.jpg");
+}
+
+TEST_F(EventServerTest, ClientGoneBeforeItsReplyDoesNotKillTheDaemon) {
+  signal(SIGPIPE, SIG_DFL);
+  const std::string blob(10000, 'g');
+  handler_ = [&](Json::Value&, Json::Value& reply) {
+    reply["blob"] = blob;
+    return 0;
+  };
+  Start();
+  int fd = Connect();
+  std::string requests;
+  for (int i = 0; i < 100; ++i) requests += Request("R");
+  Send(fd, requests);
+  RunFor(10);  // replies pile up unread
+  close(fd);
+  clients_.clear();
+  RunFor(20);  // writing to the closed client raises SIGPIPE, if not ignored
+  EXPECT_EQ(GetCurrentConnCount(), 0);
+  struct sigaction action;
+  sigaction(SIGPIPE, nullptr, &action);
+  EXPECT_EQ(action.sa_handler, SIG_IGN);
 }
 
 TEST_F(EventServerTest, StaleSocketFileIsReplaced) {
