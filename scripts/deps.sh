@@ -2,8 +2,8 @@
 # Installs the Debian packages that building, testing, benchmarking and
 # fuzzing need, when any is missing. Needs root (or sudo) only to install.
 set -euo pipefail
-packages=(cmake make g++ clang pkg-config libjsoncpp-dev libevent-dev libicu-dev
-          libgtest-dev libgmock-dev libbenchmark-dev)
+packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
+          libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" \
