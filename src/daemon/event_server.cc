@@ -140,7 +140,8 @@ PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
 }  // namespace
 
 int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
-  if (path == nullptr || strlen(path) > kMaxSocketPath) {
+  struct sockaddr_un address;
+  if (!quvaidx::BuildUnixAddress(path, &address)) {
     AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
                 path != nullptr ? path : "(null)");
     return -1;
@@ -154,10 +155,6 @@ int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
     AppLogError(3, "%s:%d [Error] remove %s", kModule, __LINE__, path);
     return -1;
   }
-  struct sockaddr_un address;
-  memset(&address, 0, sizeof(address));
-  address.sun_family = AF_UNIX;
-  memcpy(address.sun_path, path, strlen(path));
 
   // Children a daemon starts must not inherit its sockets.
   const unsigned flags =

@@ -23,15 +23,12 @@ void CloseSocket(int fd) {
 }  // namespace
 
 int ConnectPeer(const char* path, bool handshake, int attempts) {
-  if (path == nullptr || strlen(path) > kMaxSocketPath) {
+  struct sockaddr_un address;
+  if (!quvaidx::BuildUnixAddress(path, &address)) {
     AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
                 path != nullptr ? path : "(null)");
     return -1;
   }
-  struct sockaddr_un address;
-  memset(&address, 0, sizeof(address));
-  address.sun_family = AF_UNIX;
-  memcpy(address.sun_path, path, strlen(path));
 
   for (int i = 0; i < attempts; ++i) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);

@@ -1,6 +1,7 @@
 #include "ipc/packet_codec.h"
 
 #include <string.h>
+#include <sys/socket.h>
 
 #include <string>
 
@@ -46,6 +47,16 @@ void ParsePacketBody(const char* body, size_t length, Json::Value& value) {
     // Nesting beyond the reader's limit throws; such a body counts as
     // malformed, like any other.
   }
+}
+
+bool BuildUnixAddress(const char* path, struct sockaddr_un* address) {
+  memset(address, 0, sizeof(*address));
+  address->sun_family = AF_UNIX;
+  if (path == nullptr) return false;
+  size_t length = strlen(path);
+  if (length > kMaxSocketPath) return false;
+  memcpy(address->sun_path, path, length);
+  return true;
 }
 
 void EmptyValue(Json::Value& value) {

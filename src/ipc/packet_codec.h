@@ -4,6 +4,7 @@
 #define QUVAIDX_IPC_PACKET_CODEC_H_
 
 #include <stddef.h>
+#include <sys/un.h>
 
 #include <json/json.h>
 
@@ -30,6 +31,11 @@ size_t DecodeBodyLength(const unsigned char* header);
 // malformed or too deeply nested input `value` holds what the parser left.
 // Never throws.
 void ParsePacketBody(const char* body, size_t length, Json::Value& value);
+
+// Fills a zeroed Unix-domain address for `path`. Returns false, leaving
+// the address zeroed, when path is null or longer than kMaxSocketPath bytes:
+// such a path is refused rather than cut to a different one.
+bool BuildUnixAddress(const char* path, struct sockaddr_un* address);
 
 // Empties `value` after a failed exchange: an array or object loses its
 // members and keeps its type, any other value becomes null. (Json::Value's
