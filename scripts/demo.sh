@@ -1,0 +1,119 @@
+#!/usr/bin/env bash
+# A guided tour of the quvaidx tool.
+#
+#   scripts/demo.sh BUILD_DIR
+#
+# Starts the sample daemon (`quvaidx serve`) on a socket in a fresh temporary
+# directory, talks to it with `quvaidx send`, stops it with SIGTERM and
+# checks that it removed its socket. Everything it starts or creates is
+# removed on exit, however the script ends, so it can be run again at once.
+set -euo pipefail
+
+if [ $# -ne 1 ]; then
+  echo "usage: $0 BUILD_DIR   (for example: $0 build)" >&2
+  exit 2
+fi
+build=$1
+repo=$(cd "$(dirname "$0")/.." && pwd)
+# A relative BUILD_DIR is taken from the current directory, else from the
+# repository root.
+if [ -x "$build/tools/quvaidx" ]; then
+  tool=$(cd "$build" && pwd)/tools/quvaidx
+elif [ -x "$repo/$build/tools/quvaidx" ]; then
+  tool=$repo/$build/tools/quvaidx
+else
+  echo "demo: no quvaidx tool under $build/tools; build first:" >&2
+  echo "  cmake -S $repo -B $build && cmake --build $build" >&2
+  exit 2
+fi
+
+work=""
+server_pid=""
+cleanup() {
+  if [ -n "$server_pid" ] && kill -0 "$server_pid" 2>/dev/null; then
+    kill -TERM "$server_pid" 2>/dev/null || true
+    wait "$server_pid" 2>/dev/null || true
+  fi
+  if [ -n "$work" ]; then rm -rf "$work"; fi
+}
+# The traps come first, so that nothing made below can outlive the script.
+trap cleanup EXIT
+trap 'exit 130' INT
+trap 'exit 143' TERM
+
+work=$(mktemp -d /tmp/quvaidx-demo.XXXXXX)
+sock=$work/demo.sock
+
+heading() { printf '\n== %s\n' "$*"; }
+
+# show ARGS...: prints the command as it would be typed at a shell prompt,
+# runs it, and prints its exit status.
+show() {
+  local status=0 arg
+  printf '$ quvaidx'
+  for arg in "$@"; do
+    if [[ $arg =~ ^[A-Za-z0-9_./=:-]+$ ]]; then
+      printf ' %s' "$arg"
+    else
+      printf " '%s'" "${arg//\'/\'\\\'\'}"
+    fi
+  done
+  printf '\n'
+  timeout 10 "$tool" "$@" || status=$?
+  echo "(exit status $status)"
+}
+
+heading "Start the sample daemon in the background"
+echo "\$ quvaidx serve --socket $sock &"
+"$tool" serve --socket "$sock" >"$work/serve.out" 2>"$work/serve.err" &
+server_pid=$!
+for ((i = 0; i < 250; i++)); do
+  grep -qs "listening on" "$work/serve.out" && break
+  kill -0 "$server_pid" 2>/dev/null || break
+  sleep 0.02
+done
+if ! grep -qs "listening on" "$work/serve.out"; then
+  echo "demo: the daemon did not start:" >&2
+  cat "$work/serve.err" >&2
+  exit 1
+fi
+cat "$work/serve.out"
+
+heading "Handshake: the daemon proves its request layer answers"
+show send --socket "$sock" --handshake '{"command":"HANDSHAKE"}'
+
+heading "ECHO: the reply carries the request back under \"echo\""
+show send --socket "$sock" '{"command":"ECHO","path":"/share/video/a.mp4","size":1048576}'
+
+heading "The same, on one line with --compact"
+show send --socket "$sock" --compact '{"command":"ECHO","tags":["x","y"]}'
+
+heading "STATS: open connections (this one) and requests received so far
+(the --handshake exchange above counted as two)"
+show send --socket "$sock" '{"command":"STATS"}'
+
+heading "An unknown command: \"success\" is false, so the exit status is 1"
+show send --socket "$sock" '{"command":"REINDEX"}'
+
+heading "A malformed request never leaves the tool: exit status 2"
+show send --socket "$sock" '{"command":"ECHO",}' 2>&1
+
+heading "Stop the daemon with SIGTERM"
+echo "\$ kill -TERM $server_pid"
+kill -TERM "$server_pid"
+status=0
+wait "$server_pid" || status=$?
+server_pid=""
+sed -n '2,$p' "$work/serve.out"
+echo "(daemon exit status $status)"
+if [ -e "$sock" ]; then
+  echo "demo: the socket $sock is still there" >&2
+  exit 1
+fi
+echo "The socket $sock is gone."
+
+heading "No daemon any more: one attempt, then exit status 2"
+show send --socket "$sock" --attempts 1 '{"command":"HANDSHAKE"}' 2>&1
+
+echo
+echo "Demo finished; removing $work."

@@ -1,0 +1,54 @@
+// Helpers shared by the subcommands of the quvaidx tool: the command table
+// entry, exit statuses, error reporting, option checks and logging set-up.
+#ifndef QUVAIDX_TOOLS_CLI_H_
+#define QUVAIDX_TOOLS_CLI_H_
+
+#include <string>
+
+namespace quvaidx_cli {
+
+// Exit statuses shared by every subcommand.
+constexpr int kExitOk = 0;     // the work was done; a reply said success
+constexpr int kExitFalse = 1;  // a daemon answered without success
+constexpr int kExitError = 2;  // usage error, bad input or failed exchange
+
+// One subcommand. `run` receives the arguments that follow the tool's own
+// options, argv[0] being the subcommand's name, and returns the exit status.
+struct Command {
+  const char* name;
+  const char* summary;
+  int (*run)(int argc, char** argv);
+};
+
+// Prints "quvaidx COMMAND: MESSAGE" as one line on stderr.
+void PrintError(const char* command, const std::string& message);
+
+// Prints the error line followed by a hint to run COMMAND --help, and
+// returns kExitError.
+int UsageError(const char* command, const std::string& message);
+
+// Reports the getopt_long result `result` ('?' or ':') for the option just
+// read from argv as a usage error; returns kExitError. Call with opterr 0
+// and an option string that starts with ':'.
+int OptionError(const char* command, int result, char** argv);
+
+// Parses a whole decimal number within [min, max]; false for anything else
+// (empty text, signs outside the range, trailing characters, overflow).
+bool ParseInt(const char* text, int min, int max, int* out);
+
+// Checks that `path` can name a Unix-domain socket: not empty and at most
+// the library's limit in bytes. Prints one error line and returns false
+// otherwise.
+bool CheckSocketPath(const char* command, const std::string& path);
+
+// Opens the system log under the tool's name. Library log lines go there
+// only, never to the terminal, until EnableVerboseLogging is called.
+void InitLogging();
+
+// Copies every library log line to stderr as well, and lets progress and
+// debug lines through (threshold 7). Safe to call more than once.
+void EnableVerboseLogging();
+
+}  // namespace quvaidx_cli
+
+#endif  // QUVAIDX_TOOLS_CLI_H_

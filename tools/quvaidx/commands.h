@@ -1,0 +1,14 @@
+// Entry points of the quvaidx subcommands, one source file each. Every one
+// takes the arguments from its own name on (argv[0] is the subcommand) and
+// returns the process exit status.
+#ifndef QUVAIDX_TOOLS_COMMANDS_H_
+#define QUVAIDX_TOOLS_COMMANDS_H_
+
+namespace quvaidx_cli {
+
+int RunSend(int argc, char** argv);
+int RunServe(int argc, char** argv);
+
+}  // namespace quvaidx_cli
+
+#endif  // QUVAIDX_TOOLS_COMMANDS_H_
