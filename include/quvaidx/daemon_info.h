@@ -1,0 +1,43 @@
+// The directory of the index service's daemons: for each daemon's short
+// name, its pid file, its executable and its Unix-domain socket.
+//
+//   name        "pid"                            "bin" "sock" controld
+//   /var/run/quvaindexd.pid          /usr/quva/sbin/quvaindexd
+//   /tmp/quvaindexd_sock scand       /var/run/quvaindexscand.pid
+//   /usr/quva/sbin/quvaindexscand      /tmp/quvaindexscand_sock workerd
+//   /var/run/quvaindexworkerd.pid    /usr/quva/sbin/quvaindexworkerd
+//   /tmp/quvaindexworkerd_sock plugind     /var/run/quvaindexplugind.pid
+//   /usr/quva/sbin/quvaindexplugind    /tmp/quvaindexplugind_sock mediad
+//   /var/run/quvamediaparserd.pid    /usr/quva/sbin/quvamediaparserd
+//   /tmp/quvamediaparserd_sock
+//
+// Threads: a lookup of an unknown name inserts an empty entry, so one
+// instance must not be used by two threads at once; separate instances are
+// independent.
+#ifndef QUVAIDX_DAEMON_INFO_H_
+#define QUVAIDX_DAEMON_INFO_H_
+
+#include <map>
+#include <string>
+
+#include "quvaidx/export.h"
+
+class QUVAIDX_API DaemonInfo {
+ public:
+  // Fills the three maps with the table above.
+  DaemonInfo();
+
+  // Returns the path of `field` ("pid", "bin" or "sock", compared exactly)
+  // for the daemon `name`; an empty string for a name not in the table or
+  // any other field.
+  // REQUIRES: neither pointer is null.
+  std::string get(std::string name, const char* field);
+  std::string get(const char* name, const char* field);
+
+ private:
+  std::map<std::string, std::string> pid_files_;    // name -> pid file
+  std::map<std::string, std::string> executables_;  // name -> executable
+  std::map<std::string, std::string> sockets_;      // name -> socket path
+};
+
+#endif  // QUVAIDX_DAEMON_INFO_H_

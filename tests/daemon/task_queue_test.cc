@@ -1,0 +1,206 @@
+// Task queues on real System V message queues; every queue a test makes is
+// removed in TearDown.
+#include "quvaidx/task_queue.h"
+
+#include <fcntl.h>
+#include <sys/ipc.h>
+#include <sys/msg.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "support/fake_sleep.h"
+#include "support/fd_check.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using quvaidx::test::FakeSleep;
+using quvaidx::test::LogCapture;
+using quvaidx::test::TempDir;
+
+// A task whose compact JSON text, line feed included, is `size` bytes.
+Json::Value TaskOfTextSize(size_t size) {
+  Json::Value task(Json::objectValue);
+  task["k"] = std::string(size - 9, 't');
+  return task;
+}
+
+Json::Value Task(int n) {
+  Json::Value task(Json::objectValue);
+  task["n"] = n;
+  return task;
+}
+
+class TaskQueueTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    close(open(key_file_.c_str(), O_CREAT | O_WRONLY, 0600));
+    id_ = CreateMessageQueue(key_file_.c_str(), kProject, 64);
+    ASSERT_GE(id_, 0);
+  }
+  void TearDown() override { DeleteMessageQueue(key_file_.c_str(), kProject); }
+
+  // Bytes the kernel charges for the tasks now in the queue.
+  size_t QueuedBytes() {
+    struct msqid_ds status;
+    EXPECT_EQ(msgctl(id_, IPC_STAT, &status), 0);
+    return status.__msg_cbytes;
+  }
+
+  static constexpr int kProject = 7;
+  TempDir dir_;
+  std::string key_file_ = dir_.File("queue.key");
+  int id_ = -1;
+  FakeSleep sleep_;
+};
+
+TEST_F(TaskQueueTest, TextAreaIsTheSmallestClassThatHoldsTheZeroByte) {
+  const struct {
+    size_t text;
+    size_t area;
+  } kCases[] = {
+      {1023, 1024}, {1024, 4096}, {4095, 4096}, {4096, 8192}, {8191, 8192}};
+  for (const auto& c : kCases) {
+    ASSERT_EQ(PushTaskToQueue(id_, TaskOfTextSize(c.text), 1), 0) << c.text;
+    EXPECT_EQ(QueuedBytes(), c.area) << c.text;
+    Json::Value out;
+    ASSERT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
+    EXPECT_EQ(out, TaskOfTextSize(c.text));
+  }
+}
+
+TEST_F(TaskQueueTest, TextOf8192BytesIsRefused) {
+  LogCapture log;
+  EXPECT_EQ(PushTaskToQueue(id_, TaskOfTextSize(8192), 1), -1);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), 0);
+  ASSERT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(log.Normalized()[0].substr(0, 52),
+            "quvaidx_daemon:N [Error] message is too big: {\"k\":\"t");
+}
+
+TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
+  for (int type : {5, 2, 9, 2}) {
+    Json::Value task = Task(type);
+    ASSERT_EQ(PushTaskToQueue(id_, task, type), 0);
+  }
+  Json::Value out;
+  ASSERT_EQ(PopTaskFromQueue(id_, 9, false, 1, out), 0);  // exactly 9
+  EXPECT_EQ(out["n"].asInt(), 9);
+  ASSERT_EQ(PopTaskFromQueue(id_, -6, false, 1, out), 0);  // lowest <= 6
+  EXPECT_EQ(out["n"].asInt(), 2);
+  ASSERT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);  // oldest
+  EXPECT_EQ(out["n"].asInt(), 5);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), 1);
+  EXPECT_EQ(PopTaskFromQueue(id_, 3, false, 1, out), -1);  // none of type 3
+}
+
+TEST_F(TaskQueueTest, TypeMustBePositive) {
+  LogCapture log;
+  EXPECT_EQ(PushTaskToQueue(id_, Task(1), 0), -1);
+  EXPECT_EQ(PushTaskToQueue(id_, Task(1), -3), -1);
+  EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] msgsnd: Invalid argument"), 2);
+}
+
+TEST_F(TaskQueueTest, PushLeavesTheCallersTaskAlone) {
+  Json::Value task = Task(3);
+  ASSERT_EQ(PushTaskToQueue(id_, task, 1), 0);
+  EXPECT_EQ(task, Task(3));
+}
+
+TEST_F(TaskQueueTest, EmptyNonBlockingPopSleepsAfterEachAttempt) {
+  LogCapture log;
+  Json::Value out;
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 3, out), -1);
+  EXPECT_EQ(sleep_.calls(), 3);
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 0, out), -1);
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, false, -1, out), -1);
+  EXPECT_EQ(sleep_.calls(), 3);
+  EXPECT_TRUE(log.lines().empty());
+}
+
+TEST_F(TaskQueueTest, BlockingPopWaitsForAnotherProcess) {
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    usleep(50 * 1000);
+    int id = GetMessageQueue(key_file_.c_str(), kProject);
+    _exit(PushTaskToQueue(id, Task(42), 4) == 0 ? 0 : 1);
+  }
+  Json::Value out;
+  EXPECT_EQ(PopTaskFromQueue(id_, 4, true, 0, out), 0);  // attempts ignored
+  EXPECT_EQ(out["n"].asInt(), 42);
+  int status = 0;
+  waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+}
+
+TEST_F(TaskQueueTest, QueueRemovedUnderABlockingPopFails) {
+  LogCapture log;
+  std::thread remover([&] {
+    usleep(50 * 1000);
+    DeleteMessageQueue(key_file_.c_str(), kProject);
+  });
+  Json::Value out;
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, true, 1, out), -1);
+  remover.join();
+  EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] msgrcv: Identifier removed"),
+            1);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), -1);
+}
+
+TEST_F(TaskQueueTest, TextThatIsNotJsonStillLeavesTheQueue) {
+  struct {
+    long type;
+    char text[1024];
+  } raw = {1, "not json at all"};
+  ASSERT_EQ(msgsnd(id_, &raw, sizeof(raw.text), 0), 0);
+  Json::Value out;
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), 0);
+}
+
+TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeft) {
+  ASSERT_EQ(PushTaskToQueue(id_, Task(1), 1), 0);
+  int fresh = CreateMessageQueue(key_file_.c_str(), kProject, 2);
+  ASSERT_GE(fresh, 0);
+  EXPECT_EQ(GetNumOfMessageInQueue(fresh), 0);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), -1);  // the old queue is gone
+  struct msqid_ds status;
+  ASSERT_EQ(msgctl(fresh, IPC_STAT, &status), 0);
+  EXPECT_EQ(status.msg_qbytes, 2048u);
+  id_ = fresh;
+}
+
+TEST_F(TaskQueueTest, OpenDeleteAndCountWithoutAQueue) {
+  LogCapture log;
+  ASSERT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
+  EXPECT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
+  EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), -1);
+  char expected[512];
+  snprintf(expected, sizeof(expected),
+           "quvaidx_daemon:N [Error] msgget: No such file or directory, key: "
+           "%x, id: %d, path: %s,",
+           static_cast<unsigned>(ftok(key_file_.c_str(), kProject)), kProject,
+           key_file_.c_str());
+  EXPECT_EQ(log.Normalized(), (std::vector<std::string>{expected}));
+  EXPECT_EQ(GetNumOfMessageInQueue(-1), -1);
+  EXPECT_EQ(GetNumOfMessageInQueue(id_), -1);
+}
+
+TEST_F(TaskQueueTest, MissingKeyFileFailsEveryKeyedCall) {
+  LogCapture log;
+  std::string missing = dir_.File("missing");
+  EXPECT_EQ(CreateMessageQueue(missing.c_str(), 1, 64), -1);
+  EXPECT_EQ(GetMessageQueue(missing.c_str(), 1), -1);
+  EXPECT_EQ(DeleteMessageQueue(missing.c_str(), 1), -1);
+  EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] ftok: No such file or "
+                      "directory"),
+            3);
+}
+
+}  // namespace
