@@ -8,6 +8,7 @@
 #include <string>
 
 #include "util/hooks.h"
+#include "util/log_internal.h"
 
 int g_log_level = 3;
 
@@ -28,6 +29,19 @@ size_t FormatMessage(char* buf, const char* format, va_list args) {
 }
 
 }  // namespace
+
+namespace quvaidx {
+
+void LogDirect(int priority, const char* format, ...) {
+  char buf[kLogBufferSize];
+  va_list args;
+  va_start(args, format);
+  FormatMessage(buf, format, args);
+  va_end(args);
+  WriteLogLine(priority, buf);
+}
+
+}  // namespace quvaidx
 
 extern "C" {
 
