@@ -51,8 +51,10 @@ constexpr int kAcceptPauseMs = 100;
 struct EventArgs;
 
 // A daemon's request handler. It fills `reply` (see MakeResponse) and
-// returns 0 to have the reply sent; any other result closes the connection
-// without a reply.
+// returns 0 to have the reply sent; any other result ends the connection
+// without a reply and without reading further requests (replies already
+// queued for earlier requests of the same connection are still delivered
+// before it closes).
 typedef int (*EventHandler)(Json::Value& request, Json::Value& reply,
                             EventArgs* args);
 

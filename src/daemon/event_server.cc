@@ -42,6 +42,25 @@ void CloseConnection(struct bufferevent* bev) {
   bufferevent_free(bev);  // closes the socket
 }
 
+void CloseWhenFlushed(struct bufferevent* bev, void*) { CloseConnection(bev); }
+
+void CloseOnEvent(struct bufferevent* bev, short, void*) {
+  CloseConnection(bev);
+}
+
+// Ends a connection without dropping the replies already queued on it for
+// earlier requests of the same batch: stops reading at once and closes when
+// the output has been written (or writing failed).
+void FinishConnection(struct bufferevent* bev) {
+  if (evbuffer_get_length(bufferevent_get_output(bev)) == 0) {
+    CloseConnection(bev);
+    return;
+  }
+  bufferevent_disable(bev, EV_READ);
+  bufferevent_setcb(bev, nullptr, CloseWhenFlushed, CloseOnEvent, nullptr);
+  bufferevent_enable(bev, EV_WRITE);
+}
+
 bool IsOutOfDescriptors(int err) {
   return err == EMFILE || err == ENFILE || err == ENOBUFS || err == ENOMEM;
 }
@@ -116,7 +135,7 @@ PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
       AppLogError(3, "%s:%d [Error] [%s] packet too large: %zu bytes, fd = %d",
                   kModule, __LINE__, DaemonName(args), length,
                   static_cast<int>(bufferevent_getfd(bev)));
-      CloseConnection(bev);
+      FinishConnection(bev);
       return PacketOutcome::kClosed;
     }
   }
@@ -126,7 +145,7 @@ PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
   Json::Value reply(Json::objectValue);
   RecvPacketEv(bev, request);
   if (CallHandler(args, request, reply) != 0) {
-    CloseConnection(bev);
+    FinishConnection(bev);
     return PacketOutcome::kClosed;
   }
   bool too_large = false;

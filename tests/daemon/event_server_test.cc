@@ -242,6 +242,22 @@ TEST_F(EventServerTest, NonZeroHandlerResultClosesWithoutReply) {
   EXPECT_EQ(ReceiveBody(other), "{\"success\":true}\n");
 }
 
+TEST_F(EventServerTest, RefusalKeepsRepliesToEarlierPipelinedRequests) {
+  handler_ = [](Json::Value& request, Json::Value& reply) {
+    reply["echo"] = request["command"];
+    return request["command"] == "QUIT" ? -1 : 0;
+  };
+  Start();
+  int fd = Connect();
+  Send(fd, Request("FIRST") + Request("QUIT") + Request("NEVER"));
+  EXPECT_EQ(ReceiveBody(fd), "{\"echo\":\"FIRST\"}\n");
+  bool closed = false;
+  EXPECT_EQ(Receive(fd, 1, &closed), "");
+  EXPECT_TRUE(closed);
+  EXPECT_EQ(requests_.size(), 2u);
+  EXPECT_EQ(GetCurrentConnCount(), 0);
+}
+
 TEST_F(EventServerTest, ThrowingHandlerIsLoggedAndClosed) {
   LogCapture log;
   handler_ = [](Json::Value&, Json::Value&) -> int {
