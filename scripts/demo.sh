@@ -3,10 +3,13 @@
 #
 #   scripts/demo.sh BUILD_DIR
 #
-# Starts the sample daemon (`quvaidx serve`) on a socket in a fresh temporary
+# Lists the index daemons (`quvaidx daemons`), starts the sample daemon
+# (`quvaidx serve`) with a socket and a pid file in a fresh temporary
 # directory, talks to it with `quvaidx send`, stops it with SIGTERM and
-# checks that it removed its socket. Everything it starts or creates is
-# removed on exit, however the script ends, so it can be run again at once.
+# checks that it removed its socket and pid file; then takes a task queue
+# through create, push, count, pop and delete (`quvaidx taskq`). Everything
+# it starts or creates is removed on exit, however the script ends, so it
+# can be run again at once.
 set -euo pipefail
 
 if [ $# -ne 1 ]; then
@@ -29,10 +32,14 @@ fi
 
 work=""
 server_pid=""
+queue_key=""
 cleanup() {
   if [ -n "$server_pid" ] && kill -0 "$server_pid" 2>/dev/null; then
     kill -TERM "$server_pid" 2>/dev/null || true
     wait "$server_pid" 2>/dev/null || true
+  fi
+  if [ -n "$queue_key" ]; then
+    timeout 10 "$tool" taskq delete "$queue_key" 7 >/dev/null 2>&1 || true
   fi
   if [ -n "$work" ]; then rm -rf "$work"; fi
 }
@@ -43,6 +50,7 @@ trap 'exit 143' TERM
 
 work=$(mktemp -d /tmp/quvaidx-demo.XXXXXX)
 sock=$work/demo.sock
+pid_file=$work/demo.pid
 
 heading() { printf '\n== %s\n' "$*"; }
 
@@ -63,9 +71,13 @@ show() {
   echo "(exit status $status)"
 }
 
-heading "Start the sample daemon in the background"
-echo "\$ quvaidx serve --socket $sock &"
-"$tool" serve --socket "$sock" >"$work/serve.out" 2>"$work/serve.err" &
+heading "The index daemons: pid file, executable, socket, and whether alive"
+show daemons
+
+heading "Start the sample daemon in the background, with a pid file"
+echo "\$ quvaidx serve --socket $sock --pidfile $pid_file &"
+"$tool" serve --socket "$sock" --pidfile "$pid_file" \
+  >"$work/serve.out" 2>"$work/serve.err" &
 server_pid=$!
 for ((i = 0; i < 250; i++)); do
   grep -qs "listening on" "$work/serve.out" && break
@@ -78,6 +90,12 @@ if ! grep -qs "listening on" "$work/serve.out"; then
   exit 1
 fi
 cat "$work/serve.out"
+echo "\$ cat $pid_file"
+cat "$pid_file"
+echo
+
+heading "A second instance with the same pid file refuses to start"
+show serve --socket "$work/other.sock" --pidfile "$pid_file"
 
 heading "Handshake: the daemon proves its request layer answers"
 show send --socket "$sock" --handshake '{"command":"HANDSHAKE"}'
@@ -106,14 +124,36 @@ wait "$server_pid" || status=$?
 server_pid=""
 sed -n '2,$p' "$work/serve.out"
 echo "(daemon exit status $status)"
-if [ -e "$sock" ]; then
-  echo "demo: the socket $sock is still there" >&2
-  exit 1
-fi
-echo "The socket $sock is gone."
+for path in "$sock" "$pid_file"; do
+  if [ -e "$path" ]; then
+    echo "demo: $path is still there" >&2
+    exit 1
+  fi
+done
+echo "The socket and the pid file are gone."
 
 heading "No daemon any more: one attempt, then exit status 2"
 show send --socket "$sock" --attempts 1 '{"command":"HANDSHAKE"}' 2>&1
+
+heading "A task queue, named by a key file and a project number"
+queue_key=$work/queue.key
+: >"$queue_key"
+show taskq create "$queue_key" 7
+show taskq push "$queue_key" 7 '{"path":"/share/photo/a.jpg"}'
+show taskq push "$queue_key" 7 --type 2 '{"path":"/share/video/b.mp4"}'
+show taskq count "$queue_key" 7
+
+heading "Type 2 first, then whatever is oldest"
+show taskq pop "$queue_key" 7 --type 2
+show taskq pop "$queue_key" 7
+
+heading "Empty now: one attempt costs a second, exit status 1"
+show taskq pop "$queue_key" 7 --nowait --attempts 1 2>&1
+
+heading "Delete the queue"
+show taskq delete "$queue_key" 7
+queue_key=""
+show taskq count "$work/queue.key" 7 2>&1
 
 echo
 echo "Demo finished; removing $work."

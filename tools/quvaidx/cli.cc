@@ -6,6 +6,10 @@
 #include <stdlib.h>
 #include <syslog.h>
 
+#include <exception>
+#include <memory>
+#include <sstream>
+
 #include "quvaidx/ipc.h"
 #include "quvaidx/log.h"
 
@@ -16,7 +20,80 @@ namespace {
 // openlog keeps the pointer, so the ident must live as long as the process.
 constexpr char kLogIdent[] = "quvaidx";
 
+// Turns the reader's report ("* Line 1, Column 2\n  Message\n", possibly
+// followed by more errors) into one line about the first error
+// ("Line 1, Column 2: Message").
+std::string FirstError(const std::string& report) {
+  std::istringstream lines(report);
+  std::string line, result;
+  while (std::getline(lines, line)) {
+    size_t start = line.find_first_not_of(" \t");
+    if (start == std::string::npos) continue;
+    line = line.substr(start);
+    if (line.compare(0, 2, "* ") == 0) {
+      if (!result.empty()) break;  // the next error starts
+      line = line.substr(2);
+    }
+    if (!result.empty()) result += ": ";
+    result += line;
+  }
+  return result.empty() ? "unknown error" : result;
+}
+
 }  // namespace
+
+bool IsDaemonName(const std::string& name) {
+  for (const char* known : kDaemonNames) {
+    if (name == known) return true;
+  }
+  return false;
+}
+
+std::string DaemonNameList() {
+  std::string list;
+  for (const char* known : kDaemonNames) {
+    if (!list.empty()) list += ", ";
+    list += known;
+  }
+  return list;
+}
+
+bool ParseJsonObject(const char* command, const std::string& text,
+                     const char* what, const char* example, Json::Value* out) {
+  // Any value is read, so that one that is not an object gets its own
+  // message below.
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder["strictRoot"] = false;
+  std::string errors;
+  bool ok = false;
+  try {
+    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+    ok = reader->parse(text.data(), text.data() + text.size(), out, &errors);
+  } catch (const std::exception& e) {
+    errors = e.what();
+  }
+  if (!ok) {
+    PrintError(command,
+               std::string("invalid JSON ") + what + ": " + FirstError(errors));
+    return false;
+  }
+  if (!out->isObject()) {
+    PrintError(command, std::string("the ") + what +
+                            " must be a JSON object, such as '" + example +
+                            "'");
+    return false;
+  }
+  return true;
+}
+
+void PrintJson(const Json::Value& value, bool compact) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = compact ? "" : "  ";
+  std::string text = Json::writeString(builder, value);
+  fprintf(stdout, "%s\n", text.c_str());
+  fflush(stdout);
+}
 
 void PrintError(const char* command, const std::string& message) {
   fprintf(stderr, "quvaidx %s: %s\n", command, message.c_str());

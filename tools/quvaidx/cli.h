@@ -5,6 +5,8 @@
 
 #include <string>
 
+#include <json/json.h>
+
 namespace quvaidx_cli {
 
 // Exit statuses shared by every subcommand.
@@ -40,6 +42,29 @@ bool ParseInt(const char* text, int min, int max, int* out);
 // the library's limit in bytes. Prints one error line and returns false
 // otherwise.
 bool CheckSocketPath(const char* command, const std::string& path);
+
+// The short names of the index daemons, in the order of the library's
+// daemon directory (DaemonInfo), which offers no way to list them.
+constexpr const char* kDaemonNames[] = {"controld", "scand", "workerd",
+                                        "plugind", "mediad"};
+
+// True when `name` is one of kDaemonNames.
+bool IsDaemonName(const std::string& name);
+
+// "controld, scand, workerd, plugind, mediad", for error messages.
+std::string DaemonNameList();
+
+// Parses `text` as standard JSON (no comments, trailing commas, duplicate
+// keys or trailing text) holding an object. On failure prints one line,
+// "invalid JSON WHAT: <first error>" or "the WHAT must be a JSON object,
+// such as EXAMPLE", and returns false. Deep nesting counts as a syntax
+// error, never as a crash.
+bool ParseJsonObject(const char* command, const std::string& text,
+                     const char* what, const char* example, Json::Value* out);
+
+// Writes `value` and a line feed to stdout, indented by two spaces or, with
+// `compact`, on one line; flushes.
+void PrintJson(const Json::Value& value, bool compact);
 
 // Opens the system log under the tool's name. Library log lines go there
 // only, never to the terminal, until EnableVerboseLogging is called.

@@ -6,8 +6,10 @@
 
 namespace quvaidx_cli {
 
+int RunDaemons(int argc, char** argv);
 int RunSend(int argc, char** argv);
 int RunServe(int argc, char** argv);
+int RunTaskq(int argc, char** argv);
 
 }  // namespace quvaidx_cli
 

@@ -1,4 +1,5 @@
-// quvaidx: command-line access to the index daemons' sockets. The dispatcher
+// quvaidx: command-line access to the index daemons' sockets and task
+// queues. The dispatcher
 // reads the tool's own options, then hands the remaining arguments to the
 // subcommand named first.
 #include <getopt.h>
@@ -16,8 +17,11 @@ int RunHelp(int argc, char** argv);
 // Subcommands, in the order the usage text lists them. A new subcommand
 // adds one line here and one source file.
 constexpr Command kCommands[] = {
+    {"daemons", "list the index daemons and whether they are alive",
+     RunDaemons},
     {"send", "send one JSON request to a daemon and print its reply", RunSend},
-    {"serve", "run a sample daemon in the foreground", RunServe},
+    {"serve", "run a sample daemon", RunServe},
+    {"taskq", "create, fill, drain, count or delete a task queue", RunTaskq},
     {"help", "show the help of a command", RunHelp},
 };
 
@@ -32,7 +36,8 @@ void PrintUsage(FILE* out) {
   fprintf(out,
           "Usage: quvaidx [--verbose] COMMAND [OPTIONS] [ARGUMENTS]\n"
           "\n"
-          "Talks to the index daemons over their Unix-domain sockets.\n"
+          "Talks to the index daemons over their Unix-domain sockets and\n"
+          "works on their task queues.\n"
           "\n"
           "Commands:\n");
   for (const Command& command : kCommands) {

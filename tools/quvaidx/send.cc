@@ -7,15 +7,13 @@
 #include <getopt.h>
 #include <stdio.h>
 
-#include <exception>
-#include <memory>
-#include <sstream>
 #include <string>
 
 #include <json/json.h>
 
 #include "cli.h"
 #include "commands.h"
+#include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 
 namespace quvaidx_cli {
@@ -28,12 +26,17 @@ constexpr int kMaxAttempts = 3600;
 void PrintHelp() {
   printf(
       "Usage: quvaidx send --socket PATH [OPTIONS] JSON\n"
+      "       quvaidx send --daemon NAME [OPTIONS] JSON\n"
       "\n"
       "Sends the JSON object JSON as one request to the daemon listening on\n"
-      "the Unix-domain socket PATH and prints its reply.\n"
+      "the Unix-domain socket PATH, or on the socket of the index daemon\n"
+      "NAME, and prints its reply.\n"
       "\n"
       "Options:\n"
       "  -s, --socket PATH   the daemon's socket (at most %zu bytes)\n"
+      "  -d, --daemon NAME   the socket of the index daemon NAME, one of\n"
+      "                      %s\n"
+      "                      (see 'quvaidx daemons')\n"
       "      --handshake     have the daemon answer a HANDSHAKE request\n"
       "                      before the request is sent\n"
       "  -a, --attempts N    connection attempts, one second apart "
@@ -50,57 +53,16 @@ void PrintHelp() {
       "  2  usage error, invalid request, or no reply could be obtained\n"
       "\n"
       "Example:\n"
-      "  quvaidx send --socket /tmp/demo.sock '{\"command\":\"HANDSHAKE\"}'\n",
-      kMaxSocketPath, kDefaultAttempts);
-}
-
-// Turns the reader's report ("* Line 1, Column 2\n  Message\n", possibly
-// followed by more errors) into one line about the first error
-// ("Line 1, Column 2: Message").
-std::string FirstError(const std::string& report) {
-  std::istringstream lines(report);
-  std::string line, result;
-  while (std::getline(lines, line)) {
-    size_t start = line.find_first_not_of(" \t");
-    if (start == std::string::npos) continue;
-    line = line.substr(start);
-    if (line.compare(0, 2, "* ") == 0) {
-      if (!result.empty()) break;  // the next error starts
-      line = line.substr(2);
-    }
-    if (!result.empty()) result += ": ";
-    result += line;
-  }
-  return result.empty() ? "unknown error" : result;
+      "  quvaidx send --socket /tmp/demo.sock '{\"command\":\"HANDSHAKE\"}'\n"
+      "  quvaidx send --daemon scand --handshake '{\"command\":\"STATS\"}'\n",
+      kMaxSocketPath, DaemonNameList().c_str(), kDefaultAttempts);
 }
 
 // Parses `text` into `request`. On failure prints one line and returns
-// false. The reader limits nesting depth and throws beyond it, so deep input
-// is reported like any other syntax error.
+// false.
 bool ParseRequest(const std::string& text, Json::Value* request) {
-  // Standard JSON only: no comments, trailing commas or duplicate keys, and
-  // nothing after the value. Any value is read, so that a request that is
-  // not an object gets its own message below.
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder["strictRoot"] = false;
-  std::string errors;
-  bool ok = false;
-  try {
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    ok =
-        reader->parse(text.data(), text.data() + text.size(), request, &errors);
-  } catch (const std::exception& e) {
-    errors = e.what();
-  }
-  if (!ok) {
-    PrintError(kName, "invalid JSON request: " + FirstError(errors));
-    return false;
-  }
-  if (!request->isObject()) {
-    PrintError(kName,
-               "the request must be a JSON object, such as "
-               "'{\"command\":\"HANDSHAKE\"}'");
+  if (!ParseJsonObject(kName, text, "request", "{\"command\":\"HANDSHAKE\"}",
+                       request)) {
     return false;
   }
   size_t size = Json::FastWriter().write(*request).size();
@@ -113,12 +75,31 @@ bool ParseRequest(const std::string& text, Json::Value* request) {
   return true;
 }
 
-void PrintReply(const Json::Value& reply, bool compact) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = compact ? "" : "  ";
-  std::string text = Json::writeString(builder, reply);
-  fprintf(stdout, "%s\n", text.c_str());
-  fflush(stdout);
+// Resolves --socket and --daemon into the socket path. On failure prints
+// one line and returns false.
+bool ChooseSocket(const std::string& socket_arg, const std::string& daemon_arg,
+                  bool socket_given, bool daemon_given, std::string* path) {
+  if (socket_given && daemon_given) {
+    UsageError(kName, "give either --socket PATH or --daemon NAME, not both");
+    return false;
+  }
+  if (!socket_given && !daemon_given) {
+    UsageError(kName, "--socket PATH or --daemon NAME is required");
+    return false;
+  }
+  if (daemon_given) {
+    // Checked first: the directory's lookup answers an unknown name with
+    // an empty path, which would read as a missing option.
+    if (!IsDaemonName(daemon_arg)) {
+      PrintError(kName, "unknown daemon '" + daemon_arg +
+                            "'; known daemons: " + DaemonNameList());
+      return false;
+    }
+    *path = DaemonInfo().get(daemon_arg, "sock");
+  } else {
+    *path = socket_arg;
+  }
+  return CheckSocketPath(kName, *path);
 }
 
 // The daemon's verdict: only a boolean true "success" counts as success.
@@ -133,6 +114,7 @@ bool ReplySucceeded(const Json::Value& reply) {
 int RunSend(int argc, char** argv) {
   static const struct option kOptions[] = {
       {"socket", required_argument, nullptr, 's'},
+      {"daemon", required_argument, nullptr, 'd'},
       {"handshake", no_argument, nullptr, 'H'},
       {"attempts", required_argument, nullptr, 'a'},
       {"compact", no_argument, nullptr, 'c'},
@@ -140,17 +122,23 @@ int RunSend(int argc, char** argv) {
       {"help", no_argument, nullptr, 'h'},
       {nullptr, 0, nullptr, 0},
   };
-  std::string path;
+  std::string socket_arg, daemon_arg, path;
+  bool socket_given = false, daemon_given = false;
   bool handshake = false;
   bool compact = false;
   int attempts = kDefaultAttempts;
   optind = 0;
   opterr = 0;
   int c;
-  while ((c = getopt_long(argc, argv, ":s:a:cvh", kOptions, nullptr)) != -1) {
+  while ((c = getopt_long(argc, argv, ":s:d:a:cvh", kOptions, nullptr)) != -1) {
     switch (c) {
       case 's':
-        path = optarg;
+        socket_arg = optarg;
+        socket_given = true;
+        break;
+      case 'd':
+        daemon_arg = optarg;
+        daemon_given = true;
         break;
       case 'H':
         handshake = true;
@@ -182,8 +170,10 @@ int RunSend(int argc, char** argv) {
                                          "unexpected argument '") +
                                  argv[optind + 1] + "'");
   }
-  if (path.empty()) return UsageError(kName, "--socket PATH is required");
-  if (!CheckSocketPath(kName, path)) return kExitError;
+  if (!ChooseSocket(socket_arg, daemon_arg, socket_given, daemon_given,
+                    &path)) {
+    return kExitError;
+  }
 
   Json::Value value;
   if (!ParseRequest(argv[optind], &value)) return kExitError;
@@ -206,7 +196,7 @@ int RunSend(int argc, char** argv) {
                                    "or ended early)"));
     return kExitError;
   }
-  PrintReply(value, compact);
+  PrintJson(value, compact);
   return ReplySucceeded(value) ? kExitOk : kExitFalse;
 }
 

@@ -1,12 +1,18 @@
 // quvaidx serve: a sample daemon on the library's event server.
 //
-// It answers HANDSHAKE, ECHO and STATS and refuses everything else, runs in
-// the foreground until SIGINT or SIGTERM, and removes its socket when it
-// stops. It refuses to start on a path that holds anything but a stale
-// socket, so it deletes no other kind of file and never takes a socket away
-// from a daemon that still answers on it.
+// It answers HANDSHAKE, ECHO and STATS and refuses everything else, runs
+// until SIGINT or SIGTERM, and removes its socket when it stops. It refuses
+// to start on a path that holds anything but a stale socket, so it deletes
+// no other kind of file and never takes a socket away from a daemon that
+// still answers on it.
+//
+// It goes through a daemon's whole life in the library's order: wait for
+// the system to boot; with a pid file, refuse a second instance and, if
+// asked, detach (before any event base exists, since detaching forks); the
+// event base and the server; on stop, the socket and the pid file go.
 #include <errno.h>
 #include <getopt.h>
+#include <limits.h>
 #include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -23,13 +29,30 @@
 
 #include "cli.h"
 #include "commands.h"
+#include "quvahost/quvahost.h"
 #include "quvaidx/daemon.h"
 #include "quvaidx/ipc.h"
+#include "quvaidx/lifecycle.h"
+#include "quvaidx/log.h"
+#include "quvaidx/system.h"
 
 namespace quvaidx_cli {
 namespace {
 
 constexpr char kName[] = "serve";
+constexpr char kLogModule[] = "quvaidx_serve";
+
+// Set once the process has detached: its standard streams are on /dev/null
+// from then on, so failures go to the system log as well.
+bool g_detached = false;
+
+// Reports a failure on stderr and, once detached, in the system log.
+void Fail(const std::string& message) {
+  PrintError(kName, message);
+  if (g_detached) {
+    AppLogError(3, "%s:%d [Error] %s", kLogModule, __LINE__, message.c_str());
+  }
+}
 
 // The daemon's own state, reached through EventArgs.context.
 struct ServeState {
@@ -44,11 +67,13 @@ struct StopState {
 
 void PrintHelp() {
   printf(
-      "Usage: quvaidx serve --socket PATH [OPTIONS]\n"
+      "Usage: quvaidx serve --socket PATH [--pidfile FILE [--daemon]] "
+      "[OPTIONS]\n"
       "\n"
-      "Runs a sample daemon in the foreground on the Unix-domain socket PATH\n"
-      "until SIGINT or SIGTERM, then removes the socket. Once it accepts\n"
-      "connections it prints \"quvaidx serve: listening on PATH\".\n"
+      "Runs a sample daemon on the Unix-domain socket PATH until SIGINT or\n"
+      "SIGTERM, then removes the socket. Once it accepts connections it\n"
+      "prints \"quvaidx serve: listening on PATH\". Like an index daemon it\n"
+      "first waits until the system has finished booting.\n"
       "\n"
       "Requests it answers (by their \"command\" member):\n"
       "  HANDSHAKE  {\"success\": true}\n"
@@ -58,13 +83,21 @@ void PrintHelp() {
       "  others     {\"success\": false, \"reason\": \"unknown command\"}\n"
       "\n"
       "Options:\n"
-      "  -s, --socket PATH  where to listen (at most %zu bytes); a stale\n"
-      "                     socket there is replaced, any other file is not\n"
-      "  -v, --verbose      also show the library's log lines on stderr\n"
-      "  -h, --help         show this help\n"
+      "  -s, --socket PATH   where to listen (at most %zu bytes); a stale\n"
+      "                      socket there is replaced, any other file is not\n"
+      "  -p, --pidfile FILE  refuse to start while the process named in FILE\n"
+      "                      is alive (printing \"Daemon alive. No need to\n"
+      "                      start\"); else write this process's id into\n"
+      "                      FILE and remove FILE on exit\n"
+      "  -d, --daemon        with --pidfile: detach into the background\n"
+      "                      after the checks and print nothing more; wait\n"
+      "                      for FILE and the socket, stop it with\n"
+      "                      kill -TERM \"$(cat FILE)\"\n"
+      "  -v, --verbose       also show the library's log lines on stderr\n"
+      "  -h, --help          show this help\n"
       "\n"
-      "Exit status: 0 after a stop signal, 2 when it cannot start or stops\n"
-      "for another reason.\n",
+      "Exit status: 0 after a stop signal (with --daemon: once detached), 2\n"
+      "when it cannot start or stops for another reason.\n",
       kMaxSocketPath);
 }
 
@@ -138,7 +171,7 @@ bool PathIsFree(const std::string& path) {
 int Serve(const std::string& path) {
   event_base* base = event_base_new();
   if (base == nullptr) {
-    PrintError(kName, "cannot create the event loop");
+    Fail("cannot create the event loop");
     return kExitError;
   }
   StopState stop = {base, 0};
@@ -149,14 +182,16 @@ int Serve(const std::string& path) {
   int status = kExitError;
   if (sigint == nullptr || sigterm == nullptr ||
       evsignal_add(sigint, nullptr) || evsignal_add(sigterm, nullptr)) {
-    PrintError(kName, "cannot watch for SIGINT and SIGTERM");
+    Fail("cannot watch for SIGINT and SIGTERM");
   } else if (BuildServer(base, path.c_str(), &args) != 0) {
-    PrintError(kName, "cannot listen on " + path +
-                          " (is its directory there and writable? "
-                          "--verbose shows the library's report)");
+    Fail("cannot listen on " + path +
+         " (is its directory there and writable? --verbose shows the "
+         "library's report)");
   } else {
-    printf("quvaidx serve: listening on %s\n", path.c_str());
-    fflush(stdout);
+    if (!g_detached) {
+      printf("quvaidx serve: listening on %s\n", path.c_str());
+      fflush(stdout);
+    }
     event_base_dispatch(base);
     StopServer(path.c_str());
     // StopServer does not report whether the removal worked: look.
@@ -164,13 +199,15 @@ int Serve(const std::string& path) {
     bool removed = lstat(path.c_str(), &info) != 0 && errno == ENOENT;
     std::string outcome = (removed ? "removed " : "could not remove ") + path;
     if (stop.signal_number != 0) {
-      printf("quvaidx serve: stopped by %s; %s\n",
-             stop.signal_number == SIGINT ? "SIGINT" : "SIGTERM",
-             outcome.c_str());
-      fflush(stdout);
+      if (!g_detached) {
+        printf("quvaidx serve: stopped by %s; %s\n",
+               stop.signal_number == SIGINT ? "SIGINT" : "SIGTERM",
+               outcome.c_str());
+        fflush(stdout);
+      }
       status = kExitOk;
     } else {
-      PrintError(kName, "stopped accepting connections; " + outcome);
+      Fail("stopped accepting connections; " + outcome);
     }
   }
   if (sigint != nullptr) event_free(sigint);
@@ -180,23 +217,96 @@ int Serve(const std::string& path) {
   return status;
 }
 
+// Detaching moves the working directory to "/", so a relative path is made
+// absolute first. Returns false (with one error line) when the current
+// directory cannot be read.
+bool MakeAbsolute(std::string* path) {
+  if (path->empty() || (*path)[0] == '/') return true;
+  char buffer[PATH_MAX];
+  if (getcwd(buffer, sizeof(buffer)) == nullptr) {
+    PrintError(kName, std::string("cannot read the current directory: ") +
+                          strerror(errno));
+    return false;
+  }
+  *path = std::string(buffer) + "/" + *path;
+  return true;
+}
+
+// Once detached, the daemon can no longer report on the terminal, and the
+// library writes the pid file only after detaching: so the directories of
+// the pid file and the socket are checked beforehand. Prints one error line
+// and returns false when `path`'s directory is not writable.
+bool DirectoryWritable(const std::string& path, const char* what) {
+  std::string directory = path.substr(0, path.rfind('/'));
+  if (directory.empty()) directory = "/";
+  if (access(directory.c_str(), W_OK | X_OK) != 0) {
+    PrintError(kName, std::string("cannot create the ") + what + " " + path +
+                          ": " + directory + ": " + strerror(errno));
+    return false;
+  }
+  return true;
+}
+
+// Waits, as an index daemon does, until the host reports it has booted. On
+// a machine without the host's boot state this returns at once; otherwise
+// the wait is announced, since it may last up to a quarter of an hour.
+void WaitForBoot() {
+  int step = QUVASystemGetBootStep();
+  if (step != QUVA_BOOT_STEP_READY) {
+    printf(
+        "quvaidx serve: waiting for the system to finish booting (boot "
+        "step %d)\n",
+        step);
+    fflush(stdout);
+  }
+  WaitSystemReady();
+}
+
+// Takes the pid file: refuses a second instance, detaches with `detach`.
+// Returns false when the daemon must not run; the library has printed
+// "Daemon alive. No need to start" itself when another instance lives.
+bool TakePidFile(const std::string& pid_file, bool detach) {
+  int result =
+      detach ? BecomeDaemon(pid_file.c_str()) : BecomeProcess(pid_file.c_str());
+  // BecomeDaemon returns 0 only in the detached process; the original one
+  // has ended with status 0 inside it.
+  if (detach && result == 0) g_detached = true;
+  if (result == 0) return true;
+  if (QLIBCProcAliveByPidFile(pid_file.c_str()) != 1) {
+    Fail(std::string(detach ? "cannot detach or " : "cannot ") +
+         "write the pid file " + pid_file +
+         " (--verbose shows the library's report)");
+  }
+  return false;
+}
+
 }  // namespace
 
 int RunServe(int argc, char** argv) {
   static const struct option kOptions[] = {
       {"socket", required_argument, nullptr, 's'},
+      {"pidfile", required_argument, nullptr, 'p'},
+      {"daemon", no_argument, nullptr, 'd'},
       {"verbose", no_argument, nullptr, 'v'},
       {"help", no_argument, nullptr, 'h'},
       {nullptr, 0, nullptr, 0},
   };
-  std::string path;
+  std::string path, pid_file;
+  bool detach = false;
   optind = 0;
   opterr = 0;
   int c;
-  while ((c = getopt_long(argc, argv, ":s:vh", kOptions, nullptr)) != -1) {
+  while ((c = getopt_long(argc, argv, ":s:p:dvh", kOptions, nullptr)) != -1) {
     switch (c) {
       case 's':
         path = optarg;
+        break;
+      case 'p':
+        pid_file = optarg;
+        if (pid_file.empty()) return UsageError(kName, "--pidfile is empty");
+        break;
+      case 'd':
+        detach = true;
         break;
       case 'v':
         EnableVerboseLogging();
@@ -212,9 +322,26 @@ int RunServe(int argc, char** argv) {
     return UsageError(
         kName, std::string("unexpected argument '") + argv[optind] + "'");
   }
+  if (detach && pid_file.empty()) {
+    return UsageError(kName, "--daemon needs --pidfile FILE");
+  }
+  if (detach && (!MakeAbsolute(&path) || !MakeAbsolute(&pid_file))) {
+    return kExitError;
+  }
   if (!CheckSocketPath(kName, path)) return kExitError;
+  if (detach && (!DirectoryWritable(pid_file, "pid file") ||
+                 !DirectoryWritable(path, "socket"))) {
+    return kExitError;
+  }
+  WaitForBoot();
+  // The socket is checked before detaching, so that its errors still reach
+  // the terminal.
   if (!PathIsFree(path)) return kExitError;
-  return Serve(path);
+  if (pid_file.empty()) return Serve(path);
+  if (!TakePidFile(pid_file, detach)) return kExitError;
+  int status = Serve(path);
+  DeletePidFile(pid_file.c_str());
+  return status;
 }
 
 }  // namespace quvaidx_cli

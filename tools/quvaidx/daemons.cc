@@ -1,0 +1,155 @@
+// quvaidx daemons: the directory of the index daemons and which of them run.
+//
+// Paths come from the library's daemon directory (DaemonInfo); whether a
+// daemon is alive is the host's decision (QLIBCProcAliveByPidFile), the same
+// check that keeps a second instance from starting. Nothing is written and
+// no daemon is contacted.
+#include <getopt.h>
+#include <stdio.h>
+
+#include <string>
+#include <vector>
+
+#include <json/json.h>
+
+#include "cli.h"
+#include "commands.h"
+#include "quvahost/quvahost.h"
+#include "quvaidx/daemon_info.h"
+
+namespace quvaidx_cli {
+namespace {
+
+constexpr char kName[] = "daemons";
+
+struct Row {
+  std::string name, pid_file, executable, socket;
+  int pid;  // from the pid file; 0 when it has none
+  bool alive;
+};
+
+void PrintHelp() {
+  printf(
+      "Usage: quvaidx daemons [--json] [NAME...]\n"
+      "\n"
+      "Lists the index daemons with their pid file, executable and socket,\n"
+      "and whether each is alive: its pid file names a running process that\n"
+      "started before the file was written. Without NAMEs all are listed:\n"
+      "%s.\n"
+      "\n"
+      "Options:\n"
+      "  -j, --json     print a JSON array of objects with the members name,\n"
+      "                 pid_file, executable, socket, pid (null when the pid\n"
+      "                 file is missing or bad) and alive\n"
+      "  -v, --verbose  also show the library's log lines on stderr\n"
+      "  -h, --help     show this help\n"
+      "\n"
+      "Exit status: 0, or 2 on a usage error or an unknown NAME.\n",
+      DaemonNameList().c_str());
+}
+
+Row Describe(DaemonInfo& info, const std::string& name) {
+  Row row;
+  row.name = name;
+  row.pid_file = info.get(name, "pid");
+  row.executable = info.get(name, "bin");
+  row.socket = info.get(name, "sock");
+  int pid = QLIBCReadPidFile(row.pid_file.c_str());
+  row.pid = pid > 0 ? pid : 0;
+  row.alive = QLIBCProcAliveByPidFile(row.pid_file.c_str()) == 1;
+  return row;
+}
+
+void PrintJsonRows(const std::vector<Row>& rows) {
+  Json::Value list(Json::arrayValue);
+  for (const Row& row : rows) {
+    Json::Value item(Json::objectValue);
+    item["name"] = row.name;
+    item["pid_file"] = row.pid_file;
+    item["executable"] = row.executable;
+    item["socket"] = row.socket;
+    item["pid"] = row.pid > 0 ? Json::Value(row.pid) : Json::Value();
+    item["alive"] = row.alive;
+    list.append(item);
+  }
+  PrintJson(list, false);
+}
+
+// Columns as wide as their longest cell, two spaces apart; the last one is
+// not padded, so no line ends in blanks.
+void PrintTable(const std::vector<Row>& rows) {
+  std::vector<std::vector<std::string>> cells = {
+      {"NAME", "ALIVE", "PID", "PID FILE", "EXECUTABLE", "SOCKET"}};
+  for (const Row& row : rows) {
+    cells.push_back({row.name, row.alive ? "yes" : "no",
+                     row.pid > 0 ? std::to_string(row.pid) : "-", row.pid_file,
+                     row.executable, row.socket});
+  }
+  std::vector<size_t> width(cells[0].size(), 0);
+  for (const auto& line : cells) {
+    for (size_t i = 0; i < line.size(); ++i) {
+      if (line[i].size() > width[i]) width[i] = line[i].size();
+    }
+  }
+  for (const auto& line : cells) {
+    std::string text;
+    for (size_t i = 0; i < line.size(); ++i) {
+      text += line[i];
+      if (i + 1 < line.size()) text.append(width[i] - line[i].size() + 2, ' ');
+    }
+    printf("%s\n", text.c_str());
+  }
+  fflush(stdout);
+}
+
+}  // namespace
+
+int RunDaemons(int argc, char** argv) {
+  static const struct option kOptions[] = {
+      {"json", no_argument, nullptr, 'j'},
+      {"verbose", no_argument, nullptr, 'v'},
+      {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  bool json = false;
+  optind = 0;
+  opterr = 0;
+  int c;
+  while ((c = getopt_long(argc, argv, ":jvh", kOptions, nullptr)) != -1) {
+    switch (c) {
+      case 'j':
+        json = true;
+        break;
+      case 'v':
+        EnableVerboseLogging();
+        break;
+      case 'h':
+        PrintHelp();
+        return kExitOk;
+      default:
+        return OptionError(kName, c, argv);
+    }
+  }
+  std::vector<std::string> names;
+  for (int i = optind; i < argc; ++i) {
+    if (!IsDaemonName(argv[i])) {
+      PrintError(kName, std::string("unknown daemon '") + argv[i] +
+                            "'; known daemons: " + DaemonNameList());
+      return kExitError;
+    }
+    names.push_back(argv[i]);
+  }
+  if (names.empty())
+    names.assign(std::begin(kDaemonNames), std::end(kDaemonNames));
+  DaemonInfo info;
+  std::vector<Row> rows;
+  for (const std::string& name : names) rows.push_back(Describe(info, name));
+  if (json) {
+    PrintJsonRows(rows);
+  } else {
+    PrintTable(rows);
+  }
+  return kExitOk;
+}
+
+}  // namespace quvaidx_cli
