@@ -1,0 +1,198 @@
+// Index path rules: entry names, recycle bins, mount kinds through the fake
+// host, time texts under a fixed time zone, existence tests on real files.
+#include "quvaidx/path_rules.h"
+
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <time.h>
+#include <unistd.h>
+#include <utime.h>
+
+#include <fstream>
+#include <string>
+
+#include <gtest/gtest.h>
+
+#include "support/fake_host.h"
+#include "support/fd_check.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using quvahost::test::FakeHost;
+using quvahost::test::HostOp;
+using quvaidx::test::LogCapture;
+using quvaidx::test::TempDir;
+
+TEST(EntryNameShouldIndex, SkipsExactlyTheReservedNames) {
+  const struct {
+    const char* name;
+    int index;
+  } cases[] = {
+      {".", 0},          {"..", 0},         {"...", 1},       {".hidden", 1},
+      {".app", 0},       {"Photos.app", 0}, {"._Photos", 0},  {"._", 0},
+      {"Photos.APP", 1}, {"a.app.zip", 1},  {"app", 1},       {"#recycle", 0},
+      {"#recycle2", 1},  {"#Recycle", 1},   {"#snapshot", 0}, {"#snapshots", 1},
+      {".quvameta", 0},  {".Quvameta", 1},  {"a.mp4", 1},     {"_.x", 1},
+  };
+  for (const auto& c : cases)
+    EXPECT_EQ(c.index, EntryNameShouldIndex(c.name)) << c.name;
+  EXPECT_EQ(0, EntryNameShouldIndex(nullptr));
+}
+
+TEST(QUVAPathUnderRecyle, OnlyTheBinAfterTheShareName) {
+  const struct {
+    const char* path;
+    int under;
+  } cases[] = {
+      {"/vol1/video/#recycle", 1},
+      {"/vol1/video/#recycle/a.mp4", 1},
+      {"/vol1/video/#recycle/", 1},
+      {"/vol1/video/#recyclebin", 0},
+      {"/vol1/video/#recycle2/a", 0},
+      {"/vol1/video/#Recycle", 0},
+      {"/vol1/video", 0},
+      {"/vol1/video/", 0},
+      {"/vol1/video/a/#recycle", 0},
+      {"/vol1/#recycle", 0},
+      {"", 0},
+  };
+  for (const auto& c : cases)
+    EXPECT_EQ(c.under, QUVAPathUnderRecyle(c.path)) << c.path;
+  EXPECT_EQ(0, QUVAPathUnderRecyle(nullptr));
+}
+
+TEST(MountTests, AnswerByFilesystemTypeCode) {
+  const struct {
+    int code;
+    int remote, remote_or_image, ea_write;
+  } cases[] = {
+      {1, 0, 0, 1},   // ext4
+      {4, 0, 0, 1},   // tmpfs
+      {10, 1, 1, 0},  // NFS
+      {11, 1, 1, 0},  // CIFS
+      {12, 1, 1, 0},  // user-space filesystem
+      {13, 0, 1, 0},  // ISO 9660
+      {16, 0, 1, 0},  // romfs
+      {17, 1, 1, 0},  // Ceph, 9P
+      {18, 0, 0, 1},  // overlayfs
+  };
+  for (const auto& c : cases) {
+    FakeHost host;
+    host.Answer(HostOp::kGetFSType, {c.code});
+    EXPECT_EQ(c.remote, IndexIsPathRemoteMount("/vol1/x")) << c.code;
+    EXPECT_EQ(c.remote_or_image, IndexIsPathRemoteOrImageMount("/vol1/x"))
+        << c.code;
+    EXPECT_EQ(c.ea_write, IndexIsPathSupportEAWrite("/vol1/x")) << c.code;
+  }
+}
+
+// Type 12 counts as remote even where the host's table would not say so.
+TEST(MountTests, Type12IsRemoteWhateverTheHostTable) {
+  FakeHost host;
+  host.Answer(HostOp::kGetFSType, {12});
+  host.Answer(HostOp::kFSIsRemoteFS, {0});
+  host.Answer(HostOp::kFSIsImageFS, {0});
+  EXPECT_EQ(1, IndexIsPathRemoteMount("/x"));
+  EXPECT_EQ(1, IndexIsPathRemoteOrImageMount("/x"));
+  EXPECT_EQ(0, IndexIsPathSupportEAWrite("/x"));
+}
+
+TEST(MountTests, FailureIsLoggedAtDebugAndAnsweredSafely) {
+  LogCapture log;
+  FakeHost host;
+  host.Fail(HostOp::kGetFSType, ENOENT);
+  EXPECT_EQ(0, IndexIsPathRemoteMount("/nope"));
+  EXPECT_EQ(0, IndexIsPathRemoteOrImageMount("/nope"));
+  EXPECT_EQ(1, IndexIsPathSupportEAWrite("/nope"));
+  const std::string reason =
+      "reason=[(2)" + std::string(strerror(ENOENT)) + "]";
+  EXPECT_EQ(2, log.Count("quvaidx_file:N failed to statfs /nope, " + reason));
+  EXPECT_EQ(
+      1, log.Count("quvaidx_file:N failed to statfs, " + reason + ": /nope"));
+  for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
+}
+
+TEST(MountTests, MissingPathOnTheRealHost) {
+  LogCapture log;
+  EXPECT_EQ(0, IndexIsPathRemoteMount("/no/such/path/at/all"));
+  EXPECT_EQ(0, IndexIsPathRemoteOrImageMount("/no/such/path/at/all"));
+  EXPECT_EQ(1, IndexIsPathSupportEAWrite("/no/such/path/at/all"));
+  EXPECT_EQ(3u, log.lines().size());
+}
+
+class FixedTimeZone : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    const char* tz = getenv("TZ");
+    saved_ = tz ? tz : "";
+    had_ = tz != nullptr;
+    setenv("TZ", "QTZ-9", 1);  // nine hours east of UTC, no summer time
+    tzset();
+  }
+  void TearDown() override {
+    if (had_)
+      setenv("TZ", saved_.c_str(), 1);
+    else
+      unsetenv("TZ");
+    tzset();
+  }
+  std::string saved_;
+  bool had_ = false;
+};
+
+TEST_F(FixedTimeZone, TimeTextsAreLocalAndCutToTheirBuffers) {
+  FakeHost host;
+  QLIBCFileStatRecord record = {};
+  record.llCTime = 1425686703;  // 2015-03-07 09:05:03 in QTZ-9
+  record.llMTime = 1483228799;  // 2017-01-01 08:59:59
+  host.AnswerFileStat(record);
+  char c[32], m[32];
+  EXPECT_EQ(19, QUVAIndexCTimeMTimeGet("/f", c, sizeof(c), m, sizeof(m)));
+  EXPECT_STREQ("2015-03-07 09:05:03", c);
+  EXPECT_STREQ("2017-01-01 08:59:59", m);
+  char small[11];
+  EXPECT_EQ(19, QUVAIndexCTimeMTimeGet("/f", c, 0, small, sizeof(small)));
+  EXPECT_STREQ("2017-01-01", small);
+  EXPECT_STREQ("2015-03-07 09:05:03", c) << "size 0 must not be written";
+}
+
+TEST_F(FixedTimeZone, StatFailureReturnsTheHostResultBuffersUntouched) {
+  FakeHost host;
+  host.Fail(HostOp::kFileStat, ENOENT, -3);
+  char c[32] = "c", m[32] = "m";
+  EXPECT_EQ(-3, QUVAIndexCTimeMTimeGet("/f", c, sizeof(c), m, sizeof(m)));
+  EXPECT_STREQ("c", c);
+  EXPECT_STREQ("m", m);
+}
+
+TEST(ExistenceTests, RegularFilesDirectoriesAndLinks) {
+  TempDir dir;
+  const std::string file = dir.File("a.mp4"), sub = dir.File("sub");
+  std::ofstream(file) << "12345";
+  ASSERT_EQ(0, mkdir(sub.c_str(), 0755));
+  ASSERT_EQ(0, symlink(sub.c_str(), dir.File("to_sub").c_str()));
+  ASSERT_EQ(0, symlink(file.c_str(), dir.File("to_file").c_str()));
+  int64_t size = -7;
+  EXPECT_EQ(1, IsFileExist(file.c_str(), &size));
+  EXPECT_EQ(5, size);
+  EXPECT_EQ(1, IsFileExist(dir.File("to_file").c_str(), nullptr));
+  size = -7;
+  EXPECT_EQ(0, IsFileExist(sub.c_str(), &size));
+  EXPECT_EQ(-7, size) << "size out changed on a directory";
+  EXPECT_EQ(0, IsFileExist("/dev/null", &size));
+  EXPECT_EQ(0, IsFileExist(nullptr, &size));
+  EXPECT_EQ(1, IsDirExist(sub.c_str()));
+  EXPECT_EQ(1, IsDirExist(dir.File("to_sub").c_str()));
+  EXPECT_EQ(0, IsDirExist(file.c_str()));
+  EXPECT_EQ(0, IsDirExist(nullptr));
+  struct utimbuf times = {1000, 1425686703};
+  ASSERT_EQ(0, utime(file.c_str(), &times));
+  EXPECT_EQ(1425686703, QUVAIndexModifyTimeGet(file.c_str()));
+  EXPECT_EQ(0, QUVAIndexModifyTimeGet(dir.File("missing").c_str()));
+  EXPECT_EQ(0, QUVAIndexModifyTimeGet(nullptr));
+}
+
+}  // namespace
