@@ -24,7 +24,8 @@
 // "Daemon alive. No need to start" on standard output and returns -1,
 // leaving the file alone). Otherwise detaches with daemon(0, 0) (background,
 // new session, working directory /, standard streams on /dev/null) and
-// writes the detached process's id into `pid_file`.
+// writes the detached process's id into `pid_file` (a relative path is
+// taken from the working directory before detaching).
 // Returns 0 in the detached process; -1 when detaching failed, or when the
 // pid file could not be created or written (the process then stays
 // detached).

@@ -4,10 +4,13 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
+
+#include <string>
 
 #include "quvahost/quvahost.h"
 #include "quvaidx/log.h"
@@ -51,13 +54,23 @@ int WritePidFile(const char* pid_file) {
 
 int BecomeDaemon(const char* pid_file) {
   if (AnotherInstanceAlive(pid_file)) return -1;
+  // Detaching moves to /, so a relative pid-file path must be resolved
+  // first or the pid would be written somewhere else.
+  std::string absolute = pid_file;
+  if (pid_file[0] != '/') {
+    char* cwd = getcwd(nullptr, 0);
+    if (cwd != nullptr) {
+      absolute = std::string(cwd) + "/" + pid_file;
+      free(cwd);
+    }
+  }
   if (daemon(0, 0) != 0) {
     int err = errno;
     AppLogError(3, "%s:%d [Error] become a daemon (%s)", kModule, __LINE__,
                 strerror(err));
     return -1;
   }
-  return WritePidFile(pid_file);
+  return WritePidFile(absolute.c_str());
 }
 
 int BecomeProcess(const char* pid_file) {

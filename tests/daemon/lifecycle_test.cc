@@ -113,8 +113,11 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
-    // daemon(0, 0) ends this process; the detached one carries on.
-    if (BecomeDaemon(pid_file_.c_str()) != 0) _exit(3);
+    // daemon(0, 0) ends this process; the detached one carries on. The
+    // pid file is named relative to the working directory of the caller.
+    if (chdir(dir_.path().c_str()) != 0 || BecomeDaemon("d.pid") != 0) {
+      _exit(3);
+    }
     char cwd[64] = "";
     char in[64] = "";
     (void)!getcwd(cwd, sizeof(cwd));
