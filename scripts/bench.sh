@@ -18,7 +18,9 @@
 #   BENCH_NO_STRACE=1  skip the system-call counts
 #
 # Every step runs under `timeout`; with the defaults the whole script takes
-# about two and a half minutes on two cores. Sockets live under /tmp and are removed.
+# about three minutes on two cores. Sockets live under /tmp and are removed;
+# so are the task-queue benchmark's key file and message queues, also when it
+# is interrupted.
 set -uo pipefail
 
 build=${1:-build-bench}
@@ -28,6 +30,7 @@ min_time=${BENCH_MIN_TIME:-0.2}
 filter=${BENCH_FILTER:-}
 
 for b in quvaidx_server_bench quvaidx_exchange_bench quvaidx_framing_bench \
+         quvaidx_task_queue_bench quvaidx_mediainfo_bench quvaidx_classify_bench \
          quvaidx_bench_load; do
   if [ ! -x "$bin/$b" ]; then
     echo "bench.sh: $bin/$b not found; build with -DQUVAIDX_BUILD_BENCH=ON" >&2
@@ -54,7 +57,9 @@ echo "    compare the ratios, which come from interleaved runs)"
 status=0
 args=(--benchmark_repetitions="$reps" --benchmark_min_time="$min_time")
 [ -n "$filter" ] && args+=(--benchmark_filter="$filter")
-for b in quvaidx_framing_bench quvaidx_exchange_bench quvaidx_server_bench; do
+for b in quvaidx_framing_bench quvaidx_task_queue_bench \
+         quvaidx_mediainfo_bench quvaidx_classify_bench quvaidx_exchange_bench \
+         quvaidx_server_bench; do
   echo
   echo "######## $b"
   timeout 600 "${pin[@]}" "$bin/$b" "${args[@]}" || { echo "$b failed ($?)"; status=1; }
@@ -134,4 +139,7 @@ for kind in library raw; do
        "$per syscalls/exchange"
   per_call_table "$tmp/last-client.txt" "$n2"
 done
+
+echo
+timeout 600 bash "$(dirname "$0")/../bench/scan_bench.sh" "$build" || status=1
 exit $status

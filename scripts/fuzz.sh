@@ -9,6 +9,7 @@
 # exists; crash, leak and timeout inputs land in
 # BUILD_DIR/fuzz-artifacts/<target>/ and full logs in BUILD_DIR/fuzz-logs/.
 # Reproduce a finding with: BUILD_DIR/fuzz/<target> <artifact file>.
+# A run takes about the number of targets times SECONDS, plus start-up.
 # Exits non-zero when any target is missing or reports a finding.
 set -euo pipefail
 
@@ -23,7 +24,7 @@ seconds=${2:-30}
 
 root=$(cd "$(dirname "$0")/.." && pwd)
 build_dir=$(cd "$build_dir" && pwd)
-targets=(fuzz_event_server fuzz_recv_packet)
+targets=(fuzz_event_server fuzz_recv_packet fuzz_host_ini fuzz_host_pid_file fuzz_file_rules fuzz_mediainfo fuzz_text)
 
 # Findings must stop the run with a stack trace; libFuzzer already checks for
 # leaks after inputs whose allocations do not balance.

@@ -311,7 +311,8 @@ QUVAHOST_API int QLIBCFileStat(const char* path, int option,
  * ---------------------------------------------------------------------- */
 
 /* Returns the pid held in `pid_file` (> 0); -1 when the file cannot be
- * read or holds anything but one pid from 1 to INT_MAX (EINVAL). */
+ * read, is longer than 64 bytes, or holds anything but one pid from 1 to
+ * INT_MAX (EINVAL). */
 QUVAHOST_API int QLIBCReadPidFile(const char* pid_file);
 
 /* Returns 1 when the process named by `pid_file` is alive, else 0: the

@@ -9,5 +9,13 @@
 #include "quvaidx/log.h"
 #include "quvaidx/system.h"
 #include "quvaidx/task_queue.h"
+#include "quvaidx/index_requests.h"
+#include "quvaidx/mediainfo.h"
+#include "quvaidx/text.h"
+#include "quvaidx/codec_names.h"
+#include "quvaidx/ea_file.h"
+#include "quvaidx/media_type.h"
+#include "quvaidx/path_rules.h"
+#include "quvaidx/share_folder.h"
 
 #endif  // QUVAIDX_QUVAIDX_H_
