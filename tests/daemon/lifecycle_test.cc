@@ -32,33 +32,13 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::TempDir;
 
 std::string ReadFile(const std::string& path) {
-  std::ifstream in(path);
   std::stringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path).rdbuf();
   return text.str();
 }
 
 void WriteFile(const std::string& path, const std::string& text) {
   std::ofstream(path) << text;
-}
-
-// Waits up to two seconds for `path` to hold something.
-std::string AwaitFile(const std::string& path) {
-  auto end = std::chrono::steady_clock::now() + std::chrono::seconds(2);
-  std::string text;
-  while ((text = ReadFile(path)).empty() &&
-         std::chrono::steady_clock::now() < end) {
-    usleep(2000);
-  }
-  return text;
-}
-
-// A pid that no process has: a child that has been reaped.
-pid_t DeadPid() {
-  pid_t child = fork();
-  if (child == 0) _exit(0);
-  waitpid(child, nullptr, 0);
-  return child;
 }
 
 class LifecycleTest : public ::testing::Test {
@@ -67,25 +47,21 @@ class LifecycleTest : public ::testing::Test {
   std::string pid_file_ = dir_.File("d.pid");
 };
 
-TEST_F(LifecycleTest, ForegroundProcessWritesItsPidWithoutLineEnd) {
+// The pid goes in without a line end, replacing a dead instance's; a live
+// instance is refused, its pid file kept, and BecomeDaemon does not detach.
+TEST_F(LifecycleTest, OneInstanceAtATime) {
+  pid_t dead = fork();
+  if (dead == 0) _exit(0);
+  waitpid(dead, nullptr, 0);
+  WriteFile(pid_file_, std::to_string(dead) + "\n");
   ASSERT_EQ(BecomeProcess(pid_file_.c_str()), 0);
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
-}
-
-TEST_F(LifecycleTest, LiveInstanceIsRefusedAndItsPidFileKept) {
-  WriteFile(pid_file_, std::to_string(getpid()));
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
-  EXPECT_EQ(BecomeDaemon(pid_file_.c_str()), -1);  // and does not detach
+  EXPECT_EQ(BecomeDaemon(pid_file_.c_str()), -1);
   EXPECT_EQ(::testing::internal::GetCapturedStdout(),
             "Daemon alive. No need to start\n"
             "Daemon alive. No need to start\n");
-  EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
-}
-
-TEST_F(LifecycleTest, DeadInstanceIsReplaced) {
-  WriteFile(pid_file_, std::to_string(DeadPid()) + "\n");
-  ASSERT_EQ(BecomeProcess(pid_file_.c_str()), 0);
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
 }
 
@@ -130,8 +106,12 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   int status = 0;
   waitpid(child, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  std::string text = AwaitFile(report);
-  std::istringstream fields(text);
+  auto end = std::chrono::steady_clock::now() + std::chrono::seconds(2);
+  while (access(report.c_str(), F_OK) != 0 &&
+         std::chrono::steady_clock::now() < end) {
+    usleep(2000);
+  }
+  std::istringstream fields(ReadFile(report));
   std::string pid, leader, cwd, stdin_target;
   fields >> pid >> leader >> cwd >> stdin_target;
   EXPECT_NE(pid, std::to_string(child));
@@ -141,64 +121,35 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   EXPECT_EQ(stdin_target, "/dev/null");
 }
 
-TEST_F(LifecycleTest, UncreatablePidFileFails) {
+TEST_F(LifecycleTest, PidAndMarkerFiles) {
   LogCapture log;
   std::string bad = dir_.File("missing/d.pid");
   EXPECT_EQ(BecomeProcess(bad.c_str()), -1);
   EXPECT_EQ(log.Normalized(),
             (std::vector<std::string>{"quvaidx_daemon:N [Error] create " + bad +
                                       " (No such file or directory)"}));
-}
-
-TEST_F(LifecycleTest, PidAndMarkerFileRemoval) {
   EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);  // missing: still 0
-  EXPECT_EQ(CheckOut(pid_file_.c_str()), -1);
-  std::string marker = dir_.File("marker");
-  WriteFile(marker, "left over");
-  EXPECT_EQ(CheckIn(marker.c_str()), 0);
-  EXPECT_EQ(ReadFile(marker), "");
-  EXPECT_EQ(CheckOut(marker.c_str()), 0);
-  EXPECT_NE(access(marker.c_str(), F_OK), 0);
-  EXPECT_EQ(CheckIn(dir_.File("no/such/dir").c_str()), -1);
 }
 
-TEST_F(LifecycleTest, ExecutionTimeOfAFile) {
-  EXPECT_EQ(GetExecutionTime(dir_.File("missing").c_str()), 0);
-  WriteFile(pid_file_, "1");
-  int age = GetExecutionTime(pid_file_.c_str());
-  EXPECT_GE(age, 0);
-  EXPECT_LE(age, 1);
-}
-
-TEST(BootWaitTest, ReadyAtOnce) {
-  FakeHost host;
-  FakeSleep sleep;
-  host.Answer(HostOp::kSystemGetBootStep, {4});
-  WaitSystemReady();
-  EXPECT_EQ(host.Calls(HostOp::kSystemGetBootStep), 1);
-  EXPECT_EQ(sleep.calls(), 0);
-}
-
-TEST(BootWaitTest, PollsEveryTenSeconds) {
-  FakeHost host;
-  FakeSleep sleep;
-  host.Answer(HostOp::kSystemGetBootStep, {1, 2, 3, 4});
-  WaitSystemReady();
-  EXPECT_EQ(host.Calls(HostOp::kSystemGetBootStep), 4);
-  EXPECT_EQ(sleep.total_seconds(), 30u);
-}
-
-TEST(BootWaitTest, GivesUpAfterFifteenMinutesWithANotice) {
-  FakeHost host;
-  FakeSleep sleep;
-  LogCapture log(0);  // the notice is not held back by the log level
-  host.Answer(HostOp::kSystemGetBootStep, {2});
-  WaitSystemReady();
-  EXPECT_EQ(host.Calls(HostOp::kSystemGetBootStep), 91);
-  EXPECT_EQ(sleep.total_seconds(), 900u);
-  ASSERT_EQ(log.lines().size(), 1u);
-  EXPECT_EQ(log.lines()[0].priority, LOG_ERR);
-  EXPECT_EQ(log.Normalized()[0],
+// Ready at once, polled every ten seconds, or given up after fifteen
+// minutes with a notice that the log level does not hold back.
+TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
+  auto wait = [](std::initializer_list<int> steps, int calls, unsigned secs) {
+    FakeHost host;
+    FakeSleep sleep;
+    LogCapture log(0);
+    host.Answer(HostOp::kSystemGetBootStep, steps);
+    WaitSystemReady();
+    EXPECT_EQ(host.Calls(HostOp::kSystemGetBootStep), calls);
+    EXPECT_EQ(sleep.total_seconds(), secs);
+    return log.lines();
+  };
+  EXPECT_TRUE(wait({4}, 1, 0).empty());
+  EXPECT_TRUE(wait({1, 2, 3, 4}, 4, 30).empty());
+  std::vector<quvaidx::test::LogLine> notice = wait({2}, 91, 900);
+  ASSERT_EQ(notice.size(), 1u);
+  EXPECT_EQ(notice[0].priority, LOG_ERR);
+  EXPECT_EQ(quvaidx::test::NormalizeLine(notice[0].text),
             "quvaidx_system:N [NOTICE] system is not ready? start anyway.");
 }
 
@@ -220,22 +171,19 @@ TEST(ForkExecvTest, ChildRunsWithStreamsOnDevNull) {
   EXPECT_EQ(ReadFile(out), "/dev/null\n/dev/null\n/dev/null\n");
 }
 
-TEST(ForkExecvTest, MissingProgramStillYieldsAChildThatAborts) {
+// A missing program still yields a child, which aborts; a SA_NOCLDWAIT the
+// caller set is in force again afterwards.
+TEST(ForkExecvTest, MissingProgramAbortsAndNoChildWaitIsRestored) {
+  struct sigaction action = {};
+  action.sa_handler = SIG_DFL;
+  action.sa_flags = SA_NOCLDWAIT;
   char* argv[] = {const_cast<char*>("nothing"), nullptr};
   int pid = ForkExecv("/nonexistent/program", argv);
   ASSERT_GT(pid, 0);
   int status = 0;
   ASSERT_EQ(waitpid(pid, &status, 0), pid);
-  EXPECT_TRUE(WIFSIGNALED(status));
-  EXPECT_EQ(WTERMSIG(status), SIGABRT);
-}
-
-TEST(ForkExecvTest, NoChildWaitFlagIsRestored) {
-  struct sigaction action = {};
-  action.sa_handler = SIG_DFL;
-  action.sa_flags = SA_NOCLDWAIT;
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT);
   ASSERT_EQ(sigaction(SIGCHLD, &action, nullptr), 0);
-  char* argv[] = {const_cast<char*>("true"), nullptr};
   EXPECT_GT(ForkExecv("/bin/true", argv), 0);
   struct sigaction after;
   sigaction(SIGCHLD, nullptr, &after);

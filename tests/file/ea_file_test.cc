@@ -69,7 +69,7 @@ TEST(EADirBadParameters, NullPathNullBufferAndSizesBelowOne) {
   EXPECT_EQ(0, host.Calls(HostOp::kEADirPath));
 }
 
-TEST(GetEADirPath, HostMkdirFailureIsLoggedAndExistingDirNeedsNoCall) {
+TEST(EADirMaking, FailuresAreLoggedAndExistingDirNeedsNoCall) {
   TempDir dir;
   const std::string ea = dir.File(".quvameta/a.jpg");
   LogCapture log;
@@ -78,23 +78,15 @@ TEST(GetEADirPath, HostMkdirFailureIsLoggedAndExistingDirNeedsNoCall) {
   host.Fail(HostOp::kEAMKDir, EACCES);
   char buf[4096];
   EXPECT_EQ(-1, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
-  EXPECT_EQ(
-      1,
-      log.Count("quvaidx_eafile:N Make ea dir path error. eaDir path: " + ea));
+  EXPECT_EQ(1, log.Count("quvaidx_eafile:N Make ea dir path error. eaDir "
+                         "path: " +
+                         ea));
   host.Pass(HostOp::kEAMKDir);
   EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
   EXPECT_EQ(ea, buf);
-  EXPECT_EQ(2, host.Calls(HostOp::kEAMKDir));
   EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
   EXPECT_EQ(2, host.Calls(HostOp::kEAMKDir)) << "made an existing directory";
-}
-
-TEST(MakeEADir, UnmakableParentIsLoggedWithErrno) {
-  TempDir dir;
-  LogCapture log;
-  FakeHost host;
   host.AnswerEADirPath(dir.File("missing/.quvameta/a.jpg"));
-  char buf[4096];
   EXPECT_EQ(-1, MakeEADir("/any/a.jpg", buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Cannot mkdir " +
                          dir.File("missing/.quvameta") + ", error:2"));
@@ -115,68 +107,51 @@ class RealTree : public ::testing::Test {
   std::string media_, hidden_, ea_;
 };
 
-TEST_F(RealTree, BothFunctionsCreateTheHiddenAndTheEADirectory) {
+TEST_F(RealTree, BothFunctionsCreateTheDirectoriesAndKeepItems) {
   for (auto* fn : {MakeEADir, GetEADirPath}) {
     char buf[4096];
     ASSERT_EQ(0, fn(media_.c_str(), buf, sizeof(buf)));
     EXPECT_EQ(ea_, buf);
-    EXPECT_EQ(1, IsDirExist(hidden_.c_str()));
     EXPECT_EQ(1, IsDirExist(ea_.c_str()));
+    WriteFile(ea_ + "/thumb", "data");
+    EXPECT_EQ(0, fn(media_.c_str(), buf, sizeof(buf)));
+    EXPECT_EQ(1, IsFileExist((ea_ + "/thumb").c_str(), nullptr));
+    ASSERT_EQ(0, unlink((ea_ + "/thumb").c_str()));
     ASSERT_EQ(0, rmdir(ea_.c_str()));
-    ASSERT_EQ(0, rmdir(hidden_.c_str()));
   }
 }
 
-// What stands where a directory should be, and what MakeEADir must leave.
+// Non-directories in the way are replaced; nothing beyond them is touched.
 TEST_F(RealTree, MakeEADirReplacesNonDirectoriesButNothingBeyondThem) {
-  const std::string target_file = outside_.File("victim");
-  const std::string target_dir = outside_.File("elsewhere");
+  const std::string file = outside_.File("victim");
+  const std::string dir = outside_.File("elsewhere");
   const struct {
-    const char* what;
-    bool at_hidden;  // else at the EA directory
-    int kind;        // 0 file, 1 dangling link, 2 link to file, 3 link to dir
-  } cases[] = {
-      {"file at hidden", true, 0},
-      {"file at EA dir", false, 0},
-      {"dangling link at EA dir", false, 1},
-      {"link to file at hidden", true, 2},
-      {"link to file at EA dir", false, 2},
-      {"link to dir at EA dir", false, 3},
-  };
+    bool at_hidden;       // else at the EA directory
+    std::string link_to;  // "": a regular file
+  } cases[] = {{true, ""},   {false, ""},   {false, outside_.File("none")},
+               {true, file}, {false, file}, {false, dir}};
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.what);
-    WriteFile(target_file, "keep me");
-    mkdir(target_dir.c_str(), 0755);
+    SCOPED_TRACE(std::string(c.at_hidden ? "hidden " : "EA ") + c.link_to);
+    WriteFile(file, "keep me");
+    mkdir(dir.c_str(), 0755);
     if (!c.at_hidden) mkdir(hidden_.c_str(), 0755);
     const std::string spot = c.at_hidden ? hidden_ : ea_;
-    const std::string link_to[] = {"", outside_.File("none"), target_file,
-                                   target_dir};
-    if (c.kind == 0) {
+    if (c.link_to.empty()) {
       WriteFile(spot, "in the way");
     } else {
-      ASSERT_EQ(0, symlink(link_to[c.kind].c_str(), spot.c_str()));
+      ASSERT_EQ(0, symlink(c.link_to.c_str(), spot.c_str()));
     }
     char buf[4096];
     ASSERT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
     EXPECT_EQ(1, IsDirExist(hidden_.c_str()));
     EXPECT_EQ(1, IsDirExist(ea_.c_str()));
-    EXPECT_EQ(c.kind == 3, IsLink(ea_)) << "a link to a directory is kept";
-    EXPECT_EQ(1, IsFileExist(target_file.c_str(), nullptr))
-        << "link target lost";
-    EXPECT_EQ(1, IsDirExist(target_dir.c_str()));
+    EXPECT_EQ(c.link_to == dir, IsLink(ea_)) << "a link to a dir is kept";
+    EXPECT_EQ(1, IsFileExist(file.c_str(), nullptr)) << "link target lost";
+    EXPECT_EQ(1, IsDirExist(dir.c_str()));
     unlink(ea_.c_str());
     rmdir(ea_.c_str());
     rmdir(hidden_.c_str());
   }
-}
-
-TEST_F(RealTree, ExistingDirectoriesAndTheirItemsAreKept) {
-  char buf[4096];
-  ASSERT_EQ(0, mkdir(hidden_.c_str(), 0755));
-  EXPECT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));  // only the EA dir
-  WriteFile(ea_ + "/thumb", "data");
-  EXPECT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
-  EXPECT_EQ(1, IsFileExist((ea_ + "/thumb").c_str(), nullptr));
 }
 
 TEST_F(RealTree, ItemsArePreferredInOrderAndNeedTwoBytesToCount) {
@@ -199,12 +174,10 @@ TEST_F(RealTree, ItemsArePreferredInOrderAndNeedTwoBytesToCount) {
     const char *n1, *n2;
     int present;
     const char* path;
-  } cases[] = {
-      {"one", "big", 0, nullptr},  // a 1-byte item hides the big one
-      {"none", "two", 1, "two"},
-      {"big", "two", 1, "big"},
-      {"dir_item", "none", 0, nullptr},
-  };
+  } cases[] = {{"one", "big", 0, nullptr},  // a 1-byte item hides the big one
+               {"none", "two", 1, "two"},
+               {"big", "two", 1, "big"},
+               {"dir_item", "none", 0, nullptr}};
   for (const auto& c : cases) {
     SCOPED_TRACE(c.n1);
     char out[4096] = "untouched";

@@ -31,12 +31,10 @@ TEST(EntryNameShouldIndex, SkipsExactlyTheReservedNames) {
     const char* name;
     int index;
   } cases[] = {
-      {".", 0},          {"..", 0},         {"...", 1},       {".hidden", 1},
-      {".app", 0},       {"Photos.app", 0}, {"._Photos", 0},  {"._", 0},
-      {"Photos.APP", 1}, {"a.app.zip", 1},  {"app", 1},       {"#recycle", 0},
-      {"#recycle2", 1},  {"#Recycle", 1},   {"#snapshot", 0}, {"#snapshots", 1},
-      {".quvameta", 0},  {".Quvameta", 1},  {"a.mp4", 1},     {"_.x", 1},
-  };
+      {".", 0},          {"..", 0},         {"...", 1},       {".app", 0},
+      {"Photos.app", 0}, {"Photos.APP", 1}, {"a.app.zip", 1}, {"._", 0},
+      {"#recycle", 0},   {"#recycle2", 1},  {"#Recycle", 1},  {"#snapshot", 0},
+      {"#snapshots", 1}, {".quvameta", 0},  {".Quvameta", 1}, {"_.x", 1}};
   for (const auto& c : cases)
     EXPECT_EQ(c.index, EntryNameShouldIndex(c.name)) << c.name;
   EXPECT_EQ(0, EntryNameShouldIndex(nullptr));
@@ -46,104 +44,70 @@ TEST(QUVAPathUnderRecyle, OnlyTheBinAfterTheShareName) {
   const struct {
     const char* path;
     int under;
-  } cases[] = {
-      {"/vol1/video/#recycle", 1},
-      {"/vol1/video/#recycle/a.mp4", 1},
-      {"/vol1/video/#recycle/", 1},
-      {"/vol1/video/#recyclebin", 0},
-      {"/vol1/video/#recycle2/a", 0},
-      {"/vol1/video/#Recycle", 0},
-      {"/vol1/video", 0},
-      {"/vol1/video/", 0},
-      {"/vol1/video/a/#recycle", 0},
-      {"/vol1/#recycle", 0},
-      {"", 0},
-  };
+  } cases[] = {{"/vol1/video/#recycle", 1},
+               {"/vol1/video/#recycle/a.mp4", 1},
+               {"/vol1/video/#recyclebin", 0},
+               {"/vol1/video/#Recycle", 0},
+               {"/vol1/video/", 0},
+               {"/vol1/video/a/#recycle", 0},
+               {"/vol1/#recycle", 0},
+               {"", 0}};
   for (const auto& c : cases)
     EXPECT_EQ(c.under, QUVAPathUnderRecyle(c.path)) << c.path;
   EXPECT_EQ(0, QUVAPathUnderRecyle(nullptr));
 }
 
+// Type 12 counts as remote even where the host's table would not say so.
 TEST(MountTests, AnswerByFilesystemTypeCode) {
   const struct {
     int code;
+    bool host_table;  // else the host's remote and image tables say no
     int remote, remote_or_image, ea_write;
   } cases[] = {
-      {1, 0, 0, 1},   // ext4
-      {4, 0, 0, 1},   // tmpfs
-      {10, 1, 1, 0},  // NFS
-      {11, 1, 1, 0},  // CIFS
-      {12, 1, 1, 0},  // user-space filesystem
-      {13, 0, 1, 0},  // ISO 9660
-      {16, 0, 1, 0},  // romfs
-      {17, 1, 1, 0},  // Ceph, 9P
-      {18, 0, 0, 1},  // overlayfs
+      {1, true, 0, 0, 1},                         // ext4
+      {10, true, 1, 1, 0},                        // NFS
+      {12, true, 1, 1, 0},                        // user-space filesystem
+      {12, false, 1, 1, 0}, {13, true, 0, 1, 0},  // ISO 9660
+      {17, true, 1, 1, 0},                        // Ceph, 9P
+      {18, true, 0, 0, 1}                         // overlayfs
   };
   for (const auto& c : cases) {
     FakeHost host;
     host.Answer(HostOp::kGetFSType, {c.code});
-    EXPECT_EQ(c.remote, IndexIsPathRemoteMount("/vol1/x")) << c.code;
-    EXPECT_EQ(c.remote_or_image, IndexIsPathRemoteOrImageMount("/vol1/x"))
-        << c.code;
-    EXPECT_EQ(c.ea_write, IndexIsPathSupportEAWrite("/vol1/x")) << c.code;
+    if (!c.host_table) {
+      host.Answer(HostOp::kFSIsRemoteFS, {0});
+      host.Answer(HostOp::kFSIsImageFS, {0});
+    }
+    EXPECT_EQ(c.remote, IndexIsPathRemoteMount("/x")) << c.code;
+    EXPECT_EQ(c.remote_or_image, IndexIsPathRemoteOrImageMount("/x")) << c.code;
+    EXPECT_EQ(c.ea_write, IndexIsPathSupportEAWrite("/x")) << c.code;
   }
-}
-
-// Type 12 counts as remote even where the host's table would not say so.
-TEST(MountTests, Type12IsRemoteWhateverTheHostTable) {
-  FakeHost host;
-  host.Answer(HostOp::kGetFSType, {12});
-  host.Answer(HostOp::kFSIsRemoteFS, {0});
-  host.Answer(HostOp::kFSIsImageFS, {0});
-  EXPECT_EQ(1, IndexIsPathRemoteMount("/x"));
-  EXPECT_EQ(1, IndexIsPathRemoteOrImageMount("/x"));
-  EXPECT_EQ(0, IndexIsPathSupportEAWrite("/x"));
 }
 
 TEST(MountTests, FailureIsLoggedAtDebugAndAnsweredSafely) {
-  LogCapture log;
-  FakeHost host;
-  host.Fail(HostOp::kGetFSType, ENOENT);
-  EXPECT_EQ(0, IndexIsPathRemoteMount("/nope"));
-  EXPECT_EQ(0, IndexIsPathRemoteOrImageMount("/nope"));
-  EXPECT_EQ(1, IndexIsPathSupportEAWrite("/nope"));
-  const std::string reason =
-      "reason=[(2)" + std::string(strerror(ENOENT)) + "]";
-  EXPECT_EQ(2, log.Count("quvaidx_file:N failed to statfs /nope, " + reason));
-  EXPECT_EQ(
-      1, log.Count("quvaidx_file:N failed to statfs, " + reason + ": /nope"));
-  for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
+  for (bool real : {false, true}) {
+    LogCapture log;
+    FakeHost host;
+    if (!real) host.Fail(HostOp::kGetFSType, ENOENT);
+    const char* path = real ? "/no/such/path/at/all" : "/nope";
+    EXPECT_EQ(0, IndexIsPathRemoteMount(path));
+    EXPECT_EQ(0, IndexIsPathRemoteOrImageMount(path));
+    EXPECT_EQ(1, IndexIsPathSupportEAWrite(path));
+    const std::string reason =
+        "reason=[(2)" + std::string(strerror(ENOENT)) + "]";
+    EXPECT_EQ(2, log.Count("quvaidx_file:N failed to statfs " +
+                           std::string(path) + ", " + reason));
+    EXPECT_EQ(1, log.Count("quvaidx_file:N failed to statfs, " + reason + ": " +
+                           path));
+    for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
+  }
 }
 
-TEST(MountTests, MissingPathOnTheRealHost) {
-  LogCapture log;
-  EXPECT_EQ(0, IndexIsPathRemoteMount("/no/such/path/at/all"));
-  EXPECT_EQ(0, IndexIsPathRemoteOrImageMount("/no/such/path/at/all"));
-  EXPECT_EQ(1, IndexIsPathSupportEAWrite("/no/such/path/at/all"));
-  EXPECT_EQ(3u, log.lines().size());
-}
-
-class FixedTimeZone : public ::testing::Test {
- protected:
-  void SetUp() override {
-    const char* tz = getenv("TZ");
-    saved_ = tz ? tz : "";
-    had_ = tz != nullptr;
-    setenv("TZ", "QTZ-9", 1);  // nine hours east of UTC, no summer time
-    tzset();
-  }
-  void TearDown() override {
-    if (had_)
-      setenv("TZ", saved_.c_str(), 1);
-    else
-      unsetenv("TZ");
-    tzset();
-  }
-  std::string saved_;
-  bool had_ = false;
-};
-
-TEST_F(FixedTimeZone, TimeTextsAreLocalAndCutToTheirBuffers) {
+TEST(TimeTexts, LocalAndCutToTheirBuffers) {
+  const char* tz = getenv("TZ");
+  const std::string saved = tz ? tz : "";
+  setenv("TZ", "QTZ-9", 1);  // nine hours east of UTC, no summer time
+  tzset();
   FakeHost host;
   QLIBCFileStatRecord record = {};
   record.llCTime = 1425686703;  // 2015-03-07 09:05:03 in QTZ-9
@@ -157,15 +121,16 @@ TEST_F(FixedTimeZone, TimeTextsAreLocalAndCutToTheirBuffers) {
   EXPECT_EQ(19, QUVAIndexCTimeMTimeGet("/f", c, 0, small, sizeof(small)));
   EXPECT_STREQ("2017-01-01", small);
   EXPECT_STREQ("2015-03-07 09:05:03", c) << "size 0 must not be written";
-}
-
-TEST_F(FixedTimeZone, StatFailureReturnsTheHostResultBuffersUntouched) {
-  FakeHost host;
   host.Fail(HostOp::kFileStat, ENOENT, -3);
-  char c[32] = "c", m[32] = "m";
   EXPECT_EQ(-3, QUVAIndexCTimeMTimeGet("/f", c, sizeof(c), m, sizeof(m)));
-  EXPECT_STREQ("c", c);
-  EXPECT_STREQ("m", m);
+  EXPECT_STREQ("2015-03-07 09:05:03", c);
+  EXPECT_STREQ("2017-01-01 08:59:59", m);
+  if (tz) {
+    setenv("TZ", saved.c_str(), 1);
+  } else {
+    unsetenv("TZ");
+  }
+  tzset();
 }
 
 TEST(ExistenceTests, RegularFilesDirectoriesAndLinks) {

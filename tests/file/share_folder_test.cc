@@ -27,10 +27,10 @@ TEST(IndexStatus, SetsOrClearsOnlyWhatDiffersAndFreesEveryRecord) {
     bool set;
     size_t updates;
     unsigned after;
-  } cases[] = {
-      {0x00, true, 1, 0x20},  {0x20, true, 0, 0x20}, {0x21, false, 1, 0x01},
-      {0x01, false, 0, 0x01}, {0x25, true, 0, 0x25},
-  };
+  } cases[] = {{0x00, true, 1, 0x20},
+               {0x21, false, 1, 0x01},
+               {0x01, false, 0, 0x01},
+               {0x25, true, 0, 0x25}};
   for (const auto& c : cases) {
     FakeHost host;
     host.AddShare("video", "/vol1/video", c.before);
@@ -59,14 +59,10 @@ TEST(IndexStatus, MissingShareIsMinusOneAndFailedUpdateStillZero) {
 }
 
 TEST(IsDefaultShare, ThreeNamesInAnyCase) {
-  const struct {
-    const char* name;
-    int is;
-  } cases[] = {
-      {"photo", 1}, {"Photo", 1}, {"MUSIC", 1},  {"vIdEo", 1},  {"photos", 0},
-      {"phot", 0},  {"", 0},      {"movies", 0}, {"photo ", 0},
-  };
-  for (const auto& c : cases) EXPECT_EQ(c.is, IsDefaultShare(c.name)) << c.name;
+  for (const char* name : {"photo", "MUSIC", "vIdEo"})
+    EXPECT_EQ(1, IsDefaultShare(name)) << name;
+  for (const char* name : {"photos", "phot", "", "photo "})
+    EXPECT_EQ(0, IsDefaultShare(name)) << name;
   EXPECT_EQ(0, IsDefaultShare(nullptr));
 }
 
@@ -76,78 +72,65 @@ TEST(SharePath, ShareRelativePathsBecomeDiskPaths) {
   const struct {
     const char* path;
     int out_size;
-    int rc;
-    const char* out;
-  } cases[] = {
-      {"/video/movies/a.mkv", 64, 0, "/vol1/video/movies/a.mkv"},
-      {"/video", 64, 0, "/vol1/video"},
-      {"/video/", 64, 0, "/vol1/video"},
-      {"/video/a//", 64, 0, "/vol1/video/a/"},
-      {"/video/a", 8, 0, "/vol1/v"},  // cut to the out size
-      {"/Video/a", 64, -1, "untouched"},
-      {"/nope/a", 64, -1, "untouched"},
-      {"/", 64, -1, "untouched"},
-      {"video/a", 64, -1, "untouched"},  // not share-relative
-      {"", 64, -1, "untouched"},
-      {"/video/a", 0, -1, "untouched"},
-  };
+    const char* out;  // "untouched": -1
+  } cases[] = {{"/video/movies/a.mkv", 64, "/vol1/video/movies/a.mkv"},
+               {"/video/", 64, "/vol1/video"},
+               {"/video/a//", 64, "/vol1/video/a/"},
+               {"/video/a", 8, "/vol1/v"},  // cut to the out size
+               {"/Video/a", 64, "untouched"},
+               {"/", 64, "untouched"},
+               {"video/a", 64, "untouched"},  // not share-relative
+               {"", 64, "untouched"},
+               {"/video/a", 0, "untouched"}};
   for (const auto& c : cases) {
     char out[64] = "untouched";
-    EXPECT_EQ(c.rc, QUVAIndexSharePathGet(c.path, out, c.out_size)) << c.path;
+    EXPECT_EQ(strcmp(c.out, "untouched") ? 0 : -1,
+              QUVAIndexSharePathGet(c.path, out, c.out_size))
+        << c.path;
     EXPECT_STREQ(c.out, out) << c.path;
   }
   EXPECT_EQ(-1, QUVAIndexSharePathGet(nullptr, nullptr, 64));
   EXPECT_EQ(0, host.OutstandingShareRecords());
 }
 
-class DirInfoTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    memset(&info_, 0, sizeof(info_));
-    strcpy(info_.szGuid, "caller's");
-  }
-  TempDir dir_;
-  DirInfo info_;
-};
-
-TEST_F(DirInfoTest, InsideAShareWithAGuid) {
-  FakeHost host;
-  host.AddShare("video", dir_.path(), 0);
-  host.AnswerSectionValue("6f1c-guid");
-  ASSERT_EQ(0, GetDirInfo(dir_.path().c_str(), &info_));
-  EXPECT_EQ(dir_.path(), info_.szPath);
-  EXPECT_EQ(dir_.path().substr(dir_.path().rfind('/') + 1), info_.szName);
-  EXPECT_STREQ("6f1c-guid", info_.szGuid);
-  EXPECT_EQ(25u, strlen(info_.szCTime));  // "Sat Mar  7 09:05:03 2015\n"
-  EXPECT_EQ('\n', info_.szMTime[24]);
-  EXPECT_EQ(0, host.OutstandingShareRecords());
-}
-
-TEST_F(DirInfoTest, GuidUntouchedOutsideSharesOrWithoutAMapEntry) {
+TEST(DirInfo, GuidFromTheMapOnlyInsideAShare) {
+  TempDir dir;
+  DirInfo info = {};
+  strcpy(info.szGuid, "caller's");
   FakeHost host;
   host.AddShare("music", "/vol1/music", 0);
-  EXPECT_EQ(0, GetDirInfo(dir_.path().c_str(), &info_));
+  EXPECT_EQ(0, GetDirInfo(dir.path().c_str(), &info));  // outside shares
   EXPECT_EQ(0, host.Calls(HostOp::kFileGetSectionValue));
-  host.AddShare("video", dir_.path(), 0);
-  host.Fail(HostOp::kFileGetSectionValue, ENOENT);
-  EXPECT_EQ(0, GetDirInfo(dir_.path().c_str(), &info_));
+  host.AddShare("video", dir.path(), 0);
+  host.Fail(HostOp::kFileGetSectionValue, ENOENT);  // no map entry
+  EXPECT_EQ(0, GetDirInfo(dir.path().c_str(), &info));
   EXPECT_EQ(1, host.Calls(HostOp::kFileGetSectionValue));
-  EXPECT_STREQ("caller's", info_.szGuid);
+  EXPECT_STREQ("caller's", info.szGuid);
+  host.Pass(HostOp::kFileGetSectionValue);
+  host.AnswerSectionValue("6f1c-guid");
+  ASSERT_EQ(0, GetDirInfo(dir.path().c_str(), &info));
+  EXPECT_EQ(dir.path(), info.szPath);
+  EXPECT_EQ(dir.path().substr(dir.path().rfind('/') + 1), info.szName);
+  EXPECT_STREQ("6f1c-guid", info.szGuid);
+  EXPECT_EQ(25u, strlen(info.szCTime));  // "Sat Mar  7 09:05:03 2015\n"
+  EXPECT_EQ('\n', info.szMTime[24]);
   EXPECT_EQ(0, host.OutstandingShareRecords());
 }
 
-TEST_F(DirInfoTest, FilesMissingPathsAndBadArgumentsFail) {
+TEST(DirInfo, FilesMissingPathsAndBadArgumentsFail) {
+  TempDir dir;
+  DirInfo info = {};
   LogCapture log;
   FakeHost host;
-  std::ofstream(dir_.File("f")) << "x";
-  EXPECT_EQ(-1, GetDirInfo(dir_.File("f").c_str(), &info_));
-  EXPECT_EQ(-1, GetDirInfo(dir_.File("missing").c_str(), &info_));
+  std::ofstream(dir.File("f")) << "x";
+  EXPECT_EQ(-1, GetDirInfo(dir.File("f").c_str(), &info));
+  EXPECT_EQ(-1, GetDirInfo(dir.File("missing").c_str(), &info));
   EXPECT_TRUE(log.lines().empty());
-  EXPECT_EQ(-1, GetDirInfo(nullptr, &info_));
-  EXPECT_EQ(-1, GetDirInfo(dir_.path().c_str(), nullptr));
+  EXPECT_EQ(-1, GetDirInfo(nullptr, &info));
+  EXPECT_EQ(-1, GetDirInfo(dir.path().c_str(), nullptr));
   EXPECT_EQ(2, log.Count("quvaidx_folder:N Bad parameter."));
   log.Clear();
-  EXPECT_EQ(-1, GetDirInfo(".", &info_));  // a directory with no '/'
+  EXPECT_EQ(-1, GetDirInfo(".", &info));  // a directory with no '/'
   ASSERT_EQ(1u, log.lines().size());
   const std::string& text = log.lines()[0].text;
   EXPECT_EQ(0u, text.find("quvaidx_folder ("));

@@ -24,13 +24,9 @@ class PacketTest : public ::testing::Test {
     ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds_), 0);
   }
   void TearDown() override {
-    CloseA();
     CloseB();
+    close(a());
     EXPECT_TRUE(leaks_.NoLeak());
-  }
-  void CloseA() {
-    if (fds_[0] >= 0) close(fds_[0]);
-    fds_[0] = -1;
   }
   void CloseB() {
     if (fds_[1] >= 0) close(fds_[1]);
@@ -43,7 +39,7 @@ class PacketTest : public ::testing::Test {
     ASSERT_EQ(write(b(), bytes.data(), bytes.size()),
               static_cast<ssize_t>(bytes.size()));
   }
-  // Bytes waiting on a(), without blocking.
+  // Bytes waiting on fd, without blocking.
   std::string Pending(int fd) {
     std::string out;
     char buf[65536];
@@ -53,18 +49,19 @@ class PacketTest : public ::testing::Test {
     }
     return out;
   }
+  int Recv() {
+    got_ = Json::Value();
+    return RecvPacket(a(), got_);
+  }
 
   FdLeakCheck leaks_;
   int fds_[2] = {-1, -1};
+  Json::Value got_;
 };
 
 std::string Header(unsigned length, unsigned magic = kPacketMagic) {
-  std::string h(4, '\0');
-  h[0] = static_cast<char>(magic >> 8);
-  h[1] = static_cast<char>(magic & 0xff);
-  h[2] = static_cast<char>(length >> 8);
-  h[3] = static_cast<char>(length & 0xff);
-  return h;
+  return {static_cast<char>(magic >> 8), static_cast<char>(magic & 0xff),
+          static_cast<char>(length >> 8), static_cast<char>(length & 0xff)};
 }
 
 std::string Packet(const std::string& body) {
@@ -83,57 +80,41 @@ TEST_F(PacketTest, HandshakeGoesOutAsExactly28Bytes) {
   Json::Value request(Json::objectValue);
   request["command"] = "HANDSHAKE";
   ASSERT_EQ(SendPacket(a(), request), 0);
-  std::string expected =
-      std::string("\x15\xbe\x00\x18", 4) + "{\"command\":\"HANDSHAKE\"}\n";
-  EXPECT_EQ(Pending(b()), expected);
+  EXPECT_EQ(Pending(b()), std::string("\x15\xbe\x00\x18", 4) +
+                              "{\"command\":\"HANDSHAKE\"}\n");
   EXPECT_EQ(request["command"].asString(), "HANDSHAKE");  // unchanged
-}
-
-TEST_F(PacketTest, ZeroCountMakesNoSystemCall) {
-  // An invalid descriptor would fail any system call.
-  char byte = 0;
+  char byte = 0;  // a zero count makes no system call
   EXPECT_EQ(Writen(-1, &byte, 0), 0);
   EXPECT_EQ(Readn(-1, &byte, 0), 0);
 }
 
-TEST_F(PacketTest, RoundTripKeepsTheValue) {
-  Json::Value sent(Json::objectValue);
-  sent["path"] = "/share/Multimedia/\xe5\x86\x99\xe7\x9c\x9f.jpg";
-  sent["size"] = Json::UInt64(4294967301ull);
-  sent["list"].append(1);
-  sent["list"].append("two");
-  ASSERT_EQ(SendPacket(a(), sent), 0);
-  Json::Value got;
-  ASSERT_EQ(RecvPacket(b(), got), 0);
-  EXPECT_EQ(got, sent);
+// The magic is not checked; an empty body leaves the value null; bodies
+// that are not JSON, too deeply nested, or cut by a zero byte still succeed.
+TEST_F(PacketTest, OddBodiesAreReceived) {
+  Put(Header(8, 0x0000) + "{\"a\":1}\n" + Header(0) +
+      Packet("plain words, not json") + Packet(std::string(5000, '[')) +
+      Packet(std::string("{\"a\":1}\0{\"b\":2}", 15)));
+  ASSERT_EQ(Recv(), 0);
+  EXPECT_EQ(got_["a"].asInt(), 1);
+  ASSERT_EQ(Recv(), 0);
+  EXPECT_TRUE(got_.isNull());
+  EXPECT_EQ(Recv(), 0);
+  EXPECT_EQ(Recv(), 0);
+  ASSERT_EQ(Recv(), 0);
+  EXPECT_EQ(got_["a"].asInt(), 1);
+  EXPECT_FALSE(got_.isMember("b"));
 }
 
-TEST_F(PacketTest, MagicIsNotChecked) {
-  Put(Header(8, 0x0000) + "{\"a\":1}\n");
-  Json::Value got;
-  ASSERT_EQ(RecvPacket(a(), got), 0);
-  EXPECT_EQ(got["a"].asInt(), 1);
-}
-
-TEST_F(PacketTest, ZeroLengthBodyLeavesNullValueNull) {
-  Put(Header(0));
-  Json::Value got;
-  ASSERT_EQ(RecvPacket(a(), got), 0);
-  EXPECT_TRUE(got.isNull());
-}
-
-TEST_F(PacketTest, TruncatedHeaderIsFailureNotReset) {
-  Put(std::string("\x15\xbe", 2));
-  CloseB();
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), -1);
-}
-
-TEST_F(PacketTest, TruncatedBodyIsFailure) {
-  Put(Header(10) + "{\"a\"");
-  CloseB();
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), -1);
+TEST_F(PacketTest, TruncatedPacketsFailWithoutReset) {
+  for (std::string part : {std::string("\x15\xbe", 2), Header(10) + "{\"a\""}) {
+    int fds[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+    ASSERT_EQ(write(fds[1], part.data(), part.size()),
+              static_cast<ssize_t>(part.size()));
+    close(fds[1]);
+    EXPECT_EQ(RecvPacket(fds[0], got_), -1);
+    close(fds[0]);
+  }
 }
 
 TEST_F(PacketTest, PacketArrivingInPiecesIsReassembled) {
@@ -144,54 +125,24 @@ TEST_F(PacketTest, PacketArrivingInPiecesIsReassembled) {
       usleep(200);
     }
   });
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), 0);
+  EXPECT_EQ(Recv(), 0);
   writer.join();
-  EXPECT_TRUE(got["piece"].asBool());
+  EXPECT_TRUE(got_["piece"].asBool());
 }
 
-TEST_F(PacketTest, SendToClosedPeerIsBrokenPipeWithoutSignalOrLog) {
-  LogCapture log(7);
-  CloseB();
-  Json::Value value(Json::objectValue);
-  value["command"] = "HANDSHAKE";
-  EXPECT_EQ(SendPacket(a(), value), -2);  // a SIGPIPE would end the test
-  EXPECT_TRUE(log.lines().empty());
-}
-
-TEST_F(PacketTest, ResetWhileReadingIsMinusTwo) {
-  // Closing a Unix socket with unread data in it resets its peer.
+TEST_F(PacketTest, BrokenPipeAndResetAreMinusTwoWithoutSignalOrLog) {
   LogCapture log(7);
   Json::Value value(Json::objectValue);
   value["x"] = 1;
   ASSERT_EQ(SendPacket(a(), value), 0);
-  CloseB();
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), -2);
+  CloseB();  // with unread data in it: resets the peer
+  EXPECT_EQ(Recv(), -2);
+  EXPECT_EQ(SendPacket(a(), value), -2);  // a SIGPIPE would end the test
   EXPECT_TRUE(log.lines().empty());
 }
 
-TEST_F(PacketTest, BodyThatIsNotJsonStillSucceeds) {
-  Put(Packet("plain words, not json"));
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), 0);
-}
-
-TEST_F(PacketTest, BodyEndsAtEmbeddedZeroByte) {
-  Put(Packet(std::string("{\"a\":1}\0{\"b\":2}", 15)));
-  Json::Value got;
-  ASSERT_EQ(RecvPacket(a(), got), 0);
-  EXPECT_EQ(got["a"].asInt(), 1);
-  EXPECT_FALSE(got.isMember("b"));
-}
-
-TEST_F(PacketTest, DeeplyNestedBodyDoesNotThrow) {
-  Put(Packet(std::string(5000, '[')));
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), 0);
-}
-
-TEST_F(PacketTest, LargestBodyIsSentWhole) {
+TEST_F(PacketTest, SendLimitIs16380Bytes) {
+  LogCapture log;
   Json::Value value = ValueOfTextSize(kMaxSendBody);
   std::thread reader([&] {
     Json::Value got;
@@ -200,52 +151,31 @@ TEST_F(PacketTest, LargestBodyIsSentWhole) {
   });
   EXPECT_EQ(SendPacket(a(), value), 0);
   reader.join();
-}
-
-TEST_F(PacketTest, OversizedValueIsRefusedAndNothingWritten) {
-  LogCapture log;
-  for (size_t size : {kMaxSendBody + 1, size_t{65536 + 20}, size_t{200000}}) {
-    Json::Value value = ValueOfTextSize(size);
-    EXPECT_EQ(SendPacket(a(), value), -1) << size;
+  for (size_t size : {kMaxSendBody + 1, size_t{65536 + 20}}) {
+    Json::Value big = ValueOfTextSize(size);
+    EXPECT_EQ(SendPacket(a(), big), -1) << size;
   }
   EXPECT_EQ(Pending(b()), "");
-  ASSERT_EQ(log.lines().size(), 3u);
+  ASSERT_EQ(log.lines().size(), 2u);
   EXPECT_EQ(log.Normalized()[0],
             "quvaidx_ipc_core:N [Error] packet too large: 16381 bytes, "
             "limit 16380");
 }
 
-TEST_F(PacketTest, HeaderAnnouncingMoreThanTheBufferIsRefused) {
+TEST_F(PacketTest, ReceiveLimitIs16383Bytes) {
   LogCapture log;
-  Put(Header(16384) + "{}\n");
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), -1);
-  EXPECT_EQ(log.lines().size(), 1u);
-  EXPECT_EQ(Pending(a()), "{}\n");  // the body was not read
-  Put(Header(0xffff));
-  EXPECT_EQ(RecvPacket(a(), got), -1);
-}
-
-TEST_F(PacketTest, LargestReceivableBodyIsAccepted) {
   std::string body = "\"" + std::string(kMaxRecvBody - 3, 'q') + "\"\n";
   ASSERT_EQ(body.size(), kMaxRecvBody);
   std::thread writer([&] { Put(Packet(body)); });
-  Json::Value got;
-  EXPECT_EQ(RecvPacket(a(), got), 0);
+  EXPECT_EQ(Recv(), 0);
   writer.join();
-  EXPECT_EQ(got.asString().size(), kMaxRecvBody - 3);
-}
-
-TEST_F(PacketTest, OtherSocketErrorsAreLoggedAndFail) {
-  LogCapture log;
-  Json::Value value(Json::objectValue);
-  int not_a_socket = dup(STDERR_FILENO);
-  close(not_a_socket);
-  EXPECT_EQ(SendPacket(not_a_socket, value), -1);
-  EXPECT_EQ(RecvPacket(not_a_socket, value), -1);
-  ASSERT_EQ(log.lines().size(), 2u);
-  EXPECT_EQ(log.Normalized()[0],
-            "quvaidx_ipc_core:N [Error] 9, Bad file descriptor");
+  EXPECT_EQ(got_.asString().size(), kMaxRecvBody - 3);
+  Put(Header(16384) + "{}\n");
+  EXPECT_EQ(Recv(), -1);
+  EXPECT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(Pending(a()), "{}\n");  // the body was not read
+  Put(Header(0xffff));
+  EXPECT_EQ(Recv(), -1);
 }
 
 }  // namespace

@@ -1,10 +1,9 @@
-// Helpers for the tests of the host stand-in: a temporary directory that
-// serves as the host directory ($QUVA_HOST_ETC) and small file helpers.
+// Temporary directories, a temporary host directory and file helpers for
+// the tests of the host stand-in.
 #ifndef QUVAIDX_TESTS_PLATFORM_HOST_TEST_UTIL_H_
 #define QUVAIDX_TESTS_PLATFORM_HOST_TEST_UTIL_H_
 
 #include <stdlib.h>
-#include <sys/stat.h>
 
 #include <filesystem>
 #include <fstream>
@@ -15,20 +14,16 @@
 
 namespace quvahost::test {
 
-// A fresh directory under /tmp, removed with its contents at the end.
 class TempDir {
  public:
   TempDir() {
     char templ[] = "/tmp/quvahost-test-XXXXXX";
-    const char* made = mkdtemp(templ);
-    path_ = made != nullptr ? made : "";
+    path_ = mkdtemp(templ) != nullptr ? templ : "";
   }
   ~TempDir() {
     std::error_code ignored;
     if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
   }
-  TempDir(const TempDir&) = delete;
-  TempDir& operator=(const TempDir&) = delete;
   const std::string& path() const { return path_; }
   std::string File(const std::string& name) const { return path_ + "/" + name; }
 
@@ -36,38 +31,31 @@ class TempDir {
   std::string path_;
 };
 
-// A temporary host directory: QUVA_HOST_ETC points at it while the object
-// lives, and the previous value comes back after.
+// $QUVA_HOST_ETC points at this directory while it lives.
 class HostEtc : public TempDir {
  public:
   HostEtc() {
-    const char* old = getenv(QUVA_HOST_ETC_ENV);
-    had_old_ = old != nullptr;
-    if (had_old_) old_ = old;
+    if (const char* old = getenv(QUVA_HOST_ETC_ENV)) old_ = old;
     setenv(QUVA_HOST_ETC_ENV, path().c_str(), 1);
   }
   ~HostEtc() {
-    if (had_old_) {
-      setenv(QUVA_HOST_ETC_ENV, old_.c_str(), 1);
-    } else {
+    if (old_.empty())
       unsetenv(QUVA_HOST_ETC_ENV);
-    }
+    else
+      setenv(QUVA_HOST_ETC_ENV, old_.c_str(), 1);
   }
 
  private:
-  bool had_old_ = false;
   std::string old_;
 };
 
 inline void WriteFile(const std::string& path, const std::string& content) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out << content;
+  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
 }
 
 inline std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
   std::ostringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
 

@@ -14,33 +14,19 @@ namespace quvahost::test {
 namespace {
 
 const char kDatabase[] =
-    "# shares of this machine\n"
-    "[video]\n"
-    "path = /vol1/video\n"
-    "status = 0x20\n"
-    "\n"
-    "[movies]\n"
-    "path = /vol1/video/movies/\n"
-    "; no status: not indexed\n"
-    "[music]\n"
-    "  path=/vol1//music  \n"
-    "status = 1\n"
-    "[video]\n"
-    "path = /elsewhere\n"
-    "[broken-relative]\n"
-    "path = vol1/relative\n"
-    "[broken-dotdot]\n"
-    "path = /vol1/../etc\n"
-    "[broken-status]\n"
-    "path = /vol1/status\n"
-    "status = twenty\n"
-    "[no-path]\n"
-    "status = 0x20\n";
+    "# shares of this machine\n[video]\npath = /vol1/video\nstatus = 0x20\n\n"
+    "[movies]\npath = /vol1/video/movies/\n; no status: not indexed\n"
+    "[music]\n  path=/vol1//music  \nstatus = 1\n"
+    "[video]\npath = /elsewhere\n"  // a repeated section does not override
+    "[broken-relative]\npath = vol1/relative\n"
+    "[broken-dotdot]\npath = /vol1/../etc\n"
+    "[broken-status]\npath = /vol1/status\nstatus = twenty\n"
+    "[no-path]\nstatus = 0x20\n";
 
 class ShareDbTest : public ::testing::Test {
  protected:
-  void SetUp() override { WriteFile(etc_.File("shares.conf"), kDatabase); }
-  std::string DbPath() const { return etc_.File("shares.conf"); }
+  void SetUp() override { WriteFile(Db(), kDatabase); }
+  std::string Db() const { return etc_.File("shares.conf"); }
   HostEtc etc_;
 };
 
@@ -50,254 +36,155 @@ struct Found {
   unsigned status;
 };
 
-Found Get(const char* name) {
+// By name, or by path when `by_path`; the record must be null on failure.
+Found Get(const char* key, bool by_path = false) {
   ShareRecord* record = reinterpret_cast<ShareRecord*>(0x1);
-  Found found{QUVAShareGet(name, &record), "", "", 0};
+  Found found{by_path
+                  ? QUVAShareGetByAttrStr(key, QUVA_SHARE_ATTR_PATH, &record)
+                  : QUVAShareGet(key, &record),
+              "", "", 0};
+  EXPECT_EQ(found.result == 0, record != nullptr) << key;
   if (record != nullptr) {
-    found.name = record->szName;
-    found.path = record->szPath;
-    found.status = record->uStatus;
+    found = {found.result, record->szName, record->szPath, record->uStatus};
   }
   QUVAShareFree(record);
   return found;
 }
 
-Found GetByPath(const char* path) {
-  ShareRecord* record = reinterpret_cast<ShareRecord*>(0x1);
-  Found found{QUVAShareGetByAttrStr(path, QUVA_SHARE_ATTR_PATH, &record), "",
-              "", 0};
-  if (record != nullptr) {
-    found.name = record->szName;
-    found.path = record->szPath;
-    found.status = record->uStatus;
-  }
-  QUVAShareFree(record);
-  return found;
-}
-
-TEST_F(ShareDbTest, GetFillsNamePathAndStatus) {
+TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
   Found video = Get("video");
   EXPECT_EQ(video.result, 0);
   EXPECT_EQ(video.name, "video");
   EXPECT_EQ(video.path, "/vol1/video");
   EXPECT_EQ(video.status, 0x20u);
-}
-
-TEST_F(ShareDbTest, PathIsNormalizedAndStatusDefaultsToZero) {
   EXPECT_EQ(Get("movies").path, "/vol1/video/movies");
   EXPECT_EQ(Get("movies").status, 0u);
   EXPECT_EQ(Get("music").path, "/vol1/music");
   EXPECT_EQ(Get("music").status, 1u);
-}
-
-TEST_F(ShareDbTest, RepeatedSectionDoesNotOverrideFirst) {
-  EXPECT_EQ(Get("video").path, "/vol1/video");
-}
-
-TEST_F(ShareDbTest, BadOrUnknownSharesAreNotFoundAndRecordIsNull) {
   for (const char* name : {"photo", "Video", "broken-relative", "broken-dotdot",
                            "broken-status", "no-path", ""}) {
-    SCOPED_TRACE(name);
-    ShareRecord* record = reinterpret_cast<ShareRecord*>(0x1);
-    EXPECT_EQ(QUVAShareGet(name, &record), -1);
-    EXPECT_EQ(record, nullptr);
+    EXPECT_EQ(Get(name).result, -1) << name;
     EXPECT_EQ(QLIBCErrGet(), ENOENT);
   }
+  unlink(Db().c_str());
+  EXPECT_EQ(Get("video").result, -1);
+  EXPECT_EQ(QLIBCErrGet(), ENOENT);
 }
 
-TEST_F(ShareDbTest, NullArgumentsFailWithEinval) {
+TEST_F(ShareDbTest, BadArgumentsFailWithEinval) {
   ShareRecord* record = nullptr;
   EXPECT_EQ(QUVAShareGet(nullptr, &record), -1);
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
   EXPECT_EQ(QUVAShareGet("video", nullptr), -1);
   EXPECT_EQ(QUVAShareGetByAttrStr(nullptr, 1, &record), -1);
-  EXPECT_EQ(QUVAShareUpdate(nullptr), -1);
-  QUVAShareFree(nullptr);  // must not crash
-}
-
-TEST_F(ShareDbTest, MissingDatabaseFindsNothing) {
-  unlink(DbPath().c_str());
-  ShareRecord* record = nullptr;
-  EXPECT_EQ(QUVAShareGet("video", &record), -1);
+  EXPECT_EQ(QUVAShareGetByAttrStr("/vol1/video", 0, &record), -1);
+  EXPECT_EQ(QUVAShareGetByAttrStr("/vol1/video", 2, &record), -1);
+  EXPECT_EQ(QLIBCErrGet(), EINVAL);
   EXPECT_EQ(record, nullptr);
-  EXPECT_EQ(QLIBCErrGet(), ENOENT);
+  QUVAShareFree(nullptr);
 }
 
 TEST_F(ShareDbTest, StatusValueForms) {
-  struct Case {
+  const struct {
     const char* text;
-    bool valid;
-    unsigned status;
-  } cases[] = {{"0x20", true, 0x20},
-               {"0X2a", true, 0x2A},
-               {"32", true, 32},
-               {"0", true, 0},
-               {"4294967295", true, 0xFFFFFFFFu},
-               {"4294967296", false, 0},
-               {"0x", false, 0},
-               {"-1", false, 0},
-               {"0x1g", false, 0},
-               {"", false, 0},
-               {"1 2", false, 0}};
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.text);
-    WriteFile(DbPath(),
-              std::string("[s]\npath = /s\nstatus = ") + c.text + "\n");
+    long long status;  // -1: the share is invalid
+  } cases[] = {{"0X2a", 0x2A},     {"32", 32}, {"4294967295", 0xFFFFFFFF},
+               {"4294967296", -1}, {"0x", -1}, {"-1", -1},
+               {"0x1g", -1},       {"", -1},   {"1 2", -1}};
+  for (const auto& c : cases) {
+    WriteFile(Db(), std::string("[s]\npath = /s\nstatus = ") + c.text + "\n");
     Found found = Get("s");
-    EXPECT_EQ(found.result, c.valid ? 0 : -1);
-    if (c.valid) {
-      EXPECT_EQ(found.status, c.status);
+    EXPECT_EQ(found.result, c.status < 0 ? -1 : 0) << c.text;
+    if (c.status >= 0) {
+      EXPECT_EQ(found.status, c.status) << c.text;
     }
   }
 }
 
 TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
-  struct Case {
+  const struct {
     const char* path;
-    const char* share;  // null: no share holds it
-  } cases[] = {
-      {"/vol1/video", "video"},
-      {"/vol1/video/", "video"},
-      {"/vol1/video/a.mkv", "video"},
-      {"/vol1/video//a.mkv", "video"},
-      {"/vol1/videos/a.mkv", nullptr},
-      {"/vol1/vide", nullptr},
-      {"/vol1/video/movies", "movies"},
-      {"/vol1/video/movies/x/y.mkv", "movies"},
-      {"/vol1/video/./movies/x", "movies"},
-      {"/vol1/video/moviesX", "video"},
-      {"/vol1//music/a.mp3", "music"},
-      {"/vol1", nullptr},
-      {"/", nullptr},
-      {"/vol1/video/../music", nullptr},
-      {"vol1/video", nullptr},
-      {"/vol1/relative/x", nullptr},
-      {"/vol1/status/x", nullptr},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.path);
-    Found found = GetByPath(c.path);
-    if (c.share == nullptr) {
-      EXPECT_EQ(found.result, -1);
-      EXPECT_EQ(found.name, "");
-    } else {
-      EXPECT_EQ(found.result, 0);
-      EXPECT_EQ(found.name, c.share);
-    }
-  }
+    const char* share;  // "": no share holds it
+  } cases[] = {{"/vol1/video//a.mkv", "video"},
+               {"/vol1/videos/a.mkv", ""},
+               {"/vol1/video/./movies/x", "movies"},
+               {"/vol1/video/moviesX", "video"},
+               {"/vol1", ""},
+               {"/vol1/video/../music", ""},
+               {"vol1/video", ""},
+               {"/vol1/status/x", ""}};
+  for (const auto& c : cases)
+    EXPECT_EQ(Get(c.path, true).name, c.share) << c.path;
+  WriteFile(Db(), "[root]\npath = /\n[a]\npath = /a\n");
+  EXPECT_EQ(Get("/b/c", true).name, "root");
+  EXPECT_EQ(Get("/a/c", true).name, "a");
 }
 
-TEST_F(ShareDbTest, LookupByPathRejectsOtherAttributes) {
-  ShareRecord* record = nullptr;
-  EXPECT_EQ(QUVAShareGetByAttrStr("/vol1/video", 0, &record), -1);
-  EXPECT_EQ(QUVAShareGetByAttrStr("/vol1/video", 2, &record), -1);
-  EXPECT_EQ(record, nullptr);
-  EXPECT_EQ(QLIBCErrGet(), EINVAL);
-}
-
-TEST_F(ShareDbTest, RootShareHoldsEverything) {
-  WriteFile(DbPath(), "[root]\npath = /\n[a]\npath = /a\n");
-  EXPECT_EQ(GetByPath("/b/c").name, "root");
-  EXPECT_EQ(GetByPath("/a/c").name, "a");
-}
-
-ShareRecord* Fetch(const char* name) {
+// Updates `name` to `status` (with a scribbled path) and returns the file.
+std::string Update(const std::string& db, const char* name, unsigned status) {
   ShareRecord* record = nullptr;
   EXPECT_EQ(QUVAShareGet(name, &record), 0);
-  return record;
-}
-
-TEST_F(ShareDbTest, UpdateRewritesOnlyTheStatusLine) {
-  ShareRecord* record = Fetch("video");
-  record->uStatus &= ~QUVA_SHARE_STATUS_INDEXED;
+  if (record == nullptr) return "";
+  record->uStatus = status;
   strcpy(record->szPath, "/not/written");
   EXPECT_EQ(QUVAShareUpdate(record), 0);
   QUVAShareFree(record);
+  return ReadFile(db);
+}
+
+TEST_F(ShareDbTest, UpdateRewritesOrAddsOnlyTheStatusLine) {
   std::string expected = kDatabase;
   expected.replace(expected.find("status = 0x20"), 13, "status = 0x0");
-  EXPECT_EQ(ReadFile(DbPath()), expected);
-  EXPECT_EQ(Get("video").status, 0u);
+  EXPECT_EQ(Update(Db(), "video", 0), expected);
   EXPECT_EQ(Get("video").path, "/vol1/video");
-}
-
-TEST_F(ShareDbTest, UpdateAddsStatusLineWhenSectionHasNone) {
-  ShareRecord* record = Fetch("movies");
-  record->uStatus = QUVA_SHARE_STATUS_INDEXED;
-  EXPECT_EQ(QUVAShareUpdate(record), 0);
-  QUVAShareFree(record);
-  EXPECT_EQ(Get("movies").status, 0x20u);
-  std::string text = ReadFile(DbPath());
-  EXPECT_NE(text.find("[movies]\nstatus = 0x20\npath = /vol1/video/movies/\n"),
+  EXPECT_NE(Update(Db(), "movies", 0x20)
+                .find("[movies]\nstatus = 0x20\npath = /vol1/video/movies/\n"),
             std::string::npos);
+  EXPECT_EQ(Get("movies").status, 0x20u);
+  WriteFile(Db(), "[a]\npath = /a");  // no final line end
+  EXPECT_EQ(Update(Db(), "a", 5), "[a]\nstatus = 0x5\npath = /a");
 }
 
-TEST_F(ShareDbTest, UpdateKeepsFileWithoutFinalLineEnd) {
-  WriteFile(DbPath(), "[a]\npath = /a");
-  ShareRecord* record = Fetch("a");
-  record->uStatus = 5;
-  EXPECT_EQ(QUVAShareUpdate(record), 0);
-  QUVAShareFree(record);
-  EXPECT_EQ(ReadFile(DbPath()), "[a]\nstatus = 0x5\npath = /a");
-}
-
-TEST_F(ShareDbTest, UpdateOfUnknownShareFailsAndChangesNothing) {
+TEST_F(ShareDbTest, RefusedUpdateChangesNothing) {
   ShareRecord record{};
   strcpy(record.szName, "photo");
   EXPECT_EQ(QUVAShareUpdate(&record), -1);
   EXPECT_EQ(QLIBCErrGet(), ENOENT);
-  EXPECT_EQ(ReadFile(DbPath()), kDatabase);
-}
-
-TEST_F(ShareDbTest, UpdateRejectsUnterminatedName) {
-  ShareRecord record;
-  memset(&record, 'v', sizeof record);
+  memset(&record, 'v', sizeof record);  // unterminated name
   EXPECT_EQ(QUVAShareUpdate(&record), -1);
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
-  EXPECT_EQ(ReadFile(DbPath()), kDatabase);
+  EXPECT_EQ(QUVAShareUpdate(nullptr), -1);
+  EXPECT_EQ(ReadFile(Db()), kDatabase);
 }
 
-TEST_F(ShareDbTest, UpdateKeepsModeAndLeavesNoTemporaryFile) {
-  chmod(DbPath().c_str(), 0640);
-  ShareRecord* record = Fetch("music");
-  record->uStatus = 0x21;
-  EXPECT_EQ(QUVAShareUpdate(record), 0);
-  QUVAShareFree(record);
+TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
+  std::string target = etc_.File("real.conf");
+  rename(Db().c_str(), target.c_str());
+  ASSERT_EQ(symlink(target.c_str(), Db().c_str()), 0);
+  chmod(target.c_str(), 0640);
+  Update(Db(), "music", 0x21);
   struct stat st;
-  ASSERT_EQ(stat(DbPath().c_str(), &st), 0);
+  ASSERT_EQ(lstat(Db().c_str(), &st), 0);
+  EXPECT_TRUE(S_ISLNK(st.st_mode));
+  ASSERT_EQ(stat(target.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0640u);
-  int entries = 0;
+  EXPECT_EQ(Get("music").status, 0x21u);
   for (const auto& entry : std::filesystem::directory_iterator(etc_.path())) {
     std::string name = entry.path().filename();
-    EXPECT_TRUE(name == "shares.conf" || name == "shares.conf.lock") << name;
-    ++entries;
+    EXPECT_TRUE(name == "shares.conf" || name == "real.conf" ||
+                name == "shares.conf.lock")
+        << name;
   }
-  EXPECT_EQ(entries, 2);
 }
 
-TEST_F(ShareDbTest, UpdateThroughSymbolicLinkKeepsTheLink) {
-  std::string target = etc_.File("real.conf");
-  rename(DbPath().c_str(), target.c_str());
-  ASSERT_EQ(symlink(target.c_str(), DbPath().c_str()), 0);
-  ShareRecord* record = Fetch("video");
-  record->uStatus = 0;
-  EXPECT_EQ(QUVAShareUpdate(record), 0);
-  QUVAShareFree(record);
-  struct stat st;
-  ASSERT_EQ(lstat(DbPath().c_str(), &st), 0);
-  EXPECT_TRUE(S_ISLNK(st.st_mode));
-  EXPECT_EQ(Get("video").status, 0u);
-}
-
-// Several processes flip the status of their own share many times while
-// the parent reads: no update is lost and no read sees a broken file.
+// Processes flip the status of their own share while the parent reads: no
+// update is lost and no read sees a broken file.
 TEST_F(ShareDbTest, ConcurrentUpdatesFromProcessesLoseNothing) {
   const int kWriters = 4, kRounds = 25;
   std::string db;
-  for (int w = 0; w < kWriters; ++w) {
-    db += "[s" + std::to_string(w) + "]\npath = /s" + std::to_string(w) +
-          "\nstatus = 0\n";
-  }
-  WriteFile(DbPath(), db);
+  for (int w = 0; w < kWriters; ++w)
+    db += "[s" + std::to_string(w) + "]\npath = /s" + std::to_string(w) + "\n";
+  WriteFile(Db(), db);
   pid_t children[kWriters];
   for (int w = 0; w < kWriters; ++w) {
     children[w] = fork();
@@ -315,19 +202,16 @@ TEST_F(ShareDbTest, ConcurrentUpdatesFromProcessesLoseNothing) {
     }
   }
   int bad_reads = 0;
-  for (int i = 0; i < 200; ++i) {
-    if (Get("s0").result != 0 || Get("s3").result != 0) ++bad_reads;
-  }
+  for (int i = 0; i < 200; ++i)
+    bad_reads += Get("s0").result != 0 || Get("s3").result != 0;
   for (pid_t child : children) {
     int status = 0;
     ASSERT_EQ(waitpid(child, &status, 0), child);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   }
   EXPECT_EQ(bad_reads, 0);
-  for (int w = 0; w < kWriters; ++w) {
-    EXPECT_EQ(Get(("s" + std::to_string(w)).c_str()).status,
-              static_cast<unsigned>(kRounds));
-  }
+  for (int w = 0; w < kWriters; ++w)
+    EXPECT_EQ(Get(("s" + std::to_string(w)).c_str()).status, unsigned(kRounds));
 }
 
 }  // namespace

@@ -32,20 +32,13 @@ using quvaidx::test::RunUnprivileged;
 using quvaidx::test::TempDir;
 
 std::string ReadFile(const std::string& path) {
-  std::ifstream in(path);
   std::stringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path).rdbuf();
   return text.str();
 }
 
 void WriteFile(const std::string& path, const std::string& text) {
   std::ofstream(path) << text;
-}
-
-// Replaces the line number of "(quvaidx_system, 123)" with N.
-std::string WithoutLineNumbers(const std::string& line) {
-  return std::regex_replace(line, std::regex("^\\(quvaidx_system, [0-9]+\\)"),
-                            "(quvaidx_system, N)");
 }
 
 class IndexQueueTest : public ::testing::Test {
@@ -54,43 +47,36 @@ class IndexQueueTest : public ::testing::Test {
   std::string queue_ = dir_.File("test.queue");
 };
 
-TEST_F(IndexQueueTest, SameEntryTwiceLeavesOneLine) {
-  EXPECT_EQ(WriteIndexQueue("/share/a", queue_.c_str()), 0);
-  EXPECT_EQ(WriteIndexQueue("/share/ab", queue_.c_str()), 0);
-  EXPECT_EQ(WriteIndexQueue("/share/a", queue_.c_str()), 0);
-  EXPECT_EQ(WriteIndexQueue("/share", queue_.c_str()), 0);  // a prefix only
-  EXPECT_EQ(ReadFile(queue_), "/share/a\n/share/ab\n/share\n");
-}
-
-TEST_F(IndexQueueTest, EntriesThatWouldCorruptTheQueueAreRefused) {
+// Duplicates leave one line; entries that would corrupt the queue (a line
+// feed, over kMaxQueueEntry bytes) are refused with a line each.
+TEST_F(IndexQueueTest, DuplicatesAndCorruptingEntries) {
   LogCapture log;
-  WriteFile(queue_, "first\n");
   const std::string longest(kMaxQueueEntry, 'x');
+  for (const char* entry : {"/share/a", "/share/ab", "/share/a", "/share"}) {
+    EXPECT_EQ(WriteIndexQueue(entry, queue_.c_str()), 0);
+  }
   EXPECT_EQ(WriteIndexQueue("two\nlines", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue("trailing\n", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue((longest + "y").c_str(), queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue(nullptr, queue_.c_str()), -1);
-  EXPECT_EQ(WriteIndexQueue("x", nullptr), -1);
-  EXPECT_EQ(ReadFile(queue_), "first\n");
   EXPECT_EQ(log.lines().size(), 3u);
   EXPECT_EQ(WriteIndexQueue(longest.c_str(), queue_.c_str()), 0);
-  EXPECT_EQ(ReadFile(queue_), "first\n" + longest + "\n");
+  EXPECT_EQ(ReadFile(queue_), "/share/a\n/share/ab\n/share\n" + longest + "\n");
 }
 
-TEST_F(IndexQueueTest, MissingFolderFailsAfterOneTry) {
+// A missing folder fails after one try; permission denied is tried 17 times.
+TEST_F(IndexQueueTest, OpenFailuresAndRetries) {
   LogCapture log;
   FakeSleep sleep;
   std::string queue = dir_.File("missing/q.queue");
   EXPECT_EQ(WriteIndexQueue("/a", queue.c_str()), -1);
   EXPECT_EQ(sleep.calls(), 0);
   ASSERT_EQ(log.lines().size(), 1u);
-  EXPECT_EQ(WithoutLineNumbers(log.lines()[0].text),
-            "(quvaidx_system, N) open(" + queue + ", " +
+  EXPECT_EQ(std::regex_replace(log.lines()[0].text,
+                               std::regex("^\\(quvaidx_system, [0-9]+\\)"), ""),
+            " open(" + queue + ", " +
                 std::to_string(O_RDWR | O_CREAT | O_APPEND | O_SYNC) +
                 ") failed, reason=No such file or directory\n");
-}
-
-TEST_F(IndexQueueTest, PermissionDeniedIsTriedSeventeenTimes) {
   WriteFile(queue_, "");
   chmod(queue_.c_str(), 0600);
   chmod(dir_.path().c_str(), 0755);
@@ -100,9 +86,7 @@ TEST_F(IndexQueueTest, PermissionDeniedIsTriedSeventeenTimes) {
     int result = WriteIndexQueue("/a", queue_.c_str());
     int opens = 0;
     for (const auto& line : log.lines()) {
-      if (line.text.find("reason=Permission denied") != std::string::npos) {
-        ++opens;
-      }
+      opens += line.text.find("reason=Permission denied") != std::string::npos;
     }
     return (result == -1 ? 0 : 1) | (opens == 17 ? 0 : 2) |
            (sleep.calls() == 16 ? 0 : 4);
@@ -124,44 +108,40 @@ TEST_F(IndexQueueTest, WriterWaitingForTheLockFollowsATrimmedQueue) {
   EXPECT_EQ(ReadFile(queue_), "kept\nnew\n");
 }
 
-// Several writer processes append unique entries while a consumer process
-// takes lines off the head under the queue's lock. Every entry must end up
+std::string Entry(int writer, int i) {
+  return "/share/w" + std::to_string(writer) + "/entry-" + std::to_string(i) +
+         std::string(i % 37, 'p');
+}
+
+// Writer processes append unique entries while a consumer process takes
+// lines off the head under the queue's lock: every entry must end up
 // exactly once, trimmed or still queued, and no line may be torn.
 TEST_F(IndexQueueTest, NoEntryIsLostOrTornWhileTheConsumerTrims) {
-  const int kWriters = 4;
-  const int kEntries = 150;
+  const int kWriters = 3, kEntries = 100;
   std::string done = dir_.File("done");
   WriteFile(queue_, "");
-  std::vector<pid_t> writers;
+  std::vector<pid_t> children;
   for (int w = 0; w < kWriters; ++w) {
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
+    children.push_back(fork());
+    if (children.back() == 0) {
       for (int i = 0; i < kEntries; ++i) {
-        std::string entry = "/share/w" + std::to_string(w) + "/entry-" +
-                            std::to_string(i) + std::string(i % 37, 'p');
-        if (WriteIndexQueue(entry.c_str(), queue_.c_str()) != 0) _exit(1);
+        if (WriteIndexQueue(Entry(w, i).c_str(), queue_.c_str()) != 0) _exit(1);
       }
       _exit(0);
     }
-    writers.push_back(pid);
   }
-  pid_t consumer = fork();
-  ASSERT_GE(consumer, 0);
-  if (consumer == 0) {
+  children.push_back(fork());
+  if (children.back() == 0) {
     std::ofstream out(done);
-    for (int round = 0; round < 200; ++round) {
+    for (int round = 0; round < 150; ++round) {
       int fd = open(queue_.c_str(), O_RDWR);
       flock(fd, LOCK_EX);
       std::string text = ReadFile(queue_);
       size_t cut = 0;
-      for (int taken = 0; taken < 7 && cut < text.size(); ++taken) {
-        size_t newline = text.find('\n', cut);
-        if (newline == std::string::npos) break;
-        cut = newline + 1;
-      }
       int lines = 0;
-      for (size_t i = 0; i < cut; ++i) lines += text[i] == '\n';
+      for (; lines < 7 && text.find('\n', cut) != std::string::npos; ++lines) {
+        cut = text.find('\n', cut) + 1;
+      }
       if (FileRemoveHeadingLine(queue_.c_str(), lines) != 0) _exit(1);
       out << text.substr(0, cut) << std::flush;
       flock(fd, LOCK_UN);
@@ -170,27 +150,18 @@ TEST_F(IndexQueueTest, NoEntryIsLostOrTornWhileTheConsumerTrims) {
     }
     _exit(0);
   }
-  for (pid_t pid : writers) {
+  for (pid_t pid : children) {
     int status = 0;
     waitpid(pid, &status, 0);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   }
-  int status = 0;
-  waitpid(consumer, &status, 0);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-
   std::map<std::string, int> seen;
   std::istringstream all(ReadFile(done) + ReadFile(queue_));
   for (std::string line; std::getline(all, line);) ++seen[line];
-  int expected = 0;
   for (int w = 0; w < kWriters; ++w) {
-    for (int i = 0; i < kEntries; ++i, ++expected) {
-      std::string entry = "/share/w" + std::to_string(w) + "/entry-" +
-                          std::to_string(i) + std::string(i % 37, 'p');
-      EXPECT_EQ(seen[entry], 1) << entry;
-    }
+    for (int i = 0; i < kEntries; ++i) EXPECT_EQ(seen[Entry(w, i)], 1);
   }
-  EXPECT_EQ(seen.size(), static_cast<size_t>(expected));  // nothing torn
+  EXPECT_EQ(seen.size(), static_cast<size_t>(kWriters * kEntries));
 }
 
 // A stand-in for the thumbnail or web-video daemon: a child process that
@@ -200,50 +171,41 @@ class FakeDaemon {
   FakeDaemon() {
     int fds[2];
     if (pipe(fds) != 0) return;
-    sigset_t usr1;
+    sigset_t usr1, saved;
     sigemptyset(&usr1);
     sigaddset(&usr1, SIGUSR1);
-    sigprocmask(SIG_BLOCK, &usr1, &saved_);
+    sigprocmask(SIG_BLOCK, &usr1, &saved);
     pid_ = fork();
     if (pid_ == 0) {
       close(fds[0]);
-      for (;;) {
-        int signal_number = 0;
-        if (sigwait(&usr1, &signal_number) == 0 &&
-            write(fds[1], "U", 1) != 1) {
+      for (int signal_number = 0;;) {
+        if (sigwait(&usr1, &signal_number) == 0 && write(fds[1], "U", 1) != 1) {
           _exit(0);
         }
       }
     }
-    sigprocmask(SIG_SETMASK, &saved_, nullptr);
+    sigprocmask(SIG_SETMASK, &saved, nullptr);
     close(fds[1]);
     report_ = fds[0];
   }
   ~FakeDaemon() {
-    if (pid_ > 0) {
-      kill(pid_, SIGKILL);
-      waitpid(pid_, nullptr, 0);
-    }
-    if (report_ >= 0) close(report_);
+    kill(pid_, SIGKILL);
+    waitpid(pid_, nullptr, 0);
+    close(report_);
   }
   pid_t pid() const { return pid_; }
   // Signals received within `ms` milliseconds.
   int Signals(int ms = 200) {
     int count = 0;
     struct pollfd p = {report_, POLLIN, 0};
-    while (poll(&p, 1, ms) > 0) {
-      char c;
-      if (read(report_, &c, 1) != 1) break;
-      ++count;
-      ms = 20;
-    }
+    char c;
+    for (; poll(&p, 1, ms) > 0 && read(report_, &c, 1) == 1; ms = 20) ++count;
     return count;
   }
 
  private:
   pid_t pid_ = -1;
   int report_ = -1;
-  sigset_t saved_;
 };
 
 class ThumbQueueTest : public ::testing::Test {
@@ -272,25 +234,20 @@ class ThumbQueueTest : public ::testing::Test {
   FakeDaemon daemon_;
 };
 
-TEST_F(ThumbQueueTest, PhotoQueuesItsFolderAndWakesTheDaemon) {
-  EXPECT_EQ(WriteThumbQueue((media_ + "/x.jpg").c_str(), THUMB_TYPE_PHOTO), 0);
-  EXPECT_EQ(daemon_.Signals(), 1);
-  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), 0);
-  EXPECT_EQ(daemon_.Signals(), 1);
-  EXPECT_EQ(ReadFile(thumb_queue_), media_ + "\n");  // once
+// A photo queues its folder (once), a web video the file itself; a file of
+// no interest queues nothing but still wakes the daemon.
+TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
+  const std::pair<std::string, _tag_THUMB_TYPE_> calls[] = {
+      {media_ + "/x.jpg", THUMB_TYPE_PHOTO},
+      {media_, THUMB_TYPE_PHOTO},
+      {media_ + "/x.txt", THUMB_TYPE_PHOTO},
+      {media_ + "/x.mkv", THUMB_TYPE_VIDEO}};
+  for (const auto& c : calls) {
+    EXPECT_EQ(WriteThumbQueue(c.first.c_str(), c.second), 0) << c.first;
+    EXPECT_EQ(daemon_.Signals(), 1) << c.first;
+  }
+  EXPECT_EQ(ReadFile(thumb_queue_), media_ + "\n");
   EXPECT_EQ(ReadFile(flv_queue_), "");
-}
-
-TEST_F(ThumbQueueTest, FileOfNoInterestQueuesNothingButStillWakes) {
-  EXPECT_EQ(WriteThumbQueue((media_ + "/x.txt").c_str(), THUMB_TYPE_PHOTO), 0);
-  EXPECT_EQ(daemon_.Signals(), 1);
-  EXPECT_EQ(WriteThumbQueue((media_ + "/x.mkv").c_str(), THUMB_TYPE_VIDEO), 0);
-  EXPECT_EQ(daemon_.Signals(), 1);
-  EXPECT_EQ(ReadFile(thumb_queue_), "");
-  EXPECT_EQ(ReadFile(flv_queue_), "");
-}
-
-TEST_F(ThumbQueueTest, WebVideoQueuesTheFileItself) {
   std::string video = media_ + "/x.mp4";
   EXPECT_EQ(WriteThumbQueue(video.c_str(), THUMB_TYPE_VIDEO), 0);
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), 0);
@@ -298,26 +255,22 @@ TEST_F(ThumbQueueTest, WebVideoQueuesTheFileItself) {
   EXPECT_GE(daemon_.Signals(), 1);
 }
 
-TEST_F(ThumbQueueTest, OtherTypesDoNothing) {
-  for (int type : {0, 3, -1}) {
-    EXPECT_EQ(WriteThumbQueue((media_ + "/x.jpg").c_str(),
-                              static_cast<_tag_THUMB_TYPE_>(type)),
-              0);
-    EXPECT_EQ(WriteThumbQueue(dir_.File("missing.jpg").c_str(),
-                              static_cast<_tag_THUMB_TYPE_>(type)),
-              -1);
+// Other types do nothing; paths that are neither file nor folder fail.
+TEST_F(ThumbQueueTest, OtherTypesAndPathsDoNothing) {
+  for (int type : {0, 3}) {
+    auto t = static_cast<_tag_THUMB_TYPE_>(type);
+    EXPECT_EQ(WriteThumbQueue((media_ + "/x.jpg").c_str(), t), 0);
+    EXPECT_EQ(WriteThumbQueue(dir_.File("missing.jpg").c_str(), t), -1);
   }
+  EXPECT_EQ(WriteThumbQueue(nullptr, THUMB_TYPE_PHOTO), -1);
+  EXPECT_EQ(WriteThumbQueue("/dev/null", THUMB_TYPE_PHOTO), -1);
   EXPECT_EQ(daemon_.Signals(50), 0);
   EXPECT_EQ(ReadFile(thumb_queue_), "");
 }
 
-TEST_F(ThumbQueueTest, PathsThatAreNeitherFileNorFolderFail) {
-  EXPECT_EQ(WriteThumbQueue(nullptr, THUMB_TYPE_PHOTO), -1);
-  EXPECT_EQ(WriteThumbQueue("/dev/null", THUMB_TYPE_PHOTO), -1);
-  EXPECT_EQ(daemon_.Signals(50), 0);
-}
-
-TEST_F(ThumbQueueTest, MissingOrDeadDaemonQueuesNothing) {
+// A missing, dead or recycled daemon (its pid file older than the process
+// now holding the pid) is never signalled and nothing is queued.
+TEST_F(ThumbQueueTest, MissingDeadOrRecycledDaemonQueuesNothing) {
   LogCapture log;
   unlink(thumb_pid_.c_str());
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
@@ -326,36 +279,19 @@ TEST_F(ThumbQueueTest, MissingOrDeadDaemonQueuesNothing) {
   waitpid(dead, nullptr, 0);
   WriteFile(flv_pid_, std::to_string(dead));
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), -1);
-  EXPECT_EQ(log.Normalized(),
-            (std::vector<std::string>{
-                "quvaidx_system:N [Error] quvamkthumbd is dead",
-                "quvaidx_system:N [Error] quvamkflvd is dead"}));
-  EXPECT_EQ(ReadFile(thumb_queue_), "");
-  EXPECT_EQ(ReadFile(flv_queue_), "");
-}
-
-TEST_F(ThumbQueueTest, RecycledPidIsNeverSignalled) {
-  // The pid file is an hour old; the process holding its pid now started
-  // later, so it is not the daemon and must not get SIGUSR1.
+  WriteFile(thumb_pid_, std::to_string(daemon_.pid()));
   struct timespec old[2] = {{time(nullptr) - 3600, 0},
                             {time(nullptr) - 3600, 0}};
   ASSERT_EQ(utimensat(AT_FDCWD, thumb_pid_.c_str(), old, 0), 0);
-  LogCapture log;
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
   EXPECT_EQ(daemon_.Signals(100), 0);
-  EXPECT_EQ(log.Count("quvaidx_system:N [Error] quvamkthumbd is dead"), 1);
+  EXPECT_EQ(log.Normalized(),
+            (std::vector<std::string>{
+                "quvaidx_system:N [Error] quvamkthumbd is dead",
+                "quvaidx_system:N [Error] quvamkflvd is dead",
+                "quvaidx_system:N [Error] quvamkthumbd is dead"}));
   EXPECT_EQ(ReadFile(thumb_queue_), "");
-}
-
-TEST_F(ThumbQueueTest, UnwritableQueueIsReported) {
-  LogCapture log;
-  std::string blocked = dir_.File("blocked/q");
-  paths_.thumb_queue = blocked.c_str();
-  quvaidx::SetSpoolPaths(paths_);
-  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
-  EXPECT_EQ(log.Count("quvaidx_system:N [Error] fail to write thumb queue"),
-            1);
-  EXPECT_EQ(daemon_.Signals(50), 0);
+  EXPECT_EQ(ReadFile(flv_queue_), "");
 }
 
 }  // namespace
