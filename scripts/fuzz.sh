@@ -4,7 +4,7 @@
 #   scripts/fuzz.sh BUILD_DIR [SECONDS]
 #
 # BUILD_DIR was configured with -DQUVAIDX_BUILD_FUZZ=ON (see `make fuzz`);
-# each target runs for SECONDS (default 30). A target's working corpus is
+# each target runs for SECONDS (default 20). A target's working corpus is
 # BUILD_DIR/fuzz-corpus/<target>, seeded from fuzz/corpus/<target> when that
 # exists; crash, leak and timeout inputs land in
 # BUILD_DIR/fuzz-artifacts/<target>/ and full logs in BUILD_DIR/fuzz-logs/.
@@ -19,12 +19,13 @@ usage() {
 }
 [ $# -ge 1 ] && [ $# -le 2 ] || usage
 build_dir=$1
-seconds=${2:-30}
+seconds=${2:-20}
 [[ $seconds =~ ^[1-9][0-9]*$ ]] || usage
 
 root=$(cd "$(dirname "$0")/.." && pwd)
 build_dir=$(cd "$build_dir" && pwd)
-targets=(fuzz_event_server fuzz_recv_packet fuzz_host_ini fuzz_host_pid_file fuzz_file_rules fuzz_mediainfo fuzz_text)
+targets=(fuzz_event_server fuzz_recv_packet fuzz_host_ini fuzz_host_pid_file fuzz_file_rules fuzz_mediainfo fuzz_text fuzz_trim
+         fuzz_proc_parse)
 
 # Findings must stop the run with a stack trace; libFuzzer already checks for
 # leaks after inputs whose allocations do not balance.

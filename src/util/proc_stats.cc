@@ -1,4 +1,5 @@
 // Process statistics from /proc.
+#include <ctype.h>
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -33,8 +34,10 @@ bool ReadLabelled(const char* line, size_t length, const char* label,
   memcpy(copy, line, length);
   copy[length] = '\0';
   const char* p = copy;
-  while (*p == ' ' || *p == '\t') ++p;
-  while (*p != '\0' && *p != ' ' && *p != '\t') ++p;  // the first word
+  while (isspace(static_cast<unsigned char>(*p))) ++p;
+  while (*p != '\0' && !isspace(static_cast<unsigned char>(*p))) {
+    ++p;  // the first word
+  }
   char* end = nullptr;
   errno = 0;
   long number = strtol(p, &end, 10);

@@ -1,0 +1,199 @@
+// Feeds FileRemoveHeadingLine arbitrary file contents and line counts.
+//
+// Input: the first two bytes (little-endian) give the count n, mapped onto
+// -2 .. 60000; the third byte r (taken modulo 48) puts r * 2731 bytes of
+// filler lines of 1 to 97 bytes before the rest, which is the file's tail;
+// the filler's last line may be cut, so it joins the tail's first line.
+// Files thus reach 128 KiB, beyond the function's 64 KiB copy blocks, with
+// lines across the block boundary. Checked after each call:
+//   - the result is 0 and the file holds what a model leaves: the text
+//     without its first n lines, a line being everything up to and with a
+//     '\n', or the rest of the text when no '\n' follows (so the last line
+//     counts without one); the whole text for n <= 0, nothing for n beyond
+//     the last line;
+//   - the file keeps its mode, and no temporary file is left beside it.
+// A mismatch aborts with a message.
+//
+// The function renames a temporary file over the path, so the file needs a
+// real name in a directory of its own: one private directory per process
+// under $TMPDIR (or /tmp), made with mkdtemp and removed with its file at
+// exit. A crashed run leaves that directory (one small file) behind.
+#include <dirent.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <stddef.h>
+#include <stdint.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <string_view>
+
+#include "quvaidx/system.h"
+
+namespace {
+
+constexpr size_t kMaxInput = 64 * 1024;
+constexpr int kMinCount = -2;
+constexpr int kMaxCount = 60000;
+constexpr mode_t kMode = 0640;
+
+[[noreturn]] void Die(const char* what) {
+  perror(what);
+  abort();
+}
+
+// The private directory and the file in it.
+class Scratch {
+ public:
+  static Scratch& Get() {
+    // Never destroyed: Remove runs at exit and still needs the object.
+    static Scratch* scratch = new Scratch();
+    return *scratch;
+  }
+
+  const std::string& dir() const { return dir_; }
+  const std::string& file() const { return file_; }
+
+  // Makes the file hold data[0, size) with mode kMode.
+  void Write(const char* data, size_t size) {
+    int fd =
+        open(file_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kMode);
+    if (fd < 0) Die("open");
+    if (fchmod(fd, kMode) != 0) Die("fchmod");  // the umask may have cut it
+    size_t done = 0;
+    while (done < size) {
+      ssize_t n = write(fd, data + done, size - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) Die("write");
+      done += static_cast<size_t>(n);
+    }
+    if (close(fd) != 0) Die("close");
+  }
+
+  std::string Read() const {
+    int fd = open(file_.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) Die("open for reading");
+    std::string text;
+    char block[16384];
+    for (;;) {
+      ssize_t n = read(fd, block, sizeof(block));
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) Die("read");
+      if (n == 0) break;
+      text.append(block, static_cast<size_t>(n));
+    }
+    close(fd);
+    return text;
+  }
+
+  // The names in the directory other than the file's own.
+  std::string Strays() const {
+    std::string strays;
+    DIR* dir = opendir(dir_.c_str());
+    if (dir == nullptr) Die("opendir");
+    while (struct dirent* entry = readdir(dir)) {
+      std::string name = entry->d_name;
+      if (name == "." || name == ".." || name == "queue") continue;
+      strays += name + " ";
+    }
+    closedir(dir);
+    return strays;
+  }
+
+ private:
+  Scratch() {
+    const char* tmp = getenv("TMPDIR");
+    if (tmp == nullptr || tmp[0] == '\0') tmp = "/tmp";
+    dir_ = std::string(tmp) + "/quvaidx-fuzz-trim.XXXXXX";
+    if (mkdtemp(&dir_[0]) == nullptr) Die("mkdtemp");
+    file_ = dir_ + "/queue";
+    atexit(Remove);
+  }
+
+  static void Remove() {
+    Scratch& scratch = Get();
+    unlink(scratch.file_.c_str());  // may be missing; don't care
+    rmdir(scratch.dir_.c_str());
+  }
+
+  std::string dir_;
+  std::string file_;
+};
+
+[[noreturn]] void Fail(const char* what, int n, std::string_view text) {
+  fprintf(stderr, "fuzz_trim: %s; n %d, file (%zu bytes): \"", what, n,
+          text.size());
+  for (unsigned char c : text.substr(0, 300)) {
+    if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
+      fputc(c, stderr);
+    } else {
+      fprintf(stderr, "\\x%02x", c);
+    }
+  }
+  fprintf(stderr, "%s\"\n", text.size() > 300 ? "..." : "");
+  abort();
+}
+
+constexpr size_t kFillerUnit = 2731;
+constexpr unsigned kFillerUnits = 48;
+
+// `bytes` bytes of lines of 1 to 97 bytes ('\n' included), the last one
+// possibly cut.
+std::string Filler(size_t bytes) {
+  std::string text;
+  for (int i = 0; text.size() < bytes; ++i) {
+    text.append(static_cast<size_t>(i * 37 % 97),
+                static_cast<char>('a' + i % 26));
+    text += '\n';
+  }
+  text.resize(bytes);
+  return text;
+}
+
+// The text without its first n lines.
+std::string_view Model(std::string_view text, int n) {
+  for (int i = 0; i < n && !text.empty(); ++i) {
+    size_t newline = text.find('\n');
+    text = newline == std::string_view::npos ? std::string_view()
+                                             : text.substr(newline + 1);
+  }
+  return text;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  if (size < 3 || size > kMaxInput) return 0;
+  const unsigned raw = data[0] | (static_cast<unsigned>(data[1]) << 8);
+  const int n = kMinCount + static_cast<int>(raw % (kMaxCount - kMinCount + 1));
+  std::string file = Filler(kFillerUnit * (data[2] % kFillerUnits));
+  file.append(reinterpret_cast<const char*>(data) + 3, size - 3);
+  const std::string_view text(file);
+  Scratch& scratch = Scratch::Get();
+  scratch.Write(text.data(), text.size());
+
+  if (FileRemoveHeadingLine(scratch.file().c_str(), n) != 0) {
+    Fail("FileRemoveHeadingLine failed", n, text);
+  }
+  const std::string after = scratch.Read();
+  if (after != Model(text, n)) {
+    fprintf(stderr, "kept %zu bytes, model %zu\n", after.size(),
+            Model(text, n).size());
+    Fail("wrong contents", n, text);
+  }
+  struct stat st;
+  if (stat(scratch.file().c_str(), &st) != 0) Die("stat");
+  if ((st.st_mode & 07777) != kMode) {
+    fprintf(stderr, "mode %o\n", static_cast<unsigned>(st.st_mode & 07777));
+    Fail("mode changed", n, text);
+  }
+  const std::string strays = scratch.Strays();
+  if (!strays.empty()) {
+    fprintf(stderr, "left behind: %s\n", strays.c_str());
+    Fail("temporary file left", n, text);
+  }
+  return 0;
+}
