@@ -1,15 +1,21 @@
 // The directory of the index service's daemons: for each daemon's short
 // name, its pid file, its executable and its Unix-domain socket.
 //
-//   name        "pid"                            "bin" "sock" controld
-//   /var/run/quvaindexd.pid          /usr/quva/sbin/quvaindexd
-//   /tmp/quvaindexd_sock scand       /var/run/quvaindexscand.pid
-//   /usr/quva/sbin/quvaindexscand      /tmp/quvaindexscand_sock workerd
-//   /var/run/quvaindexworkerd.pid    /usr/quva/sbin/quvaindexworkerd
-//   /tmp/quvaindexworkerd_sock plugind     /var/run/quvaindexplugind.pid
-//   /usr/quva/sbin/quvaindexplugind    /tmp/quvaindexplugind_sock mediad
-//   /var/run/quvamediaparserd.pid    /usr/quva/sbin/quvamediaparserd
-//   /tmp/quvamediaparserd_sock
+//   controld  pid  /var/run/quvaindexd.pid
+//             bin  /usr/quva/sbin/quvaindexd
+//             sock /tmp/quvaindexd_sock
+//   scand     pid  /var/run/quvaindexscand.pid
+//             bin  /usr/quva/sbin/quvaindexscand
+//             sock /tmp/quvaindexscand_sock
+//   workerd   pid  /var/run/quvaindexworkerd.pid
+//             bin  /usr/quva/sbin/quvaindexworkerd
+//             sock /tmp/quvaindexworkerd_sock
+//   plugind   pid  /var/run/quvaindexplugind.pid
+//             bin  /usr/quva/sbin/quvaindexplugind
+//             sock /tmp/quvaindexplugind_sock
+//   mediad    pid  /var/run/quvamediaparserd.pid
+//             bin  /usr/quva/sbin/quvamediaparserd
+//             sock /tmp/quvamediaparserd_sock
 //
 // Threads: a lookup of an unknown name inserts an empty entry, so one
 // instance must not be used by two threads at once; separate instances are
