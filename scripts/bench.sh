@@ -20,7 +20,8 @@
 # Every step runs under `timeout`; with the defaults the whole script takes
 # about three minutes on two cores. Sockets live under /tmp and are removed;
 # so are the task-queue benchmark's key file and message queues, also when it
-# is interrupted.
+# is interrupted. The spool benchmark writes its queues (up to 5.5 MB each)
+# under /tmp and under the working directory, and removes them.
 set -uo pipefail
 
 build=${1:-build-bench}
@@ -31,7 +32,7 @@ filter=${BENCH_FILTER:-}
 
 for b in quvaidx_server_bench quvaidx_exchange_bench quvaidx_framing_bench \
          quvaidx_task_queue_bench quvaidx_mediainfo_bench quvaidx_classify_bench \
-         quvaidx_bench_load; do
+         quvaidx_bench_load quvaidx_spool_bench quvaidx_proc_stats_bench; do
   if [ ! -x "$bin/$b" ]; then
     echo "bench.sh: $bin/$b not found; build with -DQUVAIDX_BUILD_BENCH=ON" >&2
     exit 1
@@ -59,7 +60,7 @@ args=(--benchmark_repetitions="$reps" --benchmark_min_time="$min_time")
 [ -n "$filter" ] && args+=(--benchmark_filter="$filter")
 for b in quvaidx_framing_bench quvaidx_task_queue_bench \
          quvaidx_mediainfo_bench quvaidx_classify_bench quvaidx_exchange_bench \
-         quvaidx_server_bench; do
+         quvaidx_server_bench quvaidx_spool_bench quvaidx_proc_stats_bench; do
   echo
   echo "######## $b"
   timeout 600 "${pin[@]}" "$bin/$b" "${args[@]}" || { echo "$b failed ($?)"; status=1; }

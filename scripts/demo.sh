@@ -7,7 +7,10 @@
 # (`quvaidx serve`) with a socket and a pid file in a fresh temporary
 # directory, talks to it with `quvaidx send`, stops it with SIGTERM and
 # checks that it removed its socket and pid file; then takes a task queue
-# through create, push, count, pop and delete (`quvaidx taskq`). Everything
+# through create, push, count, pop and delete (`quvaidx taskq`), and scans
+# a sample share with the index's rules (`quvaidx scan`), and asks the
+# example media-parser daemon about sample files (`quvaidx mediainfo`,
+# `quvaidx resolution`). Everything
 # it starts or creates is removed on exit, however the script ends, so it
 # can be run again at once.
 set -euo pipefail
@@ -34,6 +37,10 @@ work=""
 server_pid=""
 queue_key=""
 cleanup() {
+  if [ -n "${mp_pid:-}" ]; then
+    kill -TERM "$mp_pid" 2>/dev/null || true
+    wait "$mp_pid" 2>/dev/null || true
+  fi
   if [ -n "$server_pid" ] && kill -0 "$server_pid" 2>/dev/null; then
     kill -TERM "$server_pid" 2>/dev/null || true
     wait "$server_pid" 2>/dev/null || true
@@ -154,6 +161,84 @@ heading "Delete the queue"
 show taskq delete "$queue_key" 7
 queue_key=""
 show taskq count "$work/queue.key" 7 2>&1
+
+heading "A sample share to scan: media of every kind, upper-case extensions,
+and names the index skips (AppleDouble files, the recycle bin, snapshots,
+the metadata folder, an application bundle), symbolic links (one a loop)"
+share=$work/share
+mkdir -p "$share"/{Music,Video,Photos/2023,Photos.app,'#recycle','#snapshot'} \
+  "$share"/{.quvameta/IMG_0001.JPG,Docs}
+touch "$share"/Music/{SONG.MP3,track02.flac,favourites.m3u,._SONG.MP3} \
+  "$share"/Video/{holiday.mp4,concert.mkv,CLIP.AVI} \
+  "$share"/Photos/{IMG_0001.JPG,scan.png,logo.gif,layers.psd} \
+  "$share"/Photos/2023/DSC_0042.NEF "$share"/Photos.app/icon.png \
+  "$share"/'#recycle'/old.mp3 "$share"/.quvameta/IMG_0001.JPG/thumb.jpg \
+  "$share"/Docs/notes.txt "$share"/._cover.jpg
+ln -s .. "$share"/Docs/loop
+ln -s Music/SONG.MP3 "$share"/latest.mp3
+(cd "$work" && find share | LC_ALL=C sort | sed 's/^/  /')
+
+heading "Scan it with the index's rules: what the index would hold, and what
+it skips and why"
+show scan "$share"
+
+heading "One line per file with its media table (the summary goes to stderr)"
+echo "\$ quvaidx scan --list $share 2>/dev/null | sort | head -8"
+"$tool" scan --list "$share" 2>/dev/null | LC_ALL=C sort | head -8
+
+heading "Machine-readable: the same summary as JSON (an excerpt)"
+echo "\$ quvaidx scan --json $share | grep -A6 '\"tables\"'"
+"$tool" scan --json "$share" | grep -A6 '"tables"'
+
+heading "A missing folder is an error: exit status 2"
+show scan "$work/no-such-share" 2>&1
+
+heading "The media-parser example daemon (examples/mediaparserd), on a socket
+and a pid file of its own, asked about a PNG, a JPEG and an MP3"
+mediaparserd=${tool%/tools/quvaidx}/examples/mediaparserd
+if [ ! -x "$mediaparserd" ]; then
+  echo "(not built: configure with -DQUVAIDX_BUILD_EXAMPLES=ON)"
+else
+  media=$work/media
+  mkdir -p "$media"
+  # A real 16x9 grey PNG, a JPEG header stating 1920x1080, an MP3 with an
+  # ID3 header: the daemon reads sizes from headers, not from names.
+  printf '\211PNG\r\n\032\n\0\0\0\rIHDR\0\0\0\020\0\0\0\011\010\0\0\0\0\036A\363\356\0\0\0\017IDATx\332ch@\003\014\203D\0\0\205\324H\001\265\010\335\324\0\0\0\0IEND\256B`\202' \
+    >"$media/cover.png"
+  printf '\377\330\377\340\0\020JFIF\0\001\001\0\0\001\0\001\0\0\377\300\0\013\010\004\070\007\200\001\001\021\0\377\331' \
+    >"$media/holiday.jpg"
+  printf 'ID3\003\0\0\0\0\0\0\377\373\220\144' >"$media/track01.mp3"
+  mp_sock=$work/mediaparserd.sock
+  echo "\$ mediaparserd --socket $mp_sock --pidfile $work/mediaparserd.pid &"
+  "$mediaparserd" --socket "$mp_sock" --pidfile "$work/mediaparserd.pid" \
+    >"$work/mediaparserd.out" 2>&1 &
+  mp_pid=$!
+  for ((i = 0; i < 250; i++)); do
+    grep -qs "listening on" "$work/mediaparserd.out" && break
+    sleep 0.02
+  done
+  cat "$work/mediaparserd.out"
+  show mediainfo --socket "$mp_sock" "$media/cover.png" "$media/holiday.jpg" \
+    "$media/track01.mp3"
+  show resolution --socket "$mp_sock" "$media/holiday.jpg"
+  echo "\$ quvaidx mediainfo --json --socket $mp_sock $media/cover.png | grep -E 'table|resolution|fileSize'"
+  "$tool" mediainfo --json --socket "$mp_sock" "$media/cover.png" |
+    grep -E 'table|resolution|fileSize'
+
+  heading "A missing file: the daemon says why, exit status 1"
+  show mediainfo --socket "$mp_sock" "$media/missing.jpg" 2>&1
+
+  heading "Stop it with SIGTERM: it removes its socket and pid file"
+  echo "\$ kill -TERM $mp_pid"
+  kill -TERM "$mp_pid"
+  wait "$mp_pid" || true
+  mp_pid=""
+  if [ -e "$mp_sock" ] || [ -e "$work/mediaparserd.pid" ]; then
+    echo "demo: mediaparserd left its socket or pid file" >&2
+    exit 1
+  fi
+  echo "The socket and the pid file are gone."
+fi
 
 echo
 echo "Demo finished; removing $work."

@@ -7,9 +7,15 @@
 namespace quvaidx_cli {
 
 int RunDaemons(int argc, char** argv);
+int RunMediaInfo(int argc, char** argv);
+int RunResolution(int argc, char** argv);
 int RunSend(int argc, char** argv);
+int RunScan(int argc, char** argv);
 int RunServe(int argc, char** argv);
+int RunSpool(int argc, char** argv);
+int RunStats(int argc, char** argv);
 int RunTaskq(int argc, char** argv);
+int RunThumb(int argc, char** argv);
 
 }  // namespace quvaidx_cli
 

@@ -1,5 +1,5 @@
 // quvaidx: command-line access to the index daemons' sockets and task
-// queues. The dispatcher
+// queues, and the index's folder walk. The dispatcher
 // reads the tool's own options, then hands the remaining arguments to the
 // subcommand named first.
 #include <getopt.h>
@@ -20,8 +20,17 @@ constexpr Command kCommands[] = {
     {"daemons", "list the index daemons and whether they are alive",
      RunDaemons},
     {"send", "send one JSON request to a daemon and print its reply", RunSend},
+    {"scan", "walk folder trees with the index's rules and count media",
+     RunScan},
     {"serve", "run a sample daemon", RunServe},
+    {"spool", "add entries to a spool queue or trim its head", RunSpool},
+    {"stats", "show a process's descriptors and memory", RunStats},
     {"taskq", "create, fill, drain, count or delete a task queue", RunTaskq},
+    {"thumb", "queue thumbnail or web-video work for paths", RunThumb},
+    {"mediainfo", "ask the media parser for files' media records",
+     RunMediaInfo},
+    {"resolution", "ask the media parser for a file's pixel size",
+     RunResolution},
     {"help", "show the help of a command", RunHelp},
 };
 
@@ -36,12 +45,13 @@ void PrintUsage(FILE* out) {
   fprintf(out,
           "Usage: quvaidx [--verbose] COMMAND [OPTIONS] [ARGUMENTS]\n"
           "\n"
-          "Talks to the index daemons over their Unix-domain sockets and\n"
-          "works on their task queues.\n"
+          "Talks to the index daemons over their Unix-domain sockets, works\n"
+          "on their task queues and walks folder trees with the index's\n"
+          "rules.\n"
           "\n"
           "Commands:\n");
   for (const Command& command : kCommands) {
-    fprintf(out, "  %-8s %s\n", command.name, command.summary);
+    fprintf(out, "  %-10s %s\n", command.name, command.summary);
   }
   fprintf(out,
           "\n"

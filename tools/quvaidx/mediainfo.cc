@@ -1,0 +1,360 @@
+// quvaidx mediainfo and quvaidx resolution: the media-parser daemon's
+// answers about files, as the library's callers receive them.
+//
+// Both send exactly the requests of QUVAIDX_GetMediaInfo and
+// QUVAIDX_GetMediaResolution ({"command": ..., "path": FILE}, one exchange
+// with AutoSendRecvPacket, descriptor -1, no handshake) and read the reply
+// the same way: it counts only when "success" is a boolean true or a
+// nonzero number; the record comes from "media" through
+// MediaInfoJson2Object, and "width" and "height" are read as 32-bit
+// integers (0 when missing or out of range). Only the number of connection
+// attempts differs: the library's calls wait up to half an hour for a
+// daemon, the tool --attempts (default 3) seconds.
+#include <errno.h>
+#include <getopt.h>
+#include <limits.h>
+#include <stdio.h>
+#include <string.h>
+#include <unistd.h>
+
+#include <string>
+
+#include <json/json.h>
+
+#include "cli.h"
+#include "commands.h"
+#include "quvaidx/daemon_info.h"
+#include "quvaidx/ipc.h"
+#include "quvaidx/media_type.h"
+#include "quvaidx/mediainfo.h"
+
+namespace quvaidx_cli {
+namespace {
+
+constexpr int kDefaultAttempts = 3;
+constexpr int kMaxAttempts = 3600;
+
+// The record's fields in their order, for the readable listing.
+constexpr const char* kFields[] = {
+    "ID",
+    "szPath",
+    "szName",
+    "szDesc",
+    "track",
+    "disc",
+    "year",
+    "szTitle",
+    "szAlbum",
+    "szArtist",
+    "szAlbumArtist",
+    "szGenre",
+    "szComposer",
+    "szComment",
+    "szMake",
+    "szModel",
+    "szExposure",
+    "szAperture",
+    "szTakenTime",
+    "szDate",
+    "szMDate",
+    "duration",
+    "audio_bitrate",
+    "frame_bitrate",
+    "video_bitrate",
+    "frame_rate_num",
+    "frame_rate_den",
+    "frequency",
+    "channel",
+    "resolutionX",
+    "resolutionY",
+    "fileSize",
+    "song_count",
+    "blTitleUTF16",
+    "blArtistUTF16",
+    "blAlbumUTF16",
+    "blGenreUTF16",
+    "blComposerUTF16",
+    "blCommentUTF16",
+    "coverCount",
+    "iso",
+    "szVideoCodec",
+    "szContainerType",
+    "videoProfile",
+    "videoLevel",
+    "szAudioCodec",
+    "szFsUUID",
+};
+
+// What one invocation asks for, from the command line.
+struct Options {
+  std::string socket;  // the media parser's socket
+  int attempts = kDefaultAttempts;
+  bool json = false;  // print JSON instead of "name: value" lines
+  bool all = false;   // list fields that are 0 or empty too
+};
+
+void PrintHelp(const char* name) {
+  bool info = strcmp(name, "mediainfo") == 0;
+  printf(info ? "Usage: quvaidx mediainfo [OPTIONS] FILE...\n\n"
+                "Asks the media-parser daemon for the media record of each\n"
+                "FILE and prints its fields that are set, one \"name: value\"\n"
+                "line each, after the media table the index files it in.\n"
+              : "Usage: quvaidx resolution [OPTIONS] FILE\n\n"
+                "Asks the media-parser daemon for the pixel size of FILE and\n"
+                "prints it as WIDTHxHEIGHT (0x0 when the daemon does not know\n"
+                "it).\n");
+  printf(
+      "A relative FILE is sent as an absolute path, since the daemon has a\n"
+      "working directory of its own.\n"
+      "\n"
+      "Options:\n"
+      "  -j, --json          print JSON%s\n"
+      "%s"
+      "  -s, --socket PATH   the daemon's socket (default %s)\n"
+      "  -a, --attempts N    connection attempts, one second apart "
+      "(default %d)\n"
+      "  -v, --verbose       also show the library's log lines on stderr\n"
+      "  -h, --help          show this help\n"
+      "\n"
+      "Exit status: 0 when the daemon answered for every FILE, 1 when it\n"
+      "refused one (its reason is printed), 2 on a usage error or when no\n"
+      "reply could be obtained.\n",
+      info ? ": an array of {\"file\", \"table\", \"media\"}" : "",
+      info ? "      --all           also list fields that are 0 or empty\n"
+           : "",
+      DaemonInfo().get("mediad", "sock").c_str(), kDefaultAttempts);
+}
+
+// As the library reads "success": a boolean true or a nonzero number.
+bool Succeeded(const Json::Value& reply) {
+  if (!reply.isObject() || !reply.isMember("success")) return false;
+  const Json::Value& success = reply["success"];
+  switch (success.type()) {
+    case Json::booleanValue:
+      return success.asBool();
+    case Json::intValue:
+    case Json::uintValue:
+    case Json::realValue:
+      return success.asDouble() != 0.0;
+    default:
+      return false;
+  }
+}
+
+// As the library reads "width" and "height": a 32-bit integer (a real
+// within range cut toward zero, true as 1), anything else 0.
+int32_t ReadInt32(const Json::Value& reply, const char* key) {
+  const Json::Value& value = reply[key];
+  switch (value.type()) {
+    case Json::intValue:
+      return value.asInt64() >= INT32_MIN && value.asInt64() <= INT32_MAX
+                 ? static_cast<int32_t>(value.asInt64())
+                 : 0;
+    case Json::uintValue:
+      return value.asUInt64() <= INT32_MAX
+                 ? static_cast<int32_t>(value.asUInt64())
+                 : 0;
+    case Json::realValue:
+      return value.asDouble() >= INT32_MIN && value.asDouble() <= INT32_MAX
+                 ? static_cast<int32_t>(value.asDouble())
+                 : 0;
+    case Json::booleanValue:
+      return value.asBool() ? 1 : 0;
+    default:
+      return 0;
+  }
+}
+
+// The media table the index files `file` in, by its name's extension.
+const char* TableOf(const std::string& file) {
+  std::string name = file.substr(file.rfind('/') + 1);  // npos + 1 == 0
+  switch (GetMediaTableTypeFromExt(QUVAIndexExtGet(name.c_str()))) {
+    case MEDIA_TABLE_MUSIC:
+      return "music";
+    case MEDIA_TABLE_VIDEO:
+      return "video";
+    case MEDIA_TABLE_PHOTO:
+      return "photo";
+    case MEDIA_TABLE_PLAYLIST:
+      return "playlist";
+    default:
+      return "none";
+  }
+}
+
+// Runs one request for `file` on the daemon. Returns kExitOk with the reply
+// in *reply; kExitFalse (reason printed) when the daemon refused;
+// kExitError (message printed) when the request could not be made or no
+// reply came.
+int Ask(const char* name, const Options& options, const char* command,
+        const std::string& file, Json::Value* reply) {
+  std::string path = file;
+  if (path.empty() || path[0] != '/') {
+    char cwd[PATH_MAX];
+    if (getcwd(cwd, sizeof(cwd)) == nullptr) {
+      PrintError(name, std::string("cannot read the current directory: ") +
+                           strerror(errno));
+      return kExitError;
+    }
+    path = std::string(cwd) + "/" + file;
+  }
+  Json::Value value(Json::objectValue);
+  value["command"] = command;
+  value["path"] = path;
+  if (path.size() >= static_cast<size_t>(kMediaPathSize) ||
+      Json::FastWriter().write(value).size() > kMaxSendBody) {
+    PrintError(name, file + ": path too long for a request");
+    return kExitError;
+  }
+  if (AutoSendRecvPacket(options.socket.c_str(), -1, value, options.attempts) !=
+      0) {
+    PrintError(name, "no reply from the media parser on " + options.socket +
+                         " after " + std::to_string(options.attempts) +
+                         (options.attempts == 1 ? " attempt" : " attempts") +
+                         " (is mediaparserd running?)");
+    return kExitError;
+  }
+  if (!Succeeded(value)) {
+    const Json::Value& reason = value.isObject() ? value["reason"] : value;
+    PrintError(name, file + ": " +
+                         (reason.isString() ? reason.asString()
+                                            : "the media parser refused"));
+    return kExitFalse;
+  }
+  reply->swap(value);
+  return kExitOk;
+}
+
+void PrintRecord(const std::string& file, const Json::Value& media, bool all) {
+  printf("%-17s%s\n", "table:", TableOf(file));
+  for (const char* field : kFields) {
+    const Json::Value& value = media[field];
+    std::string text;
+    if (value.isString()) {
+      text = value.asString();
+    } else if (value.isDouble()) {
+      char buffer[64];
+      snprintf(buffer, sizeof(buffer), "%g", value.asDouble());
+      text = buffer;
+    } else if (value.isUInt64()) {
+      text = std::to_string(value.asUInt64());
+    } else if (value.isInt64()) {
+      text = std::to_string(value.asInt64());
+    }
+    if (!all && (text.empty() || text == "0")) continue;
+    printf("%-17s%s\n", (std::string(field) + ":").c_str(), text.c_str());
+  }
+}
+
+// Parses the options shared by both commands; the FILE arguments start at
+// optind afterwards. Returns -1 to go on, else the exit status.
+int ParseOptions(int argc, char** argv, Options* options) {
+  static const struct option kOptions[] = {
+      {"json", no_argument, nullptr, 'j'},
+      {"all", no_argument, nullptr, 'A'},
+      {"socket", required_argument, nullptr, 's'},
+      {"attempts", required_argument, nullptr, 'a'},
+      {"verbose", no_argument, nullptr, 'v'},
+      {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  const char* name = argv[0];
+  options->socket = DaemonInfo().get("mediad", "sock");
+  optind = 0;
+  opterr = 0;
+  int c;
+  while ((c = getopt_long(argc, argv, ":js:a:vh", kOptions, nullptr)) != -1) {
+    switch (c) {
+      case 'j':
+        options->json = true;
+        break;
+      case 'A':
+        if (strcmp(name, "mediainfo") != 0) return OptionError(name, '?', argv);
+        options->all = true;
+        break;
+      case 's':
+        options->socket = optarg;
+        break;
+      case 'a':
+        if (!ParseInt(optarg, 1, kMaxAttempts, &options->attempts)) {
+          return UsageError(name, "--attempts needs a whole number from 1 to " +
+                                      std::to_string(kMaxAttempts) + ", not '" +
+                                      optarg + "'");
+        }
+        break;
+      case 'v':
+        EnableVerboseLogging();
+        break;
+      case 'h':
+        PrintHelp(name);
+        return kExitOk;
+      default:
+        return OptionError(name, c, argv);
+    }
+  }
+  if (optind >= argc) return UsageError(name, "missing FILE");
+  return CheckSocketPath(name, options->socket) ? -1 : kExitError;
+}
+
+}  // namespace
+
+int RunMediaInfo(int argc, char** argv) {
+  Options options;
+  int status = ParseOptions(argc, argv, &options);
+  if (status >= 0) return status;
+  status = kExitOk;
+  Json::Value records(Json::arrayValue);
+  for (int i = optind; i < argc; ++i) {
+    Json::Value reply;
+    int result = Ask(argv[0], options, "GET_MEDIA_INFO", argv[i], &reply);
+    if (result == kExitError) return kExitError;  // the next would wait too
+    if (result != kExitOk) {
+      status = result;
+      continue;
+    }
+    __tag_QUVA_MEDIA_INFO record;
+    MediaInfoJson2Object(reply["media"], record);
+    Json::Value media;
+    MediaInfoObject2Json(record, media);
+    std::string file = argv[i];
+    if (options.json) {
+      Json::Value& entry = records.append(Json::Value(Json::objectValue));
+      entry["file"] = file;
+      entry["table"] = TableOf(file);
+      entry["media"].swap(media);
+      continue;
+    }
+    if (i > optind) printf("\n");
+    PrintRecord(file, media, options.all);
+  }
+  if (options.json) PrintJson(records, false);
+  fflush(stdout);
+  return status;
+}
+
+int RunResolution(int argc, char** argv) {
+  Options options;
+  int status = ParseOptions(argc, argv, &options);
+  if (status >= 0) return status;
+  if (argc - optind > 1) {
+    return UsageError(argv[0], std::string("expects one FILE; unexpected "
+                                           "argument '") +
+                                   argv[optind + 1] + "'");
+  }
+  Json::Value reply;
+  status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", argv[optind], &reply);
+  if (status != kExitOk) return status;
+  int32_t width = ReadInt32(reply, "width");
+  int32_t height = ReadInt32(reply, "height");
+  if (options.json) {
+    Json::Value out(Json::objectValue);
+    out["width"] = width;
+    out["height"] = height;
+    PrintJson(out, false);
+  } else {
+    printf("%dx%d\n", width, height);
+  }
+  return kExitOk;
+}
+
+}  // namespace quvaidx_cli

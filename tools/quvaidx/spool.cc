@@ -1,0 +1,230 @@
+// quvaidx spool: adding entries to a spool queue and trimming its head.
+//
+// `add` goes through WriteIndexQueue, so an entry already queued is not
+// queued twice. `trim` does what a queue's consumer does: it takes the
+// queue's exclusive flock, removes the head with FileRemoveHeadingLine and
+// lets go. Every entry is checked before the first is written, so a bad one
+// leaves the queue as it was.
+#include <errno.h>
+#include <fcntl.h>
+#include <getopt.h>
+#include <limits.h>
+#include <stdio.h>
+#include <string.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "cli.h"
+#include "commands.h"
+#include "quvaidx/system.h"
+
+namespace quvaidx_cli {
+namespace {
+
+constexpr char kName[] = "spool";
+
+void PrintHelp() {
+  printf(
+      "Usage: quvaidx spool add  QUEUE ENTRY...\n"
+      "       quvaidx spool trim QUEUE N\n"
+      "\n"
+      "Works on a spool queue: a text file of one entry per line, appended\n"
+      "under an exclusive flock and consumed from its head.\n"
+      "\n"
+      "  add   appends each ENTRY as one line, unless a line equal to it is\n"
+      "        already there; QUEUE is created when missing. An entry must\n"
+      "        not be empty, hold a line feed or exceed %d bytes; when one\n"
+      "        does, nothing is added.\n"
+      "  trim  removes the first N lines (all of them when N is beyond the\n"
+      "        end) while holding the queue's exclusive flock, as a consumer\n"
+      "        does; waits for the lock as long as another process holds it\n"
+      "\n"
+      "Options:\n"
+      "  -v, --verbose  also show the library's log lines on stderr\n"
+      "  -h, --help     show this help\n"
+      "\n"
+      "An ENTRY that starts with '-' goes after \"--\".\n"
+      "\n"
+      "Exit status: 0 on success, 2 on a usage error, a refused entry or a\n"
+      "failed operation.\n"
+      "\n"
+      "Example:\n"
+      "  quvaidx spool add /tmp/q.queue /share/Photos/2015 /share/Photos/2016\n"
+      "  quvaidx spool trim /tmp/q.queue 1\n",
+      kMaxQueueEntry);
+}
+
+// Why `entry` cannot be queued, or "" when it can.
+std::string EntryProblem(const std::string& entry) {
+  if (entry.empty()) return "an empty entry cannot be queued";
+  if (entry.find('\n') != std::string::npos) {
+    return "an entry must not hold a line feed";
+  }
+  if (entry.size() > static_cast<size_t>(kMaxQueueEntry)) {
+    return "an entry is " + std::to_string(entry.size()) +
+           " bytes long; a queue line holds at most " +
+           std::to_string(kMaxQueueEntry);
+  }
+  return "";
+}
+
+// The directory part of `path`: "." when it has none.
+std::string DirectoryOf(const std::string& path) {
+  size_t slash = path.rfind('/');
+  if (slash == std::string::npos) return ".";
+  if (slash == 0) return "/";
+  return path.substr(0, slash);
+}
+
+// Checks that QUEUE can be written, so that the library's open is not
+// refused: it retries a refused open for sixteen seconds. Prints one line
+// and returns false otherwise.
+bool CheckWritableQueue(const std::string& queue) {
+  struct stat st;
+  if (stat(queue.c_str(), &st) == 0) {
+    if (!S_ISREG(st.st_mode)) {
+      PrintError(kName, queue + " is not a regular file");
+      return false;
+    }
+    if (access(queue.c_str(), W_OK) != 0) {
+      PrintError(kName, queue + ": " + strerror(errno));
+      return false;
+    }
+    return true;
+  }
+  if (errno != ENOENT) {
+    PrintError(kName, queue + ": " + strerror(errno));
+    return false;
+  }
+  std::string dir = DirectoryOf(queue);
+  if (access(dir.c_str(), W_OK | X_OK) != 0) {
+    PrintError(kName,
+               "cannot create " + queue + ": " + dir + ": " + strerror(errno));
+    return false;
+  }
+  return true;
+}
+
+int Add(int count, char** args) {
+  if (count < 2) return UsageError(kName, "add needs QUEUE and an ENTRY");
+  std::string queue = args[0];
+  for (int i = 1; i < count; ++i) {
+    std::string problem = EntryProblem(args[i]);
+    if (!problem.empty()) {
+      PrintError(kName, problem + " (entry " + std::to_string(i) +
+                            "); nothing was added");
+      return kExitError;
+    }
+  }
+  if (!CheckWritableQueue(queue)) return kExitError;
+  for (int i = 1; i < count; ++i) {
+    if (WriteIndexQueue(args[i], queue.c_str()) != 0) {
+      PrintError(kName, std::string("cannot add '") + args[i] + "' to " +
+                            queue + " (--verbose shows the library's report)");
+      return kExitError;
+    }
+  }
+  return kExitOk;
+}
+
+// True when `fd` is still the file at `path`: another consumer may have
+// replaced the queue (trimmed it) while this one waited for the lock.
+bool StillTheQueue(int fd, const char* path) {
+  struct stat open_file;
+  struct stat at_path;
+  return fstat(fd, &open_file) == 0 && stat(path, &at_path) == 0 &&
+         open_file.st_dev == at_path.st_dev &&
+         open_file.st_ino == at_path.st_ino;
+}
+
+int Trim(int count, char** args) {
+  if (count < 2) return UsageError(kName, "trim needs QUEUE and N");
+  if (count > 2) {
+    return UsageError(kName,
+                      std::string("unexpected argument '") + args[2] + "'");
+  }
+  const char* queue = args[0];
+  int lines = 0;
+  if (!ParseInt(args[1], 0, INT_MAX, &lines)) {
+    return UsageError(kName, std::string("N needs a whole number of lines "
+                                         "from 0 to ") +
+                                 std::to_string(INT_MAX) + ", not '" + args[1] +
+                                 "'");
+  }
+  int fd = -1;
+  for (;;) {
+    fd = open(queue, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+      PrintError(kName, std::string(queue) + ": " + strerror(errno));
+      return kExitError;
+    }
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+      close(fd);
+      PrintError(kName, std::string(queue) + " is not a regular file");
+      return kExitError;
+    }
+    int locked;
+    while ((locked = flock(fd, LOCK_EX)) != 0 && errno == EINTR) {
+    }
+    if (locked != 0) {
+      int err = errno;
+      close(fd);
+      PrintError(kName,
+                 std::string("cannot lock ") + queue + ": " + strerror(err));
+      return kExitError;
+    }
+    // Trimming a replaced file would throw away the other consumer's
+    // result: lock the file that is at the path now.
+    if (StillTheQueue(fd, queue)) break;
+    close(fd);
+  }
+  int result = FileRemoveHeadingLine(queue, lines);
+  flock(fd, LOCK_UN);
+  close(fd);
+  if (result != 0) {
+    PrintError(kName, std::string("cannot trim ") + queue +
+                          ": the queue is unchanged, or a temporary file "
+                          "beside it was left behind");
+    return kExitError;
+  }
+  return kExitOk;
+}
+
+}  // namespace
+
+int RunSpool(int argc, char** argv) {
+  static const struct option kOptions[] = {
+      {"verbose", no_argument, nullptr, 'v'},
+      {"help", no_argument, nullptr, 'h'},
+      {nullptr, 0, nullptr, 0},
+  };
+  optind = 0;
+  opterr = 0;
+  int c;
+  // An entry that starts with '-' follows "--".
+  while ((c = getopt_long(argc, argv, ":vh", kOptions, nullptr)) != -1) {
+    switch (c) {
+      case 'v':
+        EnableVerboseLogging();
+        break;
+      case 'h':
+        PrintHelp();
+        return kExitOk;
+      default:
+        return OptionError(kName, c, argv);
+    }
+  }
+  int count = argc - optind;
+  char** args = argv + optind;
+  if (count < 1) return UsageError(kName, "missing the operation: add or trim");
+  std::string op = args[0];
+  if (op == "add") return Add(count - 1, args + 1);
+  if (op == "trim") return Trim(count - 1, args + 1);
+  return UsageError(kName, "unknown operation '" + op + "'");
+}
+
+}  // namespace quvaidx_cli
