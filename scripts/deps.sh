@@ -3,7 +3,8 @@
 # fuzzing need, when any is missing. Needs root (or sudo) only to install.
 set -euo pipefail
 packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
-          libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev)
+          libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev
+          python3 strace time)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" \
