@@ -86,19 +86,10 @@ int QueuePacket(struct bufferevent* bev, const Json::Value& value,
                 bool* too_large) {
   char packet[kPacketBufferSize];
   size_t size = 0;
-  *too_large = false;
-  switch (quvaidx::EncodePacket(value, packet, &size)) {
-    case quvaidx::EncodeStatus::kOk:
-      break;
-    case quvaidx::EncodeStatus::kTooLarge:
-      AppLogError(3, "%s:%d [Error] reply too large: %zu bytes, limit %zu",
-                  kModule, __LINE__, size, kMaxSendBody);
-      *too_large = true;
-      return -1;
-    case quvaidx::EncodeStatus::kFailed:
-      AppLogError(3, "%s:%d [Error] cannot serialise reply", kModule, __LINE__);
-      return -1;
-  }
+  quvaidx::EncodeStatus status =
+      quvaidx::EncodePacketOrLog(value, packet, &size, kModule);
+  *too_large = status == quvaidx::EncodeStatus::kTooLarge;
+  if (status != quvaidx::EncodeStatus::kOk) return -1;
   if (bufferevent_write(bev, packet, size) != 0) {
     AppLogError(3, "%s:%d bufferevent_write", kModule, __LINE__);
     return -1;

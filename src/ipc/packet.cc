@@ -74,17 +74,9 @@ int Readn(int fd, void* buf, size_t n) {
 int SendPacket(int fd, Json::Value& value) {
   char packet[kPacketBufferSize];
   size_t size = 0;
-  switch (quvaidx::EncodePacket(value, packet, &size)) {
-    case quvaidx::EncodeStatus::kOk:
-      break;
-    case quvaidx::EncodeStatus::kTooLarge:
-      AppLogError(3, "%s:%d [Error] packet too large: %zu bytes, limit %zu",
-                  kModule, __LINE__, size, kMaxSendBody);
-      return -1;
-    case quvaidx::EncodeStatus::kFailed:
-      AppLogError(3, "%s:%d [Error] cannot serialise packet", kModule,
-                  __LINE__);
-      return -1;
+  if (quvaidx::EncodePacketOrLog(value, packet, &size, kModule) !=
+      quvaidx::EncodeStatus::kOk) {
+    return -1;
   }
   int written = Writen(fd, packet, size);
   if (written == static_cast<int>(size)) return 0;

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "quvaidx/ipc.h"
+#include "quvaidx/log.h"
 
 namespace quvaidx {
 
@@ -30,6 +31,18 @@ EncodeStatus EncodePacket(const Json::Value& value, char* packet,
   memcpy(packet + kPacketHeaderSize, text.data(), text.size());
   *size = kPacketHeaderSize + text.size();
   return EncodeStatus::kOk;
+}
+
+EncodeStatus EncodePacketOrLog(const Json::Value& value, char* packet,
+                               size_t* size, const char* module) {
+  EncodeStatus status = EncodePacket(value, packet, size);
+  if (status == EncodeStatus::kTooLarge) {
+    AppLogError(3, "%s:%d [Error] packet too large: %zu bytes, limit %zu",
+                module, __LINE__, *size, kMaxSendBody);
+  } else if (status == EncodeStatus::kFailed) {
+    AppLogError(3, "%s:%d [Error] cannot serialise packet", module, __LINE__);
+  }
+  return status;
 }
 
 size_t DecodeBodyLength(const unsigned char* header) {

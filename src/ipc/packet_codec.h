@@ -22,6 +22,12 @@ enum class EncodeStatus {
 // Never throws.
 EncodeStatus EncodePacket(const Json::Value& value, char* packet, size_t* size);
 
+// As EncodePacket, and a failure is logged at level 3 as coming from
+// `module` ("packet too large" with the text's length, or "cannot
+// serialise packet").
+EncodeStatus EncodePacketOrLog(const Json::Value& value, char* packet,
+                               size_t* size, const char* module);
+
 // Returns the body length announced by a 4-byte header. The magic is not
 // examined.
 size_t DecodeBodyLength(const unsigned char* header);
