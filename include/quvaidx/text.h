@@ -53,8 +53,9 @@ extern "C" {
 QUVAIDX_API void MediaInfoValid(__tag_QUVA_MEDIA_INFO* record);
 
 // Returns 1 when `text` is null, empty or valid UTF-8 by ICU's rules
-// (u_strFromUTF8 reports no error), else 0. A failed allocation of the
-// scratch buffer counts as 0.
+// (u_strFromUTF8 reports no error), else 0. Texts under 512 bytes are
+// converted on the stack; for longer ones a failed allocation of the scratch
+// buffer counts as 0.
 QUVAIDX_API int TryUTF8ToUTF16(const char* text);
 
 // Returns 1 when `text` is null, empty or structurally UTF-8: every lead

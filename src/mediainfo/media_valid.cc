@@ -1,9 +1,12 @@
 // MediaInfoValid: the re-encoding of a media record's tag texts to UTF-8,
 // with its fallbacks and the control-character clean-up.
+#include <stdint.h>
 #include <string.h>
 #include <syslog.h>
 
 #include <string_view>
+
+#include <unicode/ustring.h>
 
 #include "mediainfo/json_read.h"
 #include "quvahost/quvahost.h"
@@ -98,26 +101,62 @@ void FallbackAlbum(std::string_view path, char* album) {
   StoreName(folder.substr(slash + 1), album);
 }
 
-// Makes field[kMediaTagSize] a terminated text: a field without a zero byte
-// is taken to end at its last byte.
-void Terminate(char* field) {
-  if (memchr(field, '\0', kMediaTagSize) == nullptr) {
-    field[kMediaTagSize - 1] = '\0';
+// One pass over a tag field: terminates a field that holds no zero byte at
+// its last byte (as if it ended there), and tells its length and whether it
+// holds a control character. Clean records, the common case, need nothing
+// more than this and one validation per text.
+struct FieldScan {
+  size_t length;
+  bool control;
+};
+
+FieldScan ScanField(char* field) {
+  bool control = false;
+  size_t i = 0;
+  // Eight bytes at a time while none of them is below 32 (which includes
+  // the terminator): the test below is exact for "some byte is below 32".
+  constexpr uint64_t kOnes = 0x0101010101010101ull;
+  constexpr uint64_t kHighBits = 0x8080808080808080ull;
+  for (; i + 8 <= kMediaTagSize - 1; i += 8) {
+    uint64_t word;
+    memcpy(&word, field + i, sizeof(word));
+    if (((word - kOnes * 32) & ~word & kHighBits) != 0) break;
   }
+  for (; i < kMediaTagSize - 1; ++i) {
+    unsigned char c = static_cast<unsigned char>(field[i]);
+    if (c == '\0') return {i, control};
+    control = control || c < 32;
+  }
+  field[kMediaTagSize - 1] = '\0';
+  return {kMediaTagSize - 1, control};
+}
+
+// TryUTF8ToUTF16's test on a tag text whose length is known.
+bool IsStrictUTF8(const char* text, size_t length) {
+  if (length == 0) return true;
+  UChar units[kMediaTagSize + 1];
+  int32_t written = 0;
+  UErrorCode status = U_ZERO_ERROR;
+  u_strFromUTF8(units, static_cast<int32_t>(sizeof(units) / sizeof(units[0])),
+                &written, text, static_cast<int32_t>(length), &status);
+  return U_SUCCESS(status);
 }
 
 enum class Fallback { kNone, kTitle, kAlbum };
 
-void ReEncode(char* field, int32_t utf16_flag, Fallback fallback,
-              std::string_view path) {
-  if (TryUTF8ToUTF16(field) == 1) return;
+// Re-encodes a field that is not UTF-8. Returns whether it changed.
+bool ReEncode(char* field, const FieldScan& scan, int32_t utf16_flag,
+              Fallback fallback, const __tag_QUVA_MEDIA_INFO& record) {
+  if (IsStrictUTF8(field, scan.length)) return false;
   int result = utf16_flag != 0
                    ? ConvertUTF16FieldToUTF8(field, kMediaTagSize)
                    : ConvertCodePageFieldToUTF8(field, kMediaTagSize);
-  if (result != -1) return;
+  if (result != -1) return true;
   memset(field, 0, kMediaTagSize);
+  std::string_view path(record.szPath, strnlen(record.szPath, kMediaPathSize));
   if (fallback == Fallback::kTitle) FallbackTitle(path, field);
   if (fallback == Fallback::kAlbum) FallbackAlbum(path, field);
+  return true;
 }
 
 }  // namespace
@@ -128,21 +167,31 @@ extern "C" void MediaInfoValid(__tag_QUVA_MEDIA_INFO* record) {
     return;
   }
   __tag_QUVA_MEDIA_INFO& r = *record;
-  for (char* field : {r.szTitle, r.szArtist, r.szComposer, r.szComment,
-                      r.szAlbum, r.szGenre, r.szAlbumArtist}) {
-    Terminate(field);
+  struct Tag {
+    char* field;
+    const int32_t* utf16_flag;  // null: never re-encoded
+    Fallback fallback;
+    FieldScan scan;
+  };
+  // Re-encoding order first; szAlbumArtist is only cleaned.
+  Tag tags[] = {
+      {r.szTitle, &r.blTitleUTF16, Fallback::kTitle, {}},
+      {r.szArtist, &r.blArtistUTF16, Fallback::kNone, {}},
+      {r.szComposer, &r.blComposerUTF16, Fallback::kNone, {}},
+      {r.szComment, &r.blCommentUTF16, Fallback::kNone, {}},
+      {r.szAlbum, &r.blAlbumUTF16, Fallback::kAlbum, {}},
+      {r.szGenre, &r.blGenreUTF16, Fallback::kNone, {}},
+      {r.szAlbumArtist, nullptr, Fallback::kNone, {}},
+  };
+  for (Tag& tag : tags) tag.scan = ScanField(tag.field);
+  for (Tag& tag : tags) {
+    if (tag.utf16_flag != nullptr &&
+        ReEncode(tag.field, tag.scan, *tag.utf16_flag, tag.fallback, r)) {
+      tag.scan.control = HasControlChar(tag.field) == 1;
+    }
   }
-  std::string_view path(r.szPath, strnlen(r.szPath, kMediaPathSize));
-
-  ReEncode(r.szTitle, r.blTitleUTF16, Fallback::kTitle, path);
-  ReEncode(r.szArtist, r.blArtistUTF16, Fallback::kNone, path);
-  ReEncode(r.szComposer, r.blComposerUTF16, Fallback::kNone, path);
-  ReEncode(r.szComment, r.blCommentUTF16, Fallback::kNone, path);
-  ReEncode(r.szAlbum, r.blAlbumUTF16, Fallback::kAlbum, path);
-  ReEncode(r.szGenre, r.blGenreUTF16, Fallback::kNone, path);
-
-  for (char* field : {r.szAlbum, r.szArtist, r.szAlbumArtist, r.szComposer,
-                      r.szComment, r.szGenre, r.szTitle}) {
-    if (HasControlChar(field) == 1) field[0] = '\0';
+  // A text holding a control character is emptied.
+  for (Tag& tag : tags) {
+    if (tag.scan.control) tag.field[0] = '\0';
   }
 }

@@ -15,15 +15,20 @@ int TryUTF8ToUTF16(const char* text) {
   if (text == nullptr || text[0] == '\0') return 1;
   size_t length = strlen(text);
   // UTF-8 never takes fewer bytes than UTF-16 code units, so length + 1
-  // units hold any conversion with its terminator.
+  // units hold any conversion with its terminator. Tag texts fit the stack
+  // buffer, so the common case allocates nothing.
   if (length >= static_cast<size_t>(INT32_MAX)) return 0;
-  auto* units = static_cast<UChar*>(malloc((length + 1) * sizeof(UChar)));
-  if (units == nullptr) return 0;
+  UChar stack_units[512];
+  UChar* units = stack_units;
+  if (length + 1 > sizeof(stack_units) / sizeof(stack_units[0])) {
+    units = static_cast<UChar*>(malloc((length + 1) * sizeof(UChar)));
+    if (units == nullptr) return 0;
+  }
   int32_t written = 0;
   UErrorCode status = U_ZERO_ERROR;
   u_strFromUTF8(units, static_cast<int32_t>(length + 1), &written, text, -1,
                 &status);
-  free(units);
+  if (units != stack_units) free(units);
   return U_FAILURE(status) ? 0 : 1;
 }
 
