@@ -8,7 +8,6 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -70,14 +69,8 @@ class EventServerTest : public ::testing::Test {
 
   // Connects without running the loop, so nothing is accepted yet.
   int RawConnect() {
-    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-    struct sockaddr_un address = {};
-    address.sun_family = AF_UNIX;
-    strcpy(address.sun_path, path_.c_str());
-    EXPECT_EQ(
-        connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
-    clients_.push_back(fd);
-    return fd;
+    clients_.push_back(ConnectPeer(path_.c_str(), false, 1));
+    return clients_.back();
   }
 
   int Connect() {
@@ -160,29 +153,25 @@ int Echo(Json::Value& request, Json::Value& reply) {
   return request["command"] == "QUIT" ? -1 : 0;
 }
 
-TEST_F(EventServerTest, SuccessReplyIsExactly21Bytes) {
+// A request in pieces reaches the handler once, after its last byte.
+TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPiecesAreJoined) {
   handler_ = Succeed;
   Start();
   int fd = Connect();
-  Send(fd, Request("HANDSHAKE"));
-  EXPECT_EQ(Receive(fd, 21),
-            std::string("\x15\xbe\x00\x11{\"success\":true}\n", 21));
-  ASSERT_EQ(requests_.size(), 1u);
-  EXPECT_EQ(requests_[0]["command"].asString(), "HANDSHAKE");
-}
-
-TEST_F(EventServerTest, PacketInPiecesReachesHandlerOnceAfterLastByte) {
-  Start();
-  int fd = Connect();
-  std::string packet = Request("SLOW");
+  std::string packet = Request("HANDSHAKE");
   for (size_t i = 0; i + 1 < packet.size(); ++i) {
     Send(fd, packet.substr(i, 1));
     RunFor(1);
   }
   EXPECT_TRUE(requests_.empty());
   Send(fd, packet.substr(packet.size() - 1));
-  EXPECT_EQ(ReceiveBody(fd), "{}\n");  // an untouched reply
-  EXPECT_EQ(requests_.size(), 1u);
+  EXPECT_EQ(Receive(fd, 21),
+            std::string("\x15\xbe\x00\x11{\"success\":true}\n", 21));
+  ASSERT_EQ(requests_.size(), 1u);
+  EXPECT_EQ(requests_[0]["command"].asString(), "HANDSHAKE");
+  handler_ = nullptr;
+  Send(fd, Request("UNTOUCHED"));
+  EXPECT_EQ(ReceiveBody(fd), "{}\n");
 }
 
 // Pipelined requests are all answered at once, in order, without waiting
@@ -203,27 +192,24 @@ TEST_F(EventServerTest, PipelinedRequestsAndRefusal) {
   EXPECT_EQ(ReceiveBody(other), "{\"echo\":\"STILL_HERE\"}\n");
 }
 
-TEST_F(EventServerTest, ThrowingHandlerIsLoggedAndClosed) {
+// A throwing handler is logged and its connection closed; a reply too large
+// is replaced; a request announcing too many bytes closes the connection.
+TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
   LogCapture log;
   handler_ = [](Json::Value&, Json::Value&) -> int {
     throw std::runtime_error("bad day");
   };
   Start();
-  int fd = Connect();
-  Send(fd, Request("BOOM"));
-  EXPECT_TRUE(ClosedSilently(fd));
+  int boom = Connect();
+  Send(boom, Request("BOOM"));
+  EXPECT_TRUE(ClosedSilently(boom));
   EXPECT_EQ(log.Normalized(),
             std::vector<std::string>{
                 "quvaidx_daemon:N [Error] [testd] handler threw: bad day"});
-}
-
-TEST_F(EventServerTest, OversizedPacketsAreRefused) {
-  LogCapture log;
   handler_ = [](Json::Value&, Json::Value& reply) {
     reply["blob"] = std::string(20000, 'b');
     return 0;
   };
-  Start();
   int big = Connect();
   Send(big, Request("BIG"));  // a reply too large is replaced
   EXPECT_EQ(ReceiveBody(big),
@@ -231,13 +217,14 @@ TEST_F(EventServerTest, OversizedPacketsAreRefused) {
   int fd = Connect();
   Send(fd, std::string("\x15\xbe\x40\x00{}", 6));  // announces 16384 bytes
   EXPECT_TRUE(ClosedSilently(fd));
-  EXPECT_EQ(requests_.size(), 1u);
+  EXPECT_EQ(requests_.size(), 2u);
   EXPECT_EQ(GetCurrentConnCount(), 1);
-  EXPECT_EQ(log.lines().size(), 2u);
+  EXPECT_EQ(log.lines().size(), 3u);
 }
 
 // An overlong path is refused, not cut: the file at the cut path stays. A
-// stale file is replaced by the socket, which is removed on stop.
+// stale file is replaced by the socket, which is removed on stop. A second
+// server is refused.
 TEST_F(EventServerTest, SocketFile) {
   LogCapture log;
   std::string too_long = dir_.File(std::string(120, 'l'));
@@ -253,16 +240,11 @@ TEST_F(EventServerTest, SocketFile) {
   Start();
   ASSERT_EQ(stat(path_.c_str(), &st), 0);
   EXPECT_TRUE(S_ISSOCK(st.st_mode));
-  StopServer(path_.c_str());
-  EXPECT_NE(access(path_.c_str(), F_OK), 0);
-}
-
-TEST_F(EventServerTest, SecondServerIsRefused) {
-  LogCapture log;
-  Start();
-  std::string other = dir_.File("other.sock");
+  std::string other = dir_.File("other.sock");  // a second server
   EXPECT_EQ(BuildServer(base_, other.c_str(), &args_), -1);
   EXPECT_NE(access(other.c_str(), F_OK), 0);
+  StopServer(path_.c_str());
+  EXPECT_NE(access(path_.c_str(), F_OK), 0);
 }
 
 TEST_F(EventServerTest, AcceptErrorEndsTheLoop) {
@@ -283,7 +265,6 @@ TEST_F(EventServerTest, RunningOutOfDescriptorsPausesAccepting) {
   handler_ = Succeed;
   Start();
   int fd = RawConnect();
-  // Fill the descriptor table so that the server's accept fails.
   struct rlimit saved;
   getrlimit(RLIMIT_NOFILE, &saved);
   struct rlimit low = saved;
@@ -299,7 +280,7 @@ TEST_F(EventServerTest, RunningOutOfDescriptorsPausesAccepting) {
       0u);
   for (int d : filler) close(d);
   setrlimit(RLIMIT_NOFILE, &saved);
-  // The loop kept running; after the pause the connection is served.
+  // After the pause the connection is served.
   Send(fd, Request("HANDSHAKE"));
   EXPECT_EQ(ReceiveBody(fd, 3), "{\"success\":true}\n");
 }

@@ -11,6 +11,7 @@
 
 #include <chrono>
 #include <fstream>
+#include <iterator>
 #include <sstream>
 #include <string>
 #include <thread>
@@ -32,9 +33,8 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::TempDir;
 
 std::string ReadFile(const std::string& path) {
-  std::stringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
+  std::ifstream in(path);
+  return {std::istreambuf_iterator<char>(in), {}};
 }
 
 void WriteFile(const std::string& path, const std::string& text) {
@@ -49,6 +49,7 @@ class LifecycleTest : public ::testing::Test {
 
 // The pid goes in without a line end, replacing a dead instance's; a live
 // instance is refused, its pid file kept, and BecomeDaemon does not detach.
+// A pid file that cannot be made is an error; a missing one is deleted.
 TEST_F(LifecycleTest, OneInstanceAtATime) {
   pid_t dead = fork();
   if (dead == 0) _exit(0);
@@ -63,6 +64,13 @@ TEST_F(LifecycleTest, OneInstanceAtATime) {
             "Daemon alive. No need to start\n"
             "Daemon alive. No need to start\n");
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
+  LogCapture log;
+  std::string bad = dir_.File("missing/d.pid");
+  EXPECT_EQ(BecomeProcess(bad.c_str()), -1);
+  EXPECT_EQ(log.Normalized(),
+            (std::vector<std::string>{"quvaidx_daemon:N [Error] create " + bad +
+                                      " (No such file or directory)"}));
+  EXPECT_EQ(DeletePidFile(dir_.File("none").c_str()), 0);  // missing: still 0
 }
 
 TEST_F(LifecycleTest, RecycledPidDoesNotLockTheDaemonOut) {
@@ -121,16 +129,6 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   EXPECT_EQ(stdin_target, "/dev/null");
 }
 
-TEST_F(LifecycleTest, PidAndMarkerFiles) {
-  LogCapture log;
-  std::string bad = dir_.File("missing/d.pid");
-  EXPECT_EQ(BecomeProcess(bad.c_str()), -1);
-  EXPECT_EQ(log.Normalized(),
-            (std::vector<std::string>{"quvaidx_daemon:N [Error] create " + bad +
-                                      " (No such file or directory)"}));
-  EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);  // missing: still 0
-}
-
 // Ready at once, polled every ten seconds, or given up after fifteen
 // minutes with a notice that the log level does not hold back.
 TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
@@ -153,7 +151,7 @@ TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
             "quvaidx_system:N [NOTICE] system is not ready? start anyway.");
 }
 
-TEST(ForkExecvTest, ChildRunsWithStreamsOnDevNull) {
+TEST(ForkExecvTest, ChildOnDevNullMissingProgramAbortsNoChildWaitKept) {
   TempDir dir;
   std::string out = dir.File("out");
   // $$ is the shell itself, whose streams are the ones ForkExecv set up.
@@ -169,18 +167,15 @@ TEST(ForkExecvTest, ChildRunsWithStreamsOnDevNull) {
   ASSERT_EQ(waitpid(pid, &status, 0), pid);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   EXPECT_EQ(ReadFile(out), "/dev/null\n/dev/null\n/dev/null\n");
-}
-
-// A missing program still yields a child, which aborts; a SA_NOCLDWAIT the
-// caller set is in force again afterwards.
-TEST(ForkExecvTest, MissingProgramAbortsAndNoChildWaitIsRestored) {
+  // A missing program still yields a child, which aborts; a SA_NOCLDWAIT
+  // the caller set is in force again afterwards.
   struct sigaction action = {};
   action.sa_handler = SIG_DFL;
   action.sa_flags = SA_NOCLDWAIT;
-  char* argv[] = {const_cast<char*>("nothing"), nullptr};
-  int pid = ForkExecv("/nonexistent/program", argv);
+  argv[0] = const_cast<char*>("nothing");
+  argv[1] = nullptr;
+  pid = ForkExecv("/nonexistent/program", argv);
   ASSERT_GT(pid, 0);
-  int status = 0;
   ASSERT_EQ(waitpid(pid, &status, 0), pid);
   EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT);
   ASSERT_EQ(sigaction(SIGCHLD, &action, nullptr), 0);

@@ -31,7 +31,7 @@ Json::Value TaskOfTextSize(size_t size) {
 }
 
 Json::Value Task(int n) {
-  Json::Value task(Json::objectValue);
+  Json::Value task;
   task["n"] = n;
   return task;
 }
@@ -140,7 +140,7 @@ TEST_F(TaskQueueTest, QueueRemovedUnderABlockingPopFails) {
   EXPECT_EQ(GetNumOfMessageInQueue(id_), -1);
 }
 
-TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeft) {
+TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeftAndMissingOnesFail) {
   ASSERT_EQ(PushTaskToQueue(id_, Task(1), 1), 0);
   int fresh = CreateMessageQueue(key_file_.c_str(), kProject, 2);
   ASSERT_GE(fresh, 0);
@@ -150,10 +150,7 @@ TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeft) {
   ASSERT_EQ(msgctl(fresh, IPC_STAT, &status), 0);
   EXPECT_EQ(status.msg_qbytes, 2048u);
   id_ = fresh;
-}
-
-TEST_F(TaskQueueTest, CallsWithoutAQueueOrKeyFileFail) {
-  LogCapture log;
+  LogCapture log;  // calls without a queue or a key file fail
   ASSERT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), -1);

@@ -22,22 +22,20 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
 
-Json::Value Object(const char* key, const char* value) {
+Json::Value Command(const char* name) {
   Json::Value object(Json::objectValue);
-  object[key] = value;
+  object["command"] = name;
   return object;
 }
 
-// Answers every request on the connection with {"success":true,"n":index}.
+// Answers every request with {"success":true,"n":index,"echo":request}.
 void AnswerAll(int& fd, int index) {
-  Json::Value request;
-  while (RecvPacket(fd, request) == 0) {
+  for (Json::Value request; RecvPacket(fd, request) == 0;) {
     Json::Value reply(Json::objectValue);
     reply["success"] = true;
     reply["n"] = index;
     reply["echo"] = request;
     if (SendPacket(fd, reply) != 0) return;
-    request = Json::Value();
   }
 }
 
@@ -58,37 +56,31 @@ class ClientTest : public ::testing::Test {
 // at the default level only the error line.
 TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
   LogCapture log(7);
-  const std::string last =
-      "quvaidx_ipc_core:N [Error] connect server: " + path_;
+  const std::string line = "quvaidx_ipc_core:N [Error] connect server: ";
   EXPECT_EQ(ConnectPeer(path_.c_str(), false, 0), -1);
   EXPECT_EQ(ConnectPeer(path_.c_str(), true, -5), -1);
-  EXPECT_EQ(sleep_.calls(), 0);
-  EXPECT_EQ(log.Normalized(), (std::vector<std::string>{last, last}));
-  log.Clear();
   EXPECT_EQ(ConnectPeer(path_.c_str(), false, 3), -1);
   EXPECT_EQ(sleep_.calls(), 3);
   EXPECT_EQ(sleep_.total_seconds(), 3u);
-  std::vector<std::string> expected;
-  for (int i = 0; i < 3; ++i) {
-    expected.push_back("quvaidx_ipc_core:N [Error] connect server: " +
-                       std::to_string(i) + ", " + path_);
-  }
-  expected.push_back(last);
+  std::vector<std::string> expected = {line + path_, line + path_};
+  for (const char* i : {"0, ", "1, ", "2, "})
+    expected.push_back(line + i + path_);
+  expected.push_back(line + path_);
   EXPECT_EQ(log.Normalized(), expected);
   LogCapture quiet;  // threshold 3
   EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
-  EXPECT_EQ(quiet.Normalized(), std::vector<std::string>{last});
+  EXPECT_EQ(quiet.Normalized(), std::vector<std::string>{line + path_});
 }
 
+// A daemon listening at the first 107 bytes of an overlong path must not be
+// reached.
 TEST_F(ClientTest, OverlongPathIsRefusedNotCut) {
   LogCapture log;
   std::string longest = "/tmp/" + std::string(kMaxSocketPath - 5, 'p');
-  std::string too_long = longest + "q";
   {
-    // A daemon listening at the first 107 bytes must not be reached.
     ScriptedPeer peer(longest, AnswerAll);
     ASSERT_TRUE(peer.listening());
-    EXPECT_EQ(ConnectPeer(too_long.c_str(), false, 3), -1);
+    EXPECT_EQ(ConnectPeer((longest + "q").c_str(), false, 3), -1);
     EXPECT_EQ(sleep_.calls(), 0);
     EXPECT_EQ(peer.served(), 0);
     int fd = ConnectPeer(longest.c_str(), false, 1);
@@ -98,75 +90,67 @@ TEST_F(ClientTest, OverlongPathIsRefusedNotCut) {
   EXPECT_EQ(
       log.Normalized(),
       std::vector<std::string>{
-          "quvaidx_ipc_core:N [Error] socket path too long: " + too_long});
-}
-
-TEST_F(ClientTest, PeerThatHangsUpFailsTheHandshakeEachAttempt) {
-  LogCapture log(7);
-  ScriptedPeer peer(path_, Hangup);
-  EXPECT_EQ(ConnectPeer(path_.c_str(), true, 2), -1);
-  EXPECT_EQ(sleep_.calls(), 2);
-  for (const char* n : {"0, ", "1, "}) {
-    EXPECT_EQ(log.Count(std::string("quvaidx_ipc_core:N [Error] app level "
-                                    "handshake: ") +
-                        n + path_),
-              1);
-  }
+          "quvaidx_ipc_core:N [Error] socket path too long: " + longest + "q"});
 }
 
 // A failed exchange empties the request; scalars cannot be cleared in
 // place and become null, without throwing.
 TEST_F(ClientTest, FailedExchangeEmptiesTheRequest) {
-  Json::Value object = Object("command", "X");
+  Json::Value object = Command("X"), text("not an object"), number(5);
   EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), object, 1), -1);
-  EXPECT_TRUE(object.isObject() && object.empty());
-  Json::Value text("not an object");
   EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), text, 1), -1);
-  EXPECT_TRUE(text.isNull());
-  Json::Value number(5);
   EXPECT_EQ(AutoSendPacket(path_.c_str(), number, 1), -1);
-  EXPECT_TRUE(number.isNull());
+  EXPECT_EQ(object, Json::Value(Json::objectValue));
+  EXPECT_TRUE(text.isNull() && number.isNull());
 }
 
 // A reset restarts the exchange (answered on the second connection), at
-// most kMaxExchangeRestarts times.
+// most kMaxExchangeRestarts times; a peer that hangs up fails the handshake
+// on each attempt.
 TEST_F(ClientTest, ResetRestartsTheExchangeAFewTimes) {
-  LogCapture log;
+  LogCapture log(7);
   {
     ScriptedPeer peer(path_, [](int& fd, int index) {
       if (index > 0) AnswerAll(fd, index);
     });
-    Json::Value value = Object("command", "PING");
+    Json::Value value = Command("PING");
     ASSERT_EQ(AutoSendRecvPacket(path_.c_str(), -1, value, 1), 0);
     EXPECT_EQ(value["n"].asInt(), 1);
-    EXPECT_EQ(value["echo"], Object("command", "PING"));
+    EXPECT_EQ(value["echo"], Command("PING"));
   }
   ScriptedPeer peer(path_, Hangup);
-  Json::Value value = Object("command", "PING");
+  Json::Value value = Command("PING");
   EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), value, 1), -1);
   EXPECT_TRUE(value.empty());
-  EXPECT_EQ(log.Normalized(), std::vector<std::string>{
-                                  "quvaidx_ipc_core:N [Error] connection to " +
-                                  path_ + " lost 4 times, giving up"});
+  EXPECT_EQ(log.Count("quvaidx_ipc_core:N [Error] connection to " + path_ +
+                      " lost 4 times, giving up"),
+            1);
   while (peer.served() < kMaxExchangeRestarts + 1) usleep(1000);
   usleep(20 * 1000);
   EXPECT_EQ(peer.served(), kMaxExchangeRestarts + 1);
+  FakeSleep sleep;
+  EXPECT_EQ(ConnectPeer(path_.c_str(), true, 2), -1);
+  EXPECT_EQ(sleep.calls(), 2);
+  for (const char* n : {"0, ", "1, "}) {
+    EXPECT_EQ(log.Count("quvaidx_ipc_core:N [Error] app level handshake: " +
+                        std::string(n) + path_),
+              1);
+  }
 }
 
 TEST_F(ClientTest, SendWithoutReplyHandshakesFirstAndNullsTheValue) {
   Json::Value received;
   ScriptedPeer peer(path_, [&](int& fd, int) {
-    Json::Value request;
+    Json::Value request, reply(Json::objectValue);
     ASSERT_EQ(RecvPacket(fd, request), 0);
-    Json::Value reply(Json::objectValue);
     SendPacket(fd, reply);
     ASSERT_EQ(RecvPacket(fd, received), 0);
   });
-  Json::Value value = Object("command", "NOTIFY");
+  Json::Value value = Command("NOTIFY");
   ASSERT_EQ(AutoSendPacket(path_.c_str(), value, 1), 0);
   EXPECT_TRUE(value.isNull());
   while (peer.served() < 1) usleep(1000);
-  EXPECT_EQ(received, Object("command", "NOTIFY"));
+  EXPECT_EQ(received, Command("NOTIFY"));
 }
 
 // The caller's descriptor is used (the path not looked at) and left open; a
@@ -176,16 +160,16 @@ TEST_F(ClientTest, ExchangeOnCallersDescriptor) {
   int fd = ConnectPeer(path_.c_str(), false, 1);
   ASSERT_GE(fd, 0);
   for (int i = 0; i < 2; ++i) {
-    Json::Value value = Object("command", "AGAIN");
+    Json::Value value = Command("AGAIN");
     ASSERT_EQ(AutoSendRecvPacket(nullptr, fd, value, 0), 0);
-    EXPECT_EQ(value["echo"]["command"].asString(), "AGAIN");
+    EXPECT_EQ(value["echo"], Command("AGAIN"));
   }
   EXPECT_NE(fcntl(fd, F_GETFD), -1);
   DisconnectPeer(fd);
   int fds[2];
   ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
   close(fds[1]);
-  Json::Value value = Object("command", "X");
+  Json::Value value = Command("X");
   EXPECT_EQ(AutoSendRecvPacketByFd(fds[0], value, 0), -2);
   EXPECT_TRUE(value.empty());
   close(fds[0]);

@@ -3,8 +3,10 @@
 // on failure, the daemon down, the index daemon's alive check.
 #include <string.h>
 
+#include <memory>
 #include <mutex>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -34,46 +36,67 @@ Json::Value Parse(const char* text) {
   return value;
 }
 
-// A daemon that answers every request with the same reply and keeps the
-// requests it received.
-class Daemon {
- public:
-  Daemon(const std::string& path, Json::Value reply)
-      : reply_(std::move(reply)),
-        peer_(path, [this](int& fd, int) { Serve(fd); }) {}
-
-  std::vector<Json::Value> requests() {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return requests_;
-  }
-  int served() const { return peer_.served(); }
-
- private:
-  void Serve(int fd) {
-    Json::Value request;
-    if (RecvPacket(fd, request) != 0) return;
-    {
-      std::lock_guard<std::mutex> lock(mutex_);
-      requests_.push_back(request);
-    }
-    Json::Value reply = reply_;
-    SendPacket(fd, reply);
-  }
-
-  Json::Value reply_;
-  std::mutex mutex_;
-  std::vector<Json::Value> requests_;
-  ScriptedPeer peer_;  // last: starts serving once the rest is built
+struct Outputs {
+  __tag_QUVA_MEDIA_INFO record;
+  Resolution resolution;
+  _VIDEO_METADATA_ metadata;
+  int size_map, dir_size_map;
 };
 
+// The typed requests that fill Outputs, with their results, and what each
+// sends to which daemon.
+std::vector<int> CallAll(Outputs& o) {
+  return {QUVAIDX_GetMediaInfo("/a/b.mp3", &o.record),
+          QUVAIDX_GetMediaResolution("/v.mp4", &o.resolution),
+          QUVAIDX_GetVideoMetadata("/v.mp4", &o.metadata),
+          QUVAIDX_GetThumbSizeMap("/p.jpg", THUMB_TYPE_PHOTO, &o.size_map),
+          QUVAIDX_GetDirThumbSizeMap("/dir", THUMB_TYPE_VIDEO, &o.dir_size_map),
+          QUVAIDX_IsVideoNeedConvert("/v.avi")};
+}
+const char kSent[] = R"([
+    {"to": "media", "command": "GET_MEDIA_INFO", "path": "/a/b.mp3"},
+    {"to": "media", "command": "GET_MEDIA_RESOLUTION", "path": "/v.mp4"},
+    {"to": "media", "command": "GET_VIDEO_METADATA", "path": "/v.mp4"},
+    {"to": "plugin", "command": "GET_THUMB_SIZE_MAP", "path": "/p.jpg",
+     "type": 1},
+    {"to": "plugin", "command": "GET_DIR_THUMB_SIZE_MAP", "path": "/dir",
+     "type": 2},
+    {"to": "plugin", "command": "IS_VIDEO_NEED_CONVERT", "path": "/v.avi"}])";
+
+// Daemons on both sockets answer every request with reply_ and record it,
+// with "to": the daemon's name.
 class IndexRequestsTest : public ::testing::Test {
  protected:
   IndexRequestsTest()
       : previous_(quvaidx::SetIndexSockets(
             {media_path_.c_str(), plugin_path_.c_str()})) {}
   ~IndexRequestsTest() override {
+    peers_.clear();
     quvaidx::SetIndexSockets(previous_);
     EXPECT_TRUE(leaks_.NoLeak());
+  }
+
+  void Serve(const char* reply) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    reply_ = Parse(reply);
+    for (const char* name : {"media", "plugin"}) {
+      if (peers_.size() == 2) break;
+      auto script = [this, name](int& fd, int) {
+        Json::Value request;
+        if (RecvPacket(fd, request) != 0) return;
+        std::lock_guard<std::mutex> lock(mutex_);
+        request["to"] = name;
+        received_.append(request);
+        Json::Value reply = reply_;
+        SendPacket(fd, reply);
+      };
+      peers_.emplace_back(new ScriptedPeer(
+          name[0] == 'm' ? media_path_ : plugin_path_, script));
+    }
+  }
+  Json::Value Received() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return received_;
   }
 
   FdLeakCheck leaks_;
@@ -82,59 +105,30 @@ class IndexRequestsTest : public ::testing::Test {
   std::string plugin_path_ = dir_.File("plugin.sock");
   quvaidx::IndexSockets previous_;
   FakeSleep sleep_;
+  std::mutex mutex_;
+  Json::Value reply_;
+  Json::Value received_{Json::arrayValue};
+  std::vector<std::unique_ptr<ScriptedPeer>> peers_;
 };
 
-// Each request's keys, and reply keys read with guards: mistyped or missing
-// ones read as zero.
-TEST_F(IndexRequestsTest, MediaDaemonRequestsSendKeysAndReadGuarded) {
-  Daemon daemon(media_path_, Parse(R"({"success": true, "media": {"ID": 9,
-      "szTitle": "T", "fileSize": 4294967301, "track": "bad"}, "width": "1920",
+// Mistyped or missing reply keys read as zero.
+TEST_F(IndexRequestsTest, RequestsSendTheirKeysAndReadRepliesGuarded) {
+  Serve(R"({"success": true, "media": {"ID": 9, "szTitle": "T",
+      "fileSize": 4294967301, "track": "bad"}, "width": "1920",
       "height": 99999999999, "metadata": {"rotation": 270,
-      "par": {"width": 4, "height": 3}}})"));
-  __tag_QUVA_MEDIA_INFO record;
-  memset(&record, 0x5A, sizeof(record));
-  ASSERT_EQ(QUVAIDX_GetMediaInfo("/a/b.mp3", &record), 0);
-  EXPECT_EQ(record.ID, 9u);
-  EXPECT_STREQ(record.szTitle, "T");
-  EXPECT_EQ(record.fileSize, 4294967301u);
-  EXPECT_EQ(record.track, 0);
-  Resolution resolution = {5, 5};
-  ASSERT_EQ(QUVAIDX_GetMediaResolution("/v.mp4", &resolution), 0);
-  EXPECT_EQ(resolution.width, 0);
-  EXPECT_EQ(resolution.height, 0);
-  _VIDEO_METADATA_ metadata = {1, 1, 1};
-  ASSERT_EQ(QUVAIDX_GetVideoMetadata("/v.mp4", &metadata), 0);
-  EXPECT_EQ(metadata.rotation, 270);
-  EXPECT_EQ(metadata.parWidth, 4);
-  EXPECT_EQ(metadata.parHeight, 3);
-  std::vector<Json::Value> requests = daemon.requests();
-  ASSERT_EQ(requests.size(), 3u);
-  EXPECT_EQ(requests[0],
-            Parse(R"({"command": "GET_MEDIA_INFO", "path": "/a/b.mp3"})"));
-  EXPECT_EQ(requests[1],
-            Parse(R"({"command": "GET_MEDIA_RESOLUTION", "path": "/v.mp4"})"));
-  EXPECT_EQ(requests[2],
-            Parse(R"({"command": "GET_VIDEO_METADATA", "path": "/v.mp4"})"));
-}
-
-TEST_F(IndexRequestsTest, PluginDaemonRequestsSendKeysAndReadResults) {
-  Daemon plugin(plugin_path_,
-                Parse(R"({"success": true, "size_map": 12, "result": -2})"));
-  int size_map = 0;
-  ASSERT_EQ(QUVAIDX_GetThumbSizeMap("/p.jpg", THUMB_TYPE_PHOTO, &size_map), 0);
-  EXPECT_EQ(size_map, 12);
-  size_map = 0;
-  ASSERT_EQ(QUVAIDX_GetDirThumbSizeMap("/dir", THUMB_TYPE_VIDEO, &size_map), 0);
-  EXPECT_EQ(size_map, 12);
-  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert("/v.avi"), -2);
-  std::vector<Json::Value> requests = plugin.requests();
-  ASSERT_EQ(requests.size(), 3u);
-  EXPECT_EQ(requests[0], Parse(R"({"command": "GET_THUMB_SIZE_MAP",
-                                   "path": "/p.jpg", "type": 1})"));
-  EXPECT_EQ(requests[1], Parse(R"({"command": "GET_DIR_THUMB_SIZE_MAP",
-                                   "path": "/dir", "type": 2})"));
-  EXPECT_EQ(requests[2],
-            Parse(R"({"command":"IS_VIDEO_NEED_CONVERT","path":"/v.avi"})"));
+      "par": {"width": 4, "height": 3}}, "size_map": 12, "result": -2})");
+  Outputs o;
+  memset(&o, 0x5A, sizeof(o));
+  EXPECT_EQ(CallAll(o), (std::vector<int>{0, 0, 0, 0, 0, -2}));
+  EXPECT_EQ(o.record.ID, 9u);
+  EXPECT_STREQ(o.record.szTitle, "T");
+  EXPECT_EQ(o.record.fileSize, 4294967301u);
+  EXPECT_EQ(
+      std::make_tuple(o.record.track, o.resolution.width, o.resolution.height,
+                      o.metadata.rotation, o.metadata.parWidth,
+                      o.metadata.parHeight, o.size_map, o.dir_size_map),
+      std::make_tuple(0, 0, 0, 270, 4, 3, 12, 12));
+  EXPECT_EQ(Received(), Parse(kSent));
 }
 
 // A reply that does not say "success": true leaves every output untouched.
@@ -143,29 +137,16 @@ TEST_F(IndexRequestsTest, RefusedRepliesLeaveOutputsUntouched) {
        {R"({"width": 1, "media": {"ID": 1}, "result": 1, "size_map": 1})",
         R"({"success": false, "width": 1, "result": 1})", R"([1, 2, 3])"}) {
     SCOPED_TRACE(reply);
-    Daemon media(media_path_, Parse(reply));
-    Daemon plugin(plugin_path_, Parse(reply));
+    Serve(reply);
     LogCapture log;
-    Resolution resolution = {5, 6};
-    EXPECT_EQ(QUVAIDX_GetMediaResolution("/v", &resolution), -1);
-    EXPECT_EQ(resolution.width, 5);
-    EXPECT_EQ(resolution.height, 6);
-    __tag_QUVA_MEDIA_INFO record;
-    memset(&record, 0x5A, sizeof(record));
-    EXPECT_EQ(QUVAIDX_GetMediaInfo("/v", &record), -1);
-    EXPECT_EQ(record.ID, 0x5A5A5A5Au);
-    _VIDEO_METADATA_ metadata = {7, 7, 7};
-    EXPECT_EQ(QUVAIDX_GetVideoMetadata("/v", &metadata), -1);
-    EXPECT_EQ(metadata.rotation, 7);
-    int size_map = 42;
-    EXPECT_EQ(QUVAIDX_GetThumbSizeMap("/v", THUMB_TYPE_PHOTO, &size_map), -1);
-    EXPECT_EQ(QUVAIDX_GetDirThumbSizeMap("/v", THUMB_TYPE_VIDEO, &size_map),
-              -1);
-    EXPECT_EQ(size_map, 42);
-    EXPECT_EQ(QUVAIDX_IsVideoNeedConvert("/v"), 0);
+    Outputs o, before;
+    memset(&o, 0x5A, sizeof(o));
+    memset(&before, 0x5A, sizeof(before));
+    EXPECT_EQ(CallAll(o), (std::vector<int>{-1, -1, -1, -1, -1, 0}));
+    EXPECT_EQ(memcmp(&o, &before, sizeof(o)), 0);
     EXPECT_TRUE(log.lines().empty());
-    memset(&record, 0, sizeof(record));
-    EXPECT_EQ(QUVAIDX_IndexConvertAdd(&record, &record, Json::Value()), -1);
+    memset(&o.record, 0, sizeof(o.record));
+    EXPECT_EQ(QUVAIDX_IndexConvertAdd(&o.record, &o.record, Json::Value()), -1);
     EXPECT_EQ(log.Normalized(), std::vector<std::string>{"quvaidx_ipc:N fail"});
   }
 }
@@ -176,52 +157,43 @@ TEST_F(IndexRequestsTest, IndexConvertAddSendsPackageOnlyWhenNotEmpty) {
       {Json::Value(Json::objectValue), false},
       {Json::Value(""), true},
       {Parse(R"({"name": "pkg"})"), true}};
-  Daemon plugin(plugin_path_, Parse(R"({"success": true})"));
-  __tag_QUVA_MEDIA_INFO source, converted;
-  memset(&source, 0, sizeof(source));
-  memset(&converted, 0, sizeof(converted));
+  Serve(R"({"success": true})");
+  __tag_QUVA_MEDIA_INFO source = {}, converted = {};
   strcpy(source.szPath, "/v.avi");
   strcpy(converted.szPath, "/v.mp4");
   for (const auto& c : cases) {
     EXPECT_EQ(QUVAIDX_IndexConvertAdd(&source, &converted, c.first), 0);
   }
-  std::vector<Json::Value> requests = plugin.requests();
-  ASSERT_EQ(requests.size(), 4u);
-  for (size_t i = 0; i < requests.size(); ++i) {
+  Json::Value received = Received();
+  ASSERT_EQ(received.size(), 4u);
+  for (Json::ArrayIndex i = 0; i < received.size(); ++i) {
     SCOPED_TRACE(i);
-    EXPECT_EQ(requests[i]["command"], "INDEX_CONVERT_ADD");
-    EXPECT_EQ(requests[i]["src"]["szPath"], "/v.avi");
-    EXPECT_EQ(requests[i]["convert"]["szPath"], "/v.mp4");
-    EXPECT_EQ(requests[i]["src"].size(), 47u);
-    EXPECT_EQ(requests[i].isMember("package"), cases[i].second);
-    if (cases[i].second) {
-      EXPECT_EQ(requests[i]["package"], cases[i].first);
-    }
+    const Json::Value& request = received[i];
+    EXPECT_EQ(request["command"], "INDEX_CONVERT_ADD");
+    EXPECT_EQ(request["src"]["szPath"], "/v.avi");
+    EXPECT_EQ(request["convert"]["szPath"], "/v.mp4");
+    EXPECT_EQ(request["src"].size(), 47u);
+    EXPECT_EQ(request.isMember("package"), cases[i].second);
+    if (cases[i].second) EXPECT_EQ(request["package"], cases[i].first);
   }
 }
 
-__tag_QUVA_MEDIA_INFO g_record;
-
 TEST_F(IndexRequestsTest, DaemonDownFailsAfterEveryAttemptWithItsLine) {
-  const std::pair<const char*, int (*)()> cases[] = {
-      {"GetMediaInfo()", [] { return QUVAIDX_GetMediaInfo("/x", &g_record); }},
-      {"IndexConvertAdd()",
-       [] { return QUVAIDX_IndexConvertAdd(&g_record, &g_record, {}); }}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.first);
+  for (std::string name : {"GetMediaInfo()", "IndexConvertAdd()"}) {
     FakeSleep sleep;
     LogCapture log(0);  // the typed requests' lines ignore the level
-    EXPECT_EQ(c.second(), -1);
-    EXPECT_EQ(sleep.calls(), kIndexRequestAttempts);
+    __tag_QUVA_MEDIA_INFO r = {};
+    EXPECT_EQ(name[0] == 'G' ? QUVAIDX_GetMediaInfo("/x", &r)
+                             : QUVAIDX_IndexConvertAdd(&r, &r, {}),
+              -1);
+    EXPECT_EQ(sleep.calls(), kIndexRequestAttempts) << name;
     EXPECT_EQ(log.Normalized(),
-              std::vector<std::string>{std::string("quvaidx_ipc:N [Error] ") +
-                                       c.first});
+              std::vector<std::string>{"quvaidx_ipc:N [Error] " + name});
   }
 }
 
 TEST_F(IndexRequestsTest, AllPluginNamesOnlyWhileTheIndexDaemonLives) {
-  Daemon plugin(plugin_path_,
-                Parse(R"({"success": true, "plugin_names": ["a", "b"]})"));
+  Serve(R"({"success": true, "plugin_names": ["a", "b"]})");
   FakeHost host;
   LogCapture log(7);
   host.Answer(HostOp::kProcAliveByPidFile, {0});
@@ -229,7 +201,7 @@ TEST_F(IndexRequestsTest, AllPluginNamesOnlyWhileTheIndexDaemonLives) {
   EXPECT_EQ(IsQuvaindexAlive(), 0);
   EXPECT_EQ(QUVAIDX_GetAllPluginName(names), -1);
   EXPECT_EQ(names, "untouched");
-  EXPECT_EQ(plugin.served(), 0);
+  EXPECT_TRUE(Received().empty());
   EXPECT_TRUE(log.lines().empty());
   EXPECT_EQ(sleep_.calls(), 0);
 
@@ -237,8 +209,8 @@ TEST_F(IndexRequestsTest, AllPluginNamesOnlyWhileTheIndexDaemonLives) {
   EXPECT_EQ(IsQuvaindexAlive(), 1);
   ASSERT_EQ(QUVAIDX_GetAllPluginName(names), 0);
   EXPECT_EQ(names, Parse(R"(["a", "b"])"));
-  EXPECT_EQ(plugin.requests()[0],
-            Parse(R"({"command":"GET_ALL_PLUGIN_NAME"})"));
+  EXPECT_EQ(Received()[0],
+            Parse(R"({"to": "plugin", "command": "GET_ALL_PLUGIN_NAME"})"));
 }
 
 }  // namespace

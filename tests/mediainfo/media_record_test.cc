@@ -1,14 +1,40 @@
-// The media record's JSON form: round trips, 64-bit sizes, absent and
-// mistyped members, texts too long for their fields, video metadata.
+// The media record's JSON form (round trips, 64-bit sizes, absent and
+// mistyped members, texts too long for their fields, video metadata) and its
+// two dumps, on standard output and in the system log.
+#include <stdio.h>
 #include <string.h>
+#include <syslog.h>
 
+#include <iterator>
+#include <map>
+#include <sstream>
 #include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
 #include "quvaidx/mediainfo.h"
+#include "support/log_capture.h"
 
 namespace {
+
+using quvaidx::test::LogCapture;
+
+// The members in record (and dump) order.
+std::vector<std::string> Fields() {
+  std::istringstream list(
+      "ID szPath szName szDesc track disc year szTitle szAlbum szArtist "
+      "szAlbumArtist szGenre szComposer szComment szMake szModel szExposure "
+      "szAperture szTakenTime szDate szMDate duration audio_bitrate "
+      "frame_bitrate video_bitrate frame_rate_num frame_rate_den frequency "
+      "channel resolutionX resolutionY fileSize song_count blTitleUTF16 "
+      "blArtistUTF16 blAlbumUTF16 blGenreUTF16 blComposerUTF16 blCommentUTF16 "
+      "coverCount iso szVideoCodec szContainerType videoProfile videoLevel "
+      "szAudioCodec szFsUUID");
+  return {std::istream_iterator<std::string>(list), {}};
+}
+
+bool IsText(const std::string& name) { return name.compare(0, 2, "sz") == 0; }
 
 Json::Value Parse(const char* text) {
   Json::Value value;
@@ -33,37 +59,27 @@ __tag_QUVA_MEDIA_INFO Zero() {
   return r;
 }
 
-// Every member set to something other than zero, unsigned values above
-// INT32_MAX, a size above 4 GiB, non-ASCII texts.
-const char kFull[] = R"({"ID": 4000000000, "szPath": "/share/A/01 song.mp3",
-  "szName": "01 song.mp3", "szDesc": "d", "track": 1, "disc": -2, "year": 1999,
-  "szTitle": "Песня", "szAlbum": "专辑", "szArtist": "a 🎵", "szAlbumArtist": "aa",
-  "szGenre": "g", "szComposer": "c", "szComment": "100% fine", "szMake": "m",
-  "szModel": "mo", "szExposure": "1/250", "szAperture": "f/2.8",
-  "szTakenTime": "2020:01:02 03:04:05", "szDate": "2020-01-02",
-  "szMDate": "2021-01-02", "duration": 1.5, "audio_bitrate": 320000,
-  "frame_bitrate": 4000000000, "video_bitrate": 5000000, "frame_rate_num": 30000,
-  "frame_rate_den": 1001, "frequency": 44100, "channel": 2, "resolutionX": 1920,
-  "resolutionY": 1080, "fileSize": 1099511627783, "song_count": 12,
-  "blTitleUTF16": 1, "blArtistUTF16": 2, "blAlbumUTF16": 3, "blGenreUTF16": 4,
-  "blComposerUTF16": 5, "blCommentUTF16": -1, "coverCount": 3, "iso": 400,
-  "szVideoCodec": "h264", "szContainerType": "mp4", "videoProfile": 100,
-  "videoLevel": 41, "szAudioCodec": "aac", "szFsUUID": "1234-abcd"})";
+static_assert(sizeof(__tag_QUVA_MEDIA_INFO) == 11712 &&
+                  sizeof(_VIDEO_METADATA_) == 12 && sizeof(Resolution) == 8,
+              "the record layout is the binary interface");
 
-TEST(MediaRecordTest, LayoutIsTheBinaryInterface) {
-  EXPECT_EQ(sizeof(__tag_QUVA_MEDIA_INFO), 11712u);
-  EXPECT_EQ(sizeof(__tag_QUVA_MEDIA_INFO::szPath), 4096u);
-  EXPECT_EQ(sizeof(__tag_QUVA_MEDIA_INFO::szExposure), 20u);
-  EXPECT_EQ(sizeof(__tag_QUVA_MEDIA_INFO::fileSize), 8u);
-  EXPECT_EQ(sizeof(_VIDEO_METADATA_), 12u);
-  EXPECT_EQ(sizeof(Resolution), 8u);
-}
-
-// Compared as text, so a flag written as a boolean or a real written as an
-// integer shows; the stale member must go.
+// Every member distinct and non-zero: non-ASCII texts, unsigned values above
+// INT32_MAX, negative ints, a size above 4 GiB. Compared as text, so a flag
+// written as a boolean or a real written as an integer shows; the stale
+// member must go.
 TEST(MediaRecordTest, RoundTripKeepsEveryMemberAndItsType) {
-  const Json::Value in = Parse(kFull);
-  ASSERT_EQ(in.size(), 47u);
+  Json::Value in(Json::objectValue);
+  int n = 0;
+  for (const std::string& name : Fields()) {
+    ++n;
+    in[name] = IsText(name) ? Json::Value(std::to_string(n) + " é中🎵")
+                            : Json::Value(n);
+  }
+  in["ID"] = in["frame_bitrate"] = 4000000000u;
+  in["disc"] = -2;
+  in["blCommentUTF16"] = -1;
+  in["duration"] = 1.5;
+  in["fileSize"] = Json::UInt64{1099511627783};
   __tag_QUVA_MEDIA_INFO r = FromJson(in);
   Json::Value out(Json::objectValue);
   out["stale"] = 1;
@@ -77,16 +93,11 @@ TEST(MediaRecordTest, RoundTripKeepsEveryMemberAndItsType) {
   Json::Value scalar = "text";
   MediaInfoObject2Json(r, scalar);
   EXPECT_EQ(scalar.size(), 47u);
-}
-
-TEST(MediaRecordTest, SizesOf4GiBAndMoreSurvive) {
   for (uint64_t size : {uint64_t{1} << 32, UINT64_MAX}) {
-    __tag_QUVA_MEDIA_INFO r = Zero();
     r.fileSize = size;
-    Json::Value json;
-    MediaInfoObject2Json(r, json);
-    EXPECT_TRUE(json["fileSize"].isUInt64());
-    EXPECT_EQ(FromJson(json).fileSize, size);
+    MediaInfoObject2Json(r, out);
+    EXPECT_TRUE(out["fileSize"].isUInt64());
+    EXPECT_EQ(FromJson(out).fileSize, size);
   }
 }
 
@@ -109,37 +120,28 @@ TEST(MediaRecordTest, AbsentMembersAreZeroAndFittingValuesAreRead) {
   EXPECT_TRUE(in["szPath"].isNull());
 }
 
-// Every mistyped or out-of-range member converts to 0 (or an empty text)
-// instead of throwing out of the library.
+// Every mistyped or out-of-range member, set alone, converts to 0 (or an
+// empty text) instead of throwing out of the library.
 TEST(MediaRecordTest, MistypedMembersConvertToZeroWithoutThrowing) {
-  const Json::Value object = Parse(R"({"a": 1})");
-  const std::pair<const char*, Json::Value> cases[] = {
-      {"track", "12"},
-      {"year", object},
-      {"disc", Parse("[1]")},
-      {"ID", -1},
-      {"audio_bitrate", -0.5},
-      {"video_bitrate", Json::UInt64{1} << 32},
-      {"resolutionX", Json::Int64{1} << 31},
-      {"resolutionY", -(Json::Int64{1} << 31) - 1},
-      {"channel", 3e10},
-      {"fileSize", -5},
-      {"fileSize", 1e20},
-      {"fileSize", "4294967301"},
-      {"duration", "1.5"},
-      {"duration", 1e300},
-      {"blTitleUTF16", "yes"},
-      {"szTitle", 5},
-      {"szAlbum", object},
-      {"szPath", true}};
   const __tag_QUVA_MEDIA_INFO zero = Zero();
-  for (const auto& c : cases) {
-    SCOPED_TRACE(std::string(c.first) + " = " + Text(c.second));
-    Json::Value in(Json::objectValue);
-    in[c.first] = c.second;
-    __tag_QUVA_MEDIA_INFO r;
-    ASSERT_NO_THROW(MediaInfoJson2Object(in, r));
-    EXPECT_EQ(memcmp(&r, &zero, sizeof(r)), 0);
+  for (const char* cases :
+       {R"({"track": "12", "year": {"a": 1}, "disc": [1], "ID": -1,
+            "audio_bitrate": -0.5, "video_bitrate": 4294967296,
+            "resolutionX": 2147483648, "resolutionY": -2147483649,
+            "channel": 3e10, "fileSize": -5, "duration": "1.5",
+            "blTitleUTF16": "yes", "szTitle": 5, "szAlbum": {"a": 1},
+            "szPath": true})",
+        R"({"fileSize": 1e20, "duration": 1e300})",
+        R"({"fileSize": "4294967301"})"}) {
+    const Json::Value all = Parse(cases);
+    for (const std::string& name : all.getMemberNames()) {
+      SCOPED_TRACE(name + " = " + Text(all[name]));
+      Json::Value in(Json::objectValue);
+      in[name] = all[name];
+      __tag_QUVA_MEDIA_INFO r;
+      ASSERT_NO_THROW(MediaInfoJson2Object(in, r));
+      EXPECT_EQ(memcmp(&r, &zero, sizeof(r)), 0);
+    }
   }
   for (Json::Value in : {Json::Value("text"), Json::Value(Json::arrayValue)}) {
     const Json::Value copy = in;
@@ -165,8 +167,7 @@ TEST(MediaRecordTest, LongTextsAreCutAtCharacterBoundaries) {
     while (text.size() < 400) text += c.first;
     SCOPED_TRACE(text.substr(0, 8));
     Json::Value in(Json::objectValue);
-    in["szTitle"] = text;
-    in["szExposure"] = text;
+    in["szTitle"] = in["szExposure"] = text;
     __tag_QUVA_MEDIA_INFO r = FromJson(in);
     EXPECT_EQ(std::string(r.szTitle), text.substr(0, c.second));
     EXPECT_LE(strlen(r.szExposure), 19u);
@@ -194,6 +195,70 @@ TEST(VideoMetadataTest, RoundTripAndMistypedMembers) {
     EXPECT_EQ(got.rotation, text[0] == '[' ? 0 : 90);
     EXPECT_EQ(got.parWidth, 0);
     EXPECT_EQ(got.parHeight, 0);
+  }
+}
+
+// The dump of a record with ID 7, szTitle "Song", duration 1.5, fileSize
+// 2^32 + 5 and everything else zero or empty: one item per member, printed
+// without a line feed, logged as one error line each whatever the level.
+TEST(MediaDumpTest, PrintAndSyslogWriteExactlyTheItems) {
+  __tag_QUVA_MEDIA_INFO r = Zero();
+  r.ID = 7;
+  strcpy(r.szTitle, "Song");
+  r.duration = 1.5f;
+  r.fileSize = (uint64_t{1} << 32) + 5;
+  const std::map<std::string, std::string> set = {{"ID", "7"},
+                                                  {"szTitle", "Song"},
+                                                  {"duration", "1.500000"},
+                                                  {"fileSize", "4294967301"}};
+  std::vector<std::string> items;
+  for (const std::string& name : Fields()) {
+    auto it = set.find(name);
+    std::string value = it != set.end() ? it->second : IsText(name) ? "" : "0";
+    char item[64];
+    snprintf(item, sizeof(item), "%-16s= %s,", name.c_str(), value.c_str());
+    items.push_back(item);
+  }
+  testing::internal::CaptureStdout();
+  PrintMediaInfoObject(r);
+  PrintMediaInfoObject(r);
+  fflush(stdout);
+  std::string all;
+  for (const std::string& item : items) all += item;
+  EXPECT_EQ(testing::internal::GetCapturedStdout(), all + all);
+  LogCapture log(0);  // level 0: leveled lines would be dropped
+  SyslogMediaInfoObject(r);
+  ASSERT_EQ(log.lines().size(), items.size());
+  std::vector<std::string> lines = log.Normalized();
+  for (size_t i = 0; i < items.size(); ++i) {
+    EXPECT_EQ(log.lines()[i].priority, LOG_ERR);
+    EXPECT_EQ(lines[i], "quvaidx_mediainfo:N " + items[i]);
+  }
+  const std::string prefix = "quvaidx_mediainfo:N ";
+  EXPECT_EQ(lines[0], prefix + "ID              = 7,");
+  EXPECT_EQ(lines[7], prefix + "szTitle         = Song,");
+  EXPECT_EQ(lines[21], prefix + "duration        = 1.500000,");
+  EXPECT_EQ(lines[31], prefix + "fileSize        = 4294967301,");
+  EXPECT_EQ(lines[42], prefix + "szContainerType = ,");
+}
+
+TEST(MediaDumpTest, PrintShowsEdgeValuesInFull) {
+  __tag_QUVA_MEDIA_INFO r = Zero();
+  r.fileSize = UINT64_MAX;
+  r.ID = r.video_bitrate = 4294967295u;
+  r.track = -1;
+  strcpy(r.szComment, "100%s %d %n");  // an argument, never a format
+  memset(r.szExposure, 'e', sizeof(r.szExposure));  // unterminated
+  testing::internal::CaptureStdout();
+  PrintMediaInfoObject(r);
+  fflush(stdout);
+  std::string out = testing::internal::GetCapturedStdout();
+  for (std::string item :
+       {"fileSize        = 18446744073709551615,",
+        "ID              = 4294967295,", "video_bitrate   = 4294967295,",
+        "track           = -1,", "szComment       = 100%s %d %n,",
+        "szExposure      = eeeeeeeeeeeeeeeeeeee,szAperture"}) {
+    EXPECT_NE(out.find(item), std::string::npos) << item;
   }
 }
 

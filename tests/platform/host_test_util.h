@@ -1,35 +1,18 @@
-// Temporary directories, a temporary host directory and file helpers for
-// the tests of the host stand-in.
+// A temporary host directory and file helpers for the tests of the host
+// stand-in.
 #ifndef QUVAIDX_TESTS_PLATFORM_HOST_TEST_UTIL_H_
 #define QUVAIDX_TESTS_PLATFORM_HOST_TEST_UTIL_H_
 
-#include <stdlib.h>
-
-#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <string>
 
 #include "quvahost/quvahost.h"
+#include "support/fd_check.h"
 
 namespace quvahost::test {
 
-class TempDir {
- public:
-  TempDir() {
-    char templ[] = "/tmp/quvahost-test-XXXXXX";
-    path_ = mkdtemp(templ) != nullptr ? templ : "";
-  }
-  ~TempDir() {
-    std::error_code ignored;
-    if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
-  }
-  const std::string& path() const { return path_; }
-  std::string File(const std::string& name) const { return path_ + "/" + name; }
-
- private:
-  std::string path_;
-};
+using quvaidx::test::TempDir;
 
 // $QUVA_HOST_ETC points at this directory while it lives.
 class HostEtc : public TempDir {

@@ -21,16 +21,17 @@ struct OpState {
   int fail_code = 0, fail_result = -1;
   std::vector<int> answers;  // the last repeats
   size_t next_answer = 0;
+  std::string text;  // typed text answer
 };
+
+using Shares = std::map<std::string, std::pair<std::string, unsigned>>;
 
 struct FakeState {
   HostOps previous{}, next{};
   OpState ops[static_cast<int>(HostOp::kCount)];
-  std::string ea_dir_path, section_value, utf16_answer, cp_answer;
   int code_page = 0;
   QLIBCFileStatRecord stat_record{};
-  // In-memory shares: name to normalized path and status.
-  std::map<std::string, std::pair<std::string, unsigned>> shares;
+  Shares shares;  // name to normalized path and status
   std::vector<std::pair<std::string, unsigned>> share_updates;
   int outstanding_records = 0;
 };
@@ -88,39 +89,28 @@ constexpr HostOps kHooks = {
 
 int Refuse(int code) { return HostFail(code, __FILE__, __LINE__); }
 
-// --- shares: the file's or the in-memory ones, records counted --------------
-
-int Counted(int result, ShareRecord** record) {
-  if (record != nullptr && *record != nullptr) ++g_state->outstanding_records;
-  return result;
-}
-
-using Shares = std::map<std::string, std::pair<std::string, unsigned>>;
+// --- in-memory shares, installed by the first AddShare ---------------------
 
 int HandOut(Shares::const_iterator it, ShareRecord** record) {
   if (it == g_state->shares.end()) return Refuse(ENOENT);
   int error = 0;
   *record =
       NewShareRecord(it->first, it->second.first, it->second.second, &error);
-  return Counted(*record != nullptr ? 0 : Refuse(error), record);
+  if (*record == nullptr) return Refuse(error);
+  ++g_state->outstanding_records;
+  return 0;
 }
 
 int ShareGet(const char* name, ShareRecord** record) {
   if (record != nullptr) *record = nullptr;
-  if (g_state->shares.empty())
-    return Counted(g_state->previous.ShareGet(name, record), record);
   if (name == nullptr || record == nullptr) return Refuse(EINVAL);
   return HandOut(g_state->shares.find(name), record);
 }
 
 // The share with the longest path that holds `value`.
 int ShareGetByAttrStr(const char* value, int attribute, ShareRecord** record) {
-  if (record != nullptr) *record = nullptr;
-  if (g_state->shares.empty()) {
-    return Counted(
-        g_state->previous.ShareGetByAttrStr(value, attribute, record), record);
-  }
   std::string path;
+  if (record != nullptr) *record = nullptr;
   if (value == nullptr || record == nullptr ||
       attribute != QUVA_SHARE_ATTR_PATH || !NormalizeAbsolutePath(value, &path))
     return Refuse(EINVAL);
@@ -135,7 +125,6 @@ int ShareGetByAttrStr(const char* value, int attribute, ShareRecord** record) {
 }
 
 int ShareUpdate(const ShareRecord* record) {
-  if (g_state->shares.empty()) return g_state->previous.ShareUpdate(record);
   if (record == nullptr) return Refuse(EINVAL);
   auto it = g_state->shares.find(record->szName);
   if (it == g_state->shares.end()) return Refuse(ENOENT);
@@ -151,21 +140,18 @@ void ShareFree(ShareRecord* record) {
 
 // --- typed answers -----------------------------------------------------------
 
-int CopyAnswer(const std::string& text, char* buffer, int size) {
-  if (buffer == nullptr || size < 1 || text.size() >= size_t(size))
-    return Refuse(ERANGE);
-  memcpy(buffer, text.c_str(), text.size() + 1);
-  return static_cast<int>(text.size());
-}
-
-int CutAnswer(const std::string& utf8, char* out, int out_size) {
-  if (out == nullptr || out_size < 1) return Refuse(EINVAL);
-  size_t length = std::min(utf8.size(), size_t(out_size) - 1);
-  while (length > 0 && length < utf8.size() &&
-         (static_cast<unsigned char>(utf8[length]) & 0xC0) == 0x80) {
+// `text` if it fits; conversions cut it on a character boundary instead.
+int CopyAnswer(HostOp op, char* out, int size) {
+  const std::string& text = Op(op).text;
+  bool cut =
+      op == HostOp::kUnicodeStrUTF16ToUTF8 || op == HostOp::kUnicodeStrCPToUTF8;
+  if (out == nullptr || size < 1) return Refuse(cut ? EINVAL : ERANGE);
+  if (!cut && text.size() >= size_t(size)) return Refuse(ERANGE);
+  size_t length = std::min(text.size(), size_t(size) - 1);
+  while (length > 0 && length < text.size() &&
+         (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80)
     --length;  // back to a character boundary
-  }
-  memcpy(out, utf8.data(), length);
+  memcpy(out, text.data(), length);
   out[length] = '\0';
   return static_cast<int>(length);
 }
@@ -175,10 +161,6 @@ int CutAnswer(const std::string& utf8, char* out, int out_size) {
 FakeHost::FakeHost() : previous_(g_host_ops) {
   g_state = new FakeState;
   g_state->previous = g_state->next = previous_;
-  g_state->next.ShareGet = ShareGet;
-  g_state->next.ShareGetByAttrStr = ShareGetByAttrStr;
-  g_state->next.ShareUpdate = ShareUpdate;
-  g_state->next.ShareFree = ShareFree;
   g_host_ops = kHooks;
 }
 
@@ -205,55 +187,53 @@ void FakeHost::Pass(HostOp op) {
 }
 
 void FakeHost::AnswerEADirPath(const std::string& path) {
-  g_state->ea_dir_path = path;
+  Op(HostOp::kEADirPath).text = path;
   g_state->next.EADirPath = [](int, const char*, char* buffer, int size) {
-    return CopyAnswer(g_state->ea_dir_path, buffer, size) < 0 ? -1 : 0;
+    return CopyAnswer(HostOp::kEADirPath, buffer, size) < 0 ? -1 : 0;
   };
 }
 
 void FakeHost::AnswerCodePage(int code_page) {
   g_state->code_page = code_page;
   g_state->next.CodePageGet = [](int, int* out) {
-    if (out == nullptr) return Refuse(EINVAL);
-    *out = g_state->code_page;
-    return 0;
+    return out == nullptr ? Refuse(EINVAL) : (*out = g_state->code_page, 0);
   };
 }
 
 void FakeHost::AnswerFileStat(const QLIBCFileStatRecord& record) {
   g_state->stat_record = record;
   g_state->next.FileStat = [](const char*, int, QLIBCFileStatRecord* out) {
-    if (out == nullptr) return Refuse(EINVAL);
-    *out = g_state->stat_record;
-    return 0;
+    return out == nullptr ? Refuse(EINVAL) : (*out = g_state->stat_record, 0);
   };
 }
 
 void FakeHost::AnswerSectionValue(const std::string& value) {
-  g_state->section_value = value;
+  Op(HostOp::kFileGetSectionValue).text = value;
   g_state->next.FileGetSectionValue = [](const char*, const char*, const char*,
                                          char* buffer, int size) {
-    return CopyAnswer(g_state->section_value, buffer, size);
+    return CopyAnswer(HostOp::kFileGetSectionValue, buffer, size);
   };
 }
 
 void FakeHost::AnswerConversion(HostOp op, const std::string& utf8) {
+  Op(op).text = utf8;
   if (op == HostOp::kUnicodeStrUTF16ToUTF8) {
-    g_state->utf16_answer = utf8;
     g_state->next.UnicodeStrUTF16ToUTF8 = [](const char*, char* out, int size) {
-      return CutAnswer(g_state->utf16_answer, out, size);
+      return CopyAnswer(HostOp::kUnicodeStrUTF16ToUTF8, out, size);
     };
   } else {
-    g_state->cp_answer = utf8;
-    g_state->next.UnicodeStrCPToUTF8 = [](int, const char*, char* out,
-                                          int size) {
-      return CutAnswer(g_state->cp_answer, out, size);
+    g_state->next.UnicodeStrCPToUTF8 = [](int, const char*, char* out, int n) {
+      return CopyAnswer(HostOp::kUnicodeStrCPToUTF8, out, n);
     };
   }
 }
 
 void FakeHost::AddShare(const std::string& name, const std::string& path,
                         unsigned status) {
+  g_state->next.ShareGet = ShareGet;
+  g_state->next.ShareGetByAttrStr = ShareGetByAttrStr;
+  g_state->next.ShareUpdate = ShareUpdate;
+  g_state->next.ShareFree = ShareFree;
   std::string normal;
   g_state->shares[name] = {NormalizeAbsolutePath(path, &normal) ? normal : path,
                            status};

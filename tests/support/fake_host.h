@@ -1,13 +1,12 @@
-// A fault and answer layer over the host operations (quvahost.h), for tests
-// of code that reaches the host through quvahost_static.
+// A fault and answer layer over the host operations (quvahost.h).
 //
 // While a FakeHost lives, each host operation is counted, then failed or
 // answered as told, or else passed on to the stand-in (the real files under
-// $QUVA_HOST_ETC). The destructor restores the previous operations. A
-// failed call returns -1 (or the result given to Fail; null for pointer
-// results), nulls *record for share lookups, and leaves the code in errno
-// and in the thread's error stack with file "fake_host.cc".
-// One FakeHost at a time; configure it while no other thread calls the host.
+// $QUVA_HOST_ETC); the destructor restores the previous operations. A failed
+// call returns -1 (or the result given to Fail; null for pointer results),
+// nulls *record for share lookups, and leaves the code in errno and in the
+// thread's error stack with file "fake_host.cc". One FakeHost at a time;
+// configure it while no other thread calls the host.
 #ifndef QUVAIDX_TESTS_SUPPORT_FAKE_HOST_H_
 #define QUVAIDX_TESTS_SUPPORT_FAKE_HOST_H_
 
@@ -50,26 +49,23 @@ class FakeHost {
   // Drops the failure and int answers of `op` (typed answers stay).
   void Pass(HostOp op);
 
-  // Typed answers: every later call succeeds with this output; an answer
-  // that does not fit the caller's buffer fails with ERANGE.
+  // Typed answers: every later call succeeds with this output; a text that
+  // does not fit the caller's buffer fails with ERANGE, except conversions
+  // (kUnicodeStrUTF16ToUTF8, kUnicodeStrCPToUTF8), cut on a character.
   void AnswerEADirPath(const std::string& path);
   void AnswerCodePage(int code_page);
   void AnswerFileStat(const QLIBCFileStatRecord& record);
   void AnswerSectionValue(const std::string& value);
-  // kUnicodeStrUTF16ToUTF8 or kUnicodeStrCPToUTF8: `utf8`, cut to the output
-  // size on a character boundary.
   void AnswerConversion(HostOp op, const std::string& utf8);
 
-  // In-memory shares: once one is added, the share lookups (same path rules
-  // as the share file) and updates use them; updates are recorded.
+  // In-memory shares: once one is added, share lookups (with the share
+  // file's path rules) and updates use them; updates are recorded.
   void AddShare(const std::string& name, const std::string& path,
                 unsigned status);
   unsigned ShareStatus(const std::string& name) const;
   const std::vector<std::pair<std::string, unsigned>>& ShareUpdates() const;
-  // Share records handed out and not yet freed: non-zero means a leak.
-  int OutstandingShareRecords() const;
-
-  int Calls(HostOp op) const;  // calls of `op` since installation
+  int OutstandingShareRecords() const;  // handed out, not freed
+  int Calls(HostOp op) const;           // calls of `op` since installation
 
  private:
   HostOps previous_;

@@ -7,10 +7,8 @@ int g_calls = 0;
 unsigned g_total = 0;
 
 unsigned CountingSleep(unsigned seconds) {
-  if (seconds > 0) {
-    ++g_calls;
-    g_total += seconds;
-  }
+  g_calls += seconds > 0;
+  g_total += seconds;
   return 0;
 }
 

@@ -1,7 +1,11 @@
-// Descriptor-leak checking: counts the entries of /proc/self/fd.
+// Descriptor-leak checking (entries of /proc/self/fd) and temporary
+// directories.
 #ifndef QUVAIDX_TESTS_SUPPORT_FD_CHECK_H_
 #define QUVAIDX_TESTS_SUPPORT_FD_CHECK_H_
 
+#include <stdlib.h>
+
+#include <filesystem>
 #include <string>
 
 namespace quvaidx::test {
@@ -12,20 +16,26 @@ int OpenDescriptorCount();
 // Records the count at construction; NoLeak() compares it with the count now.
 class FdLeakCheck {
  public:
-  FdLeakCheck();
-  bool NoLeak() const;
+  FdLeakCheck() : before_(OpenDescriptorCount()) {}
+  bool NoLeak() const { return OpenDescriptorCount() == before_; }
   int before() const { return before_; }
 
  private:
   int before_;
 };
 
-// A unique socket path in a fresh temporary directory, removed by the
-// destructor together with whatever is left in it.
+// A fresh temporary directory, removed with its contents by the destructor.
+// Header-only, so the host tests can use it without the library.
 class TempDir {
  public:
-  TempDir();
-  ~TempDir();
+  TempDir() {
+    char templ[] = "/tmp/quvaidx-test-XXXXXX";
+    path_ = mkdtemp(templ) != nullptr ? templ : "/tmp";
+  }
+  ~TempDir() {
+    std::error_code ignored;
+    if (path_ != "/tmp") std::filesystem::remove_all(path_, ignored);
+  }
   TempDir(const TempDir&) = delete;
   TempDir& operator=(const TempDir&) = delete;
   const std::string& path() const { return path_; }

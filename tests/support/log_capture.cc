@@ -49,12 +49,10 @@ int LogCapture::Count(const std::string& text) const {
 void LogCapture::Clear() { Captured().clear(); }
 
 std::string NormalizeLine(const std::string& line) {
-  size_t colon = line.find(':');
+  size_t colon = line.find(':'), end = colon + 1;
   if (colon == std::string::npos) return line;
-  size_t end = colon + 1;
-  while (end < line.size() && isdigit(static_cast<unsigned char>(line[end]))) {
+  while (end < line.size() && isdigit(static_cast<unsigned char>(line[end])))
     ++end;
-  }
   if (end == colon + 1) return line;
   return line.substr(0, colon + 1) + "N" + line.substr(end);
 }

@@ -10,9 +10,8 @@ int RunUnprivileged(const std::function<int()>& check) {
   pid_t child = fork();
   if (child < 0) return -1;
   if (child == 0) {
-    if (getuid() == 0 &&
-        (setgroups(0, nullptr) != 0 || setgid(kNobody) != 0 ||
-         setuid(kNobody) != 0)) {
+    if (getuid() == 0 && (setgroups(0, nullptr) != 0 || setgid(kNobody) != 0 ||
+                          setuid(kNobody) != 0)) {
       _exit(255);
     }
     _exit(check() & 0xff);
