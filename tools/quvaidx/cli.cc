@@ -149,4 +149,37 @@ void EnableVerboseLogging() {
   ChageLogLevel(7);
 }
 
+int ParseFlags(int argc, char** argv, const char* command,
+               std::initializer_list<Flag> flags, void (*print_help)()) {
+  std::vector<struct option> options;
+  std::string letters = ":vh";
+  for (const Flag& flag : flags) {
+    options.push_back({flag.name, no_argument, nullptr, flag.letter});
+    letters += flag.letter;
+  }
+  options.push_back({"verbose", no_argument, nullptr, 'v'});
+  options.push_back({"help", no_argument, nullptr, 'h'});
+  options.push_back({nullptr, 0, nullptr, 0});
+  optind = 0;
+  opterr = 0;
+  int c;
+  while ((c = getopt_long(argc, argv, letters.c_str(), options.data(),
+                          nullptr)) != -1) {
+    if (c == 'v') {
+      EnableVerboseLogging();
+    } else if (c == 'h') {
+      print_help();
+      return kExitOk;
+    } else {
+      const Flag* match = nullptr;
+      for (const Flag& flag : flags) {
+        if (flag.letter == c) match = &flag;
+      }
+      if (match == nullptr) return OptionError(command, c, argv);
+      *match->value = true;
+    }
+  }
+  return kContinue;
+}
+
 }  // namespace quvaidx_cli

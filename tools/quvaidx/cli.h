@@ -3,7 +3,9 @@
 #ifndef QUVAIDX_TOOLS_CLI_H_
 #define QUVAIDX_TOOLS_CLI_H_
 
+#include <initializer_list>
 #include <string>
+#include <vector>
 
 #include <json/json.h>
 
@@ -33,6 +35,23 @@ int UsageError(const char* command, const std::string& message);
 // read from argv as a usage error; returns kExitError. Call with opterr 0
 // and an option string that starts with ':'.
 int OptionError(const char* command, int result, char** argv);
+
+// A boolean flag of a subcommand: --name or -letter sets *value.
+struct Flag {
+  const char* name;
+  char letter;
+  bool* value;
+};
+
+// ParseFlags's result when the command goes on with its operands.
+constexpr int kContinue = -1;
+
+// Parses `flags` plus --verbose/-v and --help/-h (getopt rules; optind is
+// left at the first operand). Returns kContinue, or the exit status to
+// return at once: kExitOk after printing the help, kExitError on an unknown
+// option.
+int ParseFlags(int argc, char** argv, const char* command,
+               std::initializer_list<Flag> flags, void (*print_help)());
 
 // Parses a whole decimal number within [min, max]; false for anything else
 // (empty text, signs outside the range, trailing characters, overflow).

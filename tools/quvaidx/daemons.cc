@@ -105,31 +105,9 @@ void PrintTable(const std::vector<Row>& rows) {
 }  // namespace
 
 int RunDaemons(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"json", no_argument, nullptr, 'j'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
   bool json = false;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":jvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'j':
-        json = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
+  int status = ParseFlags(argc, argv, kName, {{"json", 'j', &json}}, PrintHelp);
+  if (status != kContinue) return status;
   std::vector<std::string> names;
   for (int i = optind; i < argc; ++i) {
     if (!IsDaemonName(argv[i])) {

@@ -68,31 +68,9 @@ Json::Value JsonNumber(long value) {
 }  // namespace
 
 int RunStats(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"json", no_argument, nullptr, 'j'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
   bool json = false;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":jvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'j':
-        json = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
+  int status = ParseFlags(argc, argv, kName, {{"json", 'j', &json}}, PrintHelp);
+  if (status != kContinue) return status;
   Figures figures = {static_cast<int>(getpid()), -1, -1, -1, -1};
   if (argc - optind > 1) {
     return UsageError(

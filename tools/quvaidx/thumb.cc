@@ -91,31 +91,10 @@ bool ResolvePath(const char* path, std::string* resolved) {
 }  // namespace
 
 int RunThumb(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"video", no_argument, nullptr, 'V'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
   bool video = false;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":Vvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'V':
-        video = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
+  int status =
+      ParseFlags(argc, argv, kName, {{"video", 'V', &video}}, PrintHelp);
+  if (status != kContinue) return status;
   if (optind >= argc) return UsageError(kName, "missing PATH");
   std::vector<std::string> paths;
   for (int i = optind; i < argc; ++i) {
