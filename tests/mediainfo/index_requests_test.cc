@@ -174,7 +174,9 @@ TEST_F(IndexRequestsTest, IndexConvertAddSendsPackageOnlyWhenNotEmpty) {
     EXPECT_EQ(request["convert"]["szPath"], "/v.mp4");
     EXPECT_EQ(request["src"].size(), 47u);
     EXPECT_EQ(request.isMember("package"), cases[i].second);
-    if (cases[i].second) EXPECT_EQ(request["package"], cases[i].first);
+    if (cases[i].second) {
+      EXPECT_EQ(request["package"], cases[i].first);
+    }
   }
 }
 

@@ -32,15 +32,8 @@ class HostEtc : public TempDir {
   std::string old_;
 };
 
-inline void WriteFile(const std::string& path, const std::string& content) {
-  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
-}
-
-inline std::string ReadFile(const std::string& path) {
-  std::ostringstream text;
-  text << std::ifstream(path, std::ios::binary).rdbuf();
-  return text.str();
-}
+using quvaidx::test::ReadFile;
+using quvaidx::test::WriteFile;
 
 }  // namespace quvahost::test
 

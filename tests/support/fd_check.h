@@ -6,6 +6,8 @@
 #include <stdlib.h>
 
 #include <filesystem>
+#include <fstream>
+#include <sstream>
 #include <string>
 
 namespace quvaidx::test {
@@ -44,6 +46,18 @@ class TempDir {
  private:
   std::string path_;
 };
+
+// Whole-file helpers for tests: the file's bytes ("" when it cannot be
+// read), and replacing a file's contents.
+inline std::string ReadFile(const std::string& path) {
+  std::ostringstream text;
+  text << std::ifstream(path, std::ios::binary).rdbuf();
+  return text.str();
+}
+
+inline void WriteFile(const std::string& path, const std::string& content) {
+  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
+}
 
 }  // namespace quvaidx::test
 

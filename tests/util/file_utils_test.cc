@@ -22,15 +22,8 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
 using quvaidx::test::TempDir;
 
-std::string ReadFile(const std::string& path) {
-  std::stringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  std::ofstream(path) << text;
-}
+using quvaidx::test::ReadFile;
+using quvaidx::test::WriteFile;
 
 int EntriesIn(const std::string& dir) {
   int count = 0;

@@ -32,14 +32,8 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
 using quvaidx::test::TempDir;
 
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path);
-  return {std::istreambuf_iterator<char>(in), {}};
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  std::ofstream(path) << text;
-}
+using quvaidx::test::ReadFile;
+using quvaidx::test::WriteFile;
 
 class IndexQueueTest : public ::testing::Test {
  protected:
