@@ -5,7 +5,7 @@
 
 #include <type_traits>
 
-#include "mediainfo/json_read.h"
+#include "util/json_read.h"
 #include "mediainfo/media_fields.h"
 #include "quvaidx/mediainfo.h"
 

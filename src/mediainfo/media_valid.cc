@@ -8,7 +8,7 @@
 
 #include <unicode/ustring.h>
 
-#include "mediainfo/json_read.h"
+#include "util/utf8_cut.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/text.h"
 #include "util/log_internal.h"

@@ -5,7 +5,7 @@
 
 #include <unicode/ustring.h>
 
-#include "mediainfo/json_read.h"
+#include "util/utf8_cut.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/text.h"
 

@@ -4,8 +4,8 @@
 #include <string.h>
 #include <syslog.h>
 
-#include "ipc/index_requests_internal.h"
-#include "mediainfo/json_read.h"
+#include "requests/index_requests_internal.h"
+#include "util/json_read.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"

@@ -7,8 +7,8 @@
 // that does not fit the target reads as 0 (or an empty text), and a real
 // within range is cut toward zero as jsoncpp does. true and false read as 1
 // and 0. None of them throws.
-#ifndef QUVAIDX_MEDIAINFO_JSON_READ_H_
-#define QUVAIDX_MEDIAINFO_JSON_READ_H_
+#ifndef QUVAIDX_UTIL_JSON_READ_H_
+#define QUVAIDX_UTIL_JSON_READ_H_
 
 #include <stddef.h>
 #include <stdint.h>
@@ -38,20 +38,10 @@ bool ReadBool(const Json::Value& value);
 
 // Copies a string `value` into field[capacity] as a zero-terminated text:
 // its bytes up to its first zero byte, cut to capacity - 1 (see
-// CutLength). Anything but a string gives an empty text.
+// CutLength in util/utf8_cut.h). Anything but a string gives an empty text.
 // REQUIRES: capacity >= 1.
 void ReadText(const Json::Value& value, char* field, size_t capacity);
 
-// The length to which `text[0, length)` must be cut to fit in `limit` bytes:
-// `length` when it fits; otherwise `limit`, moved back to the start of the
-// character it falls in when the text is structurally UTF-8, so that no
-// character is split.
-size_t CutLength(const char* text, size_t length, size_t limit);
-
-// 1 when text[0, length) is structurally UTF-8 (the rules of
-// IsUnicodeString), else 0. Empty text is UTF-8.
-bool IsStructurallyUTF8(const char* text, size_t length);
-
 }  // namespace quvaidx
 
-#endif  // QUVAIDX_MEDIAINFO_JSON_READ_H_
+#endif  // QUVAIDX_UTIL_JSON_READ_H_

@@ -11,7 +11,7 @@
 
 #include <gtest/gtest.h>
 
-#include "ipc/index_requests_internal.h"
+#include "requests/index_requests_internal.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"
 #include "support/fake_host.h"

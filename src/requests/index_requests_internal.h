@@ -1,8 +1,8 @@
 // The socket paths that the typed index requests connect to, replaceable by
 // tests so that a test daemon need not own the fixed paths under /tmp. Not
 // exported; production code never calls the setter.
-#ifndef QUVAIDX_IPC_INDEX_REQUESTS_INTERNAL_H_
-#define QUVAIDX_IPC_INDEX_REQUESTS_INTERNAL_H_
+#ifndef QUVAIDX_REQUESTS_INDEX_REQUESTS_INTERNAL_H_
+#define QUVAIDX_REQUESTS_INDEX_REQUESTS_INTERNAL_H_
 
 namespace quvaidx {
 
@@ -18,4 +18,4 @@ IndexSockets SetIndexSockets(IndexSockets sockets);
 
 }  // namespace quvaidx
 
-#endif  // QUVAIDX_IPC_INDEX_REQUESTS_INTERNAL_H_
+#endif  // QUVAIDX_REQUESTS_INDEX_REQUESTS_INTERNAL_H_
