@@ -33,7 +33,7 @@ bench: deps
 	@scripts/bench.sh build-bench
 
 fuzz: deps
-	@CC=clang CXX=clang++ cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUVAIDX_BUILD_TESTS=OFF -DQUVAIDX_BUILD_TOOLS=OFF -DQUVAIDX_BUILD_EXAMPLES=OFF -DQUVAIDX_BUILD_FUZZ=ON >/dev/null
+	@CC=clang CXX=clang++ cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUVAIDX_BUILD_TESTS=OFF -DQUVAIDX_BUILD_TOOLS=OFF -DQUVAIDX_BUILD_DAEMONS=OFF -DQUVAIDX_BUILD_FUZZ=ON >/dev/null
 	@cmake --build build-fuzz -j$(JOBS)
 	@scripts/fuzz.sh build-fuzz $(FUZZ_SECONDS)
 

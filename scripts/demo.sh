@@ -193,11 +193,11 @@ echo "\$ quvaidx scan --json $share | grep -A6 '\"tables\"'"
 heading "A missing folder is an error: exit status 2"
 show scan "$work/no-such-share" 2>&1
 
-heading "The media-parser example daemon (examples/mediaparserd), on a socket
+heading "The media-parser daemon (daemons/mediaparserd), on a socket
 and a pid file of its own, asked about a PNG, a JPEG and an MP3"
-mediaparserd=${tool%/tools/quvaidx}/examples/mediaparserd
+mediaparserd=${tool%/tools/quvaidx}/daemons/mediaparserd/quvamediaparserd
 if [ ! -x "$mediaparserd" ]; then
-  echo "(not built: configure with -DQUVAIDX_BUILD_EXAMPLES=ON)"
+  echo "(not built: configure with -DQUVAIDX_BUILD_DAEMONS=ON)"
 else
   media=$work/media
   mkdir -p "$media"
@@ -209,8 +209,9 @@ else
     >"$media/holiday.jpg"
   printf 'ID3\003\0\0\0\0\0\0\377\373\220\144' >"$media/track01.mp3"
   mp_sock=$work/mediaparserd.sock
-  echo "\$ mediaparserd --socket $mp_sock --pidfile $work/mediaparserd.pid &"
-  "$mediaparserd" --socket "$mp_sock" --pidfile "$work/mediaparserd.pid" \
+  echo "\$ quvamediaparserd --foreground --socket $mp_sock --pidfile $work/mediaparserd.pid &"
+  "$mediaparserd" --foreground --socket "$mp_sock" \
+    --pidfile "$work/mediaparserd.pid" \
     >"$work/mediaparserd.out" 2>&1 &
   mp_pid=$!
   for ((i = 0; i < 250; i++)); do

@@ -17,5 +17,6 @@
 #include "quvaidx/media_type.h"
 #include "quvaidx/path_rules.h"
 #include "quvaidx/share_folder.h"
+#include "quvaidx/version.h"
 
 #endif  // QUVAIDX_QUVAIDX_H_

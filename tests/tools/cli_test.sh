@@ -520,8 +520,8 @@ make_media_samples() {
   printf '\377\330\377\340\377\360JFIF' >broken.JPG
 }
 
-# The tool's mediainfo and resolution commands against the example media
-# parser, $MEDIAPARSERD.
+# The tool's mediainfo and resolution commands against the media parser
+# daemon, $MEDIAPARSERD.
 case_mediainfo() {
   local sock=$WORK/mp.sock
   [ -x "${MEDIAPARSERD:-}" ] || fail "MEDIAPARSERD does not name the daemon"
@@ -531,8 +531,8 @@ case_mediainfo() {
   expect_error "quvaidx mediainfo: no reply from the media parser on $WORK/none.sock after 1 attempt"
   run resolution --socket "$WORK/none.sock" --attempts 1 tiny.png
   expect_error "quvaidx resolution: no reply from the media parser"
-  start mp "mediaparserd: listening on $sock" "$MEDIAPARSERD" --socket "$sock" \
-    --pidfile "$WORK/mp.pid"
+  start mp "quvamediaparserd: listening on $sock" "$MEDIAPARSERD" \
+    --foreground --socket "$sock" --pidfile "$WORK/mp.pid"
   # Relative names are sent as absolute paths.
   run mediainfo --socket "$sock" --json tiny.png photo.jpg anim.gif song.mp3 \
     broken.JPG
