@@ -136,9 +136,16 @@ case_serve_send() {
   expect_error "quvaidx send: the request must be a JSON object"
   run send -s "$sock" "{\"command\":\"ECHO\",\"big\":\"$(printf '%*s' 20000 '' | tr ' ' x)\"}"
   expect_error "quvaidx send: the request is 20028 bytes long; a packet carries at most 16380"
+  # The request from standard input ("-" or none); the reply in raw UTF-8
+  # with numbers in their shortest exact form.
+  RC=0
+  "$TOOL" send -s "$sock" -c <<<'{"command":"ECHO","s":"h\u00e9llo","x":0.1}' \
+    >"$WORK/out" 2>"$WORK/err" || RC=$?
+  OUT=$(<"$WORK/out") ERR=$(<"$WORK/err")
+  ok '{"echo":{"command":"ECHO","s":"héllo","x":0.1},"success":true}'
   # Earlier clients have closed, and the refused requests never arrived.
   run send -s "$sock" -c '{"command":"STATS"}'
-  ok '{"connections":1,"requests":6,"success":true}'
+  ok '{"connections":1,"requests":7,"success":true}'
   # A second daemon is refused on a live socket and on a regular file.
   run serve -s "$sock"
   expect_error "quvaidx serve: a daemon is already listening on $sock"
@@ -163,7 +170,22 @@ case_lifecycle() {
   wait "$BG" 2>/dev/null || true
   [ -S "$sock" ] || fail "the killed daemon's socket is gone"
   run send -s "$sock" --attempts 1 '{"command":"HANDSHAKE"}'
-  expect_error "quvaidx send: no daemon answered on $sock after 1 attempt"
+  expect_error "quvaidx send: no daemon answered on $sock after 1 attempt: connection refused"
+  # Each failure names its reason, and no attempt is followed by a wait.
+  run send -s "$WORK/none" --attempts 1 '{}'
+  expect_error "quvaidx send: no daemon answered on $WORK/none after 1 attempt: no such socket"
+  : >"$WORK/plain"
+  run send -s "$WORK/plain" --attempts 2 '{}'
+  expect_error "quvaidx send: no daemon answered on $WORK/plain after 2 attempts: not a socket"
+  # A daemon that accepts and never answers: --timeout bounds the wait.
+  python3 -c 'import socket, sys, time
+s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
+print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock" \
+    >"$WORK/mute.out" &
+  PIDS+=("$!")
+  until_ok grep -qs mute "$WORK/mute.out" || fail "no mute peer"
+  run send -s "$WORK/mute.sock" --timeout 0.2 '{}'
+  expect_error "quvaidx send: the daemon on $WORK/mute.sock sent no reply within 0.2 s"
   # A new daemon replaces the stale socket; SIGINT stops it cleanly.
   serve "$sock"
   run send -s "$sock" -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
@@ -240,7 +262,7 @@ new_queue() {
 }
 
 case_taskq() {
-  local key=$WORK/q.key big pid
+  local key=$WORK/q.key big pid started
   run taskq create "$WORK/none.key" 7
   expect_error "quvaidx taskq: key file $WORK/none.key: No such file or directory"
   new_queue "$key" 7
@@ -265,8 +287,12 @@ case_taskq() {
   run taskq push "$key" 7 --type 5 '{"late":true}'; ok
   wait "$pid" && [ "$(cat "$WORK/wait.out")" = '{"late":true}' ] ||
     fail "the blocking pop: $(cat "$WORK/wait.out")"
-  run taskq pop "$key" 7 --nowait --attempts 1 # empty: 1 s
+  # Empty: the tool does not wait after its last attempt.
+  started=$(date +%s%N)
+  run taskq pop "$key" 7 --nowait --attempts 1
   expect_error "quvaidx taskq: no task of type 0 after 1 attempt" 1
+  (( ($(date +%s%N) - started) / 1000000 < 800 )) ||
+    fail "an empty --nowait pop waited after its last attempt"
   # create discards what the queue held; delete removes it.
   run taskq push "$key" 7 '{"old":1}'; ok
   new_queue "$key" 7

@@ -126,6 +126,16 @@ Option Custom(const char* name, char letter, const char* value_name,
   return {name, letter, value_name, std::move(help), std::move(apply)};
 }
 
+Option Noted(Option option, bool* given) {
+  auto apply = std::move(option.apply);
+  option.apply = [apply, given](const char* value) {
+    std::string refused = apply(value);
+    if (refused.empty()) *given = true;
+    return refused;
+  };
+  return option;
+}
+
 void PrintError(const std::string& program, const std::string& message) {
   fprintf(stderr, "%s: %s\n", program.c_str(), message.c_str());
 }

@@ -62,6 +62,10 @@ Option Seconds(const char* name, char letter, double max, double* out,
 Option Custom(const char* name, char letter, const char* value_name,
               std::function<std::string(const char*)> apply, std::string help);
 
+// `option`, which also sets *given to true when its value is accepted: for
+// options whose absence means something other than their default.
+Option Noted(Option option, bool* given);
+
 // A program's (or subcommand's) description.
 struct CommandLine {
   // How error lines and the help name the program: "quvaidx send",

@@ -10,6 +10,7 @@
 #include <memory>
 #include <sstream>
 
+#include "json_text.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/log.h"
 
@@ -88,21 +89,39 @@ bool ParseJsonObject(const char* command, const std::string& text,
 }
 
 void PrintJson(const Json::Value& value, bool compact) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = compact ? "" : "  ";
-  std::string text = Json::writeString(builder, value);
-  fprintf(stdout, "%s\n", text.c_str());
+  fprintf(stdout, "%s\n", FormatJson(value, compact).c_str());
   fflush(stdout);
 }
 
 void PrintError(const char* command, const std::string& message) {
-  fprintf(stderr, "quvaidx %s: %s\n", command, message.c_str());
+  quvaidx_tools::PrintError(std::string("quvaidx ") + command, message);
 }
 
 int UsageError(const char* command, const std::string& message) {
-  PrintError(command, message);
-  fprintf(stderr, "Try 'quvaidx %s --help'.\n", command);
-  return kExitError;
+  return quvaidx_tools::UsageError(std::string("quvaidx ") + command, message);
+}
+
+quvaidx_tools::CommandLine Subcommand(
+    const char* name, std::vector<std::string> usage, std::string description,
+    std::vector<quvaidx_tools::Option> options, std::string epilog) {
+  quvaidx_tools::CommandLine line;
+  line.program = std::string("quvaidx ") + name;
+  line.usage = std::move(usage);
+  line.description = std::move(description);
+  line.options = std::move(options);
+  line.options.push_back({"verbose", 'v', nullptr,
+                          "also show the library's log lines on stderr",
+                          [](const char*) {
+                            EnableVerboseLogging();
+                            return std::string();
+                          }});
+  line.epilog = std::move(epilog);
+  return line;
+}
+
+int ParseArguments(const quvaidx_tools::CommandLine& line, int argc,
+                   char** argv, int* first_operand) {
+  return quvaidx_tools::ParseCommandLine(line, argc, argv, first_operand);
 }
 
 int OptionError(const char* command, int result, char** argv) {
@@ -115,16 +134,6 @@ int OptionError(const char* command, int result, char** argv) {
     return UsageError(command, "option '" + text + "' needs a value");
   }
   return UsageError(command, "unrecognised option '" + text + "'");
-}
-
-bool ParseInt(const char* text, int min, int max, int* out) {
-  if (text == nullptr || *text == '\0') return false;
-  errno = 0;
-  char* end = nullptr;
-  long value = strtol(text, &end, 10);
-  if (errno != 0 || *end != '\0' || value < min || value > max) return false;
-  *out = static_cast<int>(value);
-  return true;
 }
 
 bool CheckSocketPath(const char* command, const std::string& path) {

@@ -9,12 +9,15 @@
 
 #include <json/json.h>
 
+#include "options.h"
+
 namespace quvaidx_cli {
 
-// Exit statuses shared by every subcommand.
-constexpr int kExitOk = 0;     // the work was done; a reply said success
-constexpr int kExitFalse = 1;  // a daemon answered without success
-constexpr int kExitError = 2;  // usage error, bad input or failed exchange
+using quvaidx_tools::kContinue;
+using quvaidx_tools::kExitError;  // usage error, bad input or failed exchange
+using quvaidx_tools::kExitFalse;  // a daemon answered without success
+using quvaidx_tools::kExitOk;     // the work was done; a reply said success
+using quvaidx_tools::ParseInt;
 
 // One subcommand. `run` receives the arguments that follow the tool's own
 // options, argv[0] being the subcommand's name, and returns the exit status.
@@ -31,6 +34,18 @@ void PrintError(const char* command, const std::string& message);
 // returns kExitError.
 int UsageError(const char* command, const std::string& message);
 
+// The command line of subcommand `name`: its program name is "quvaidx
+// NAME" and -v/--verbose (the library's log lines on stderr) is added
+// after `options`.
+quvaidx_tools::CommandLine Subcommand(
+    const char* name, std::vector<std::string> usage, std::string description,
+    std::vector<quvaidx_tools::Option> options, std::string epilog);
+
+// Parses argv by `line` (see quvaidx_tools::ParseCommandLine): kContinue
+// with the operands from argv[*first_operand], or the status to exit with.
+int ParseArguments(const quvaidx_tools::CommandLine& line, int argc,
+                   char** argv, int* first_operand);
+
 // Reports the getopt_long result `result` ('?' or ':') for the option just
 // read from argv as a usage error; returns kExitError. Call with opterr 0
 // and an option string that starts with ':'.
@@ -43,19 +58,12 @@ struct Flag {
   bool* value;
 };
 
-// ParseFlags's result when the command goes on with its operands.
-constexpr int kContinue = -1;
-
 // Parses `flags` plus --verbose/-v and --help/-h (getopt rules; optind is
 // left at the first operand). Returns kContinue, or the exit status to
 // return at once: kExitOk after printing the help, kExitError on an unknown
 // option.
 int ParseFlags(int argc, char** argv, const char* command,
                std::initializer_list<Flag> flags, void (*print_help)());
-
-// Parses a whole decimal number within [min, max]; false for anything else
-// (empty text, signs outside the range, trailing characters, overflow).
-bool ParseInt(const char* text, int min, int max, int* out);
 
 // Checks that `path` can name a Unix-domain socket: not empty and at most
 // the library's limit in bytes. Prints one error line and returns false
@@ -82,7 +90,8 @@ bool ParseJsonObject(const char* command, const std::string& text,
                      const char* what, const char* example, Json::Value* out);
 
 // Writes `value` and a line feed to stdout, indented by two spaces or, with
-// `compact`, on one line; flushes.
+// `compact`, on one line (see json_text.h: raw UTF-8, shortest numbers);
+// flushes.
 void PrintJson(const Json::Value& value, bool compact);
 
 // Opens the system log under the tool's name. Library log lines go there

@@ -4,7 +4,6 @@
 // daemon is alive is the host's decision (QLIBCProcAliveByPidFile), the same
 // check that keeps a second instance from starting. Nothing is written and
 // no daemon is contacted.
-#include <getopt.h>
 #include <stdio.h>
 
 #include <string>
@@ -28,24 +27,19 @@ struct Row {
   bool alive;
 };
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx daemons [--json] [NAME...]\n"
-      "\n"
+quvaidx_tools::CommandLine MakeLine(bool* json) {
+  return Subcommand(
+      kName, {"[--json] [NAME...]"},
       "Lists the index daemons with their pid file, executable and socket,\n"
       "and whether each is alive: its pid file names a running process that\n"
-      "started before the file was written. Without NAMEs all are listed:\n"
-      "%s.\n"
-      "\n"
-      "Options:\n"
-      "  -j, --json     print a JSON array of objects with the members name,\n"
-      "                 pid_file, executable, socket, pid (null when the pid\n"
-      "                 file is missing or bad) and alive\n"
-      "  -v, --verbose  also show the library's log lines on stderr\n"
-      "  -h, --help     show this help\n"
-      "\n"
-      "Exit status: 0, or 2 on a usage error or an unknown NAME.\n",
-      DaemonNameList().c_str());
+      "started before the file was written. Without NAMEs all are listed:\n" +
+          DaemonNameList() + ".\n",
+      {quvaidx_tools::Flag(
+          "json", 'j', json,
+          "print a JSON array of objects with the members\nname, pid_file, "
+          "executable, socket, pid (null\nwhen the pid file is missing or "
+          "bad) and alive")},
+      "Exit status: 0, or 2 on a usage error or an unknown NAME.\n");
 }
 
 Row Describe(DaemonInfo& info, const std::string& name) {
@@ -106,10 +100,11 @@ void PrintTable(const std::vector<Row>& rows) {
 
 int RunDaemons(int argc, char** argv) {
   bool json = false;
-  int status = ParseFlags(argc, argv, kName, {{"json", 'j', &json}}, PrintHelp);
+  int first = 0;
+  int status = ParseArguments(MakeLine(&json), argc, argv, &first);
   if (status != kContinue) return status;
   std::vector<std::string> names;
-  for (int i = optind; i < argc; ++i) {
+  for (int i = first; i < argc; ++i) {
     if (!IsDaemonName(argv[i])) {
       PrintError(kName, std::string("unknown daemon '") + argv[i] +
                             "'; known daemons: " + DaemonNameList());

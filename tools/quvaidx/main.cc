@@ -2,12 +2,12 @@
 // queues, and the index's folder walk. The dispatcher
 // reads the tool's own options, then hands the remaining arguments to the
 // subcommand named first.
-#include <getopt.h>
 #include <stdio.h>
 #include <string.h>
 
 #include "cli.h"
 #include "commands.h"
+#include "quvaidx/version.h"
 
 namespace quvaidx_cli {
 namespace {
@@ -41,32 +41,38 @@ const Command* FindCommand(const char* name) {
   return nullptr;
 }
 
-void PrintUsage(FILE* out) {
-  fprintf(out,
-          "Usage: quvaidx [--verbose] COMMAND [OPTIONS] [ARGUMENTS]\n"
-          "\n"
-          "Talks to the index daemons over their Unix-domain sockets, works\n"
-          "on their task queues and walks folder trees with the index's\n"
-          "rules.\n"
-          "\n"
-          "Commands:\n");
+quvaidx_tools::CommandLine ToolLine() {
+  std::string commands = "Commands:\n";
   for (const Command& command : kCommands) {
-    fprintf(out, "  %-10s %s\n", command.name, command.summary);
+    char line[128];
+    snprintf(line, sizeof(line), "  %-10s %s\n", command.name, command.summary);
+    commands += line;
   }
-  fprintf(out,
-          "\n"
-          "Options:\n"
-          "  -v, --verbose  also show the library's log lines on stderr\n"
-          "  -h, --help     show this help\n"
-          "\n"
-          "Run 'quvaidx COMMAND --help' for the options of a command.\n");
+  quvaidx_tools::CommandLine line;
+  line.program = "quvaidx";
+  line.usage = {"[--verbose] COMMAND [OPTIONS] [ARGUMENTS]"};
+  line.description =
+      "Talks to the index daemons over their Unix-domain sockets, works\n"
+      "on their task queues and spool queues, and walks folder trees with\n"
+      "the index's rules.\n\n" +
+      commands;
+  line.options = {{"verbose", 'v', nullptr,
+                   "also show the library's log lines on stderr",
+                   [](const char*) {
+                     EnableVerboseLogging();
+                     return std::string();
+                   }}};
+  line.epilog = "Run 'quvaidx COMMAND --help' for the options of a command.\n";
+  line.version = std::string("quvaidx ") + QuvaidxVersion();
+  line.stop_at_first_operand = true;
+  return line;
 }
 
 // "quvaidx help [COMMAND]": the tool's usage, or COMMAND --help.
 int RunHelp(int argc, char** argv) {
   if (argc < 2 || strcmp(argv[1], "--help") == 0 ||
       strcmp(argv[1], "-h") == 0) {
-    PrintUsage(stdout);
+    quvaidx_tools::PrintHelp(ToolLine(), stdout);
     return kExitOk;
   }
   if (argc > 2) return UsageError("help", "expects at most one command name");
@@ -81,46 +87,20 @@ int RunHelp(int argc, char** argv) {
 
 int Main(int argc, char** argv) {
   InitLogging();
-  static const struct option kOptions[] = {
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
-  opterr = 0;
-  int c;
-  // '+' stops at the subcommand's name: what follows belongs to it.
-  while ((c = getopt_long(argc, argv, "+:vh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintUsage(stdout);
-        return kExitOk;
-      default: {
-        std::string text = argv[optind - 1];
-        fprintf(stderr, "quvaidx: unrecognised option '%s'\n", text.c_str());
-        fprintf(stderr, "Try 'quvaidx --help'.\n");
-        return kExitError;
-      }
-    }
+  int first = 0;
+  int status = quvaidx_tools::ParseCommandLine(ToolLine(), argc, argv, &first);
+  if (status != kContinue) return status;
+  if (first >= argc) {
+    return quvaidx_tools::UsageError("quvaidx", "no command given");
   }
-  if (optind >= argc) {
-    fprintf(stderr, "quvaidx: no command given\n");
-    fprintf(stderr, "Try 'quvaidx --help'.\n");
-    return kExitError;
-  }
-  const Command* command = FindCommand(argv[optind]);
+  const Command* command = FindCommand(argv[first]);
   if (command == nullptr) {
-    fprintf(stderr, "quvaidx: unknown command '%s'\n", argv[optind]);
+    fprintf(stderr, "quvaidx: unknown command '%s'\n", argv[first]);
     fprintf(stderr, "Try 'quvaidx --help'.\n");
     return kExitError;
   }
-  // The subcommand parses its own options afresh (optind 0 resets getopt).
-  int sub_argc = argc - optind;
-  char** sub_argv = argv + optind;
-  optind = 0;
-  return command->run(sub_argc, sub_argv);
+  // The subcommand parses its own options afresh.
+  return command->run(argc - first, argv + first);
 }
 
 }  // namespace

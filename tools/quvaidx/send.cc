@@ -3,9 +3,20 @@
 // The request is parsed and checked before any connection is made, so a
 // mistake on the command line never reaches a daemon. The exchange runs on
 // one connection and is not repeated, so a request reaches the daemon at
-// most once.
-#include <getopt.h>
+// most once. The tool connects by itself (attempts one second apart, none
+// after the last) so that it can say why a connection failed, and bounds
+// the wait for the reply with --timeout.
+#include <errno.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
 #include <stdio.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+#include <sys/un.h>
+#include <unistd.h>
 
 #include <string>
 
@@ -22,40 +33,62 @@ namespace {
 constexpr char kName[] = "send";
 constexpr int kDefaultAttempts = 3;
 constexpr int kMaxAttempts = 3600;
+// A connect to a daemon whose backlog is full waits at most this long.
+constexpr int kConnectTimeoutMs = 5000;
+// Longest request read from standard input; a packet carries far less.
+constexpr size_t kMaxInput = 1 << 20;
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx send --socket PATH [OPTIONS] JSON\n"
-      "       quvaidx send --daemon NAME [OPTIONS] JSON\n"
-      "\n"
+struct Options {
+  std::string socket, daemon, request;
+  bool socket_given = false, daemon_given = false;
+  bool handshake = false, compact = false;
+  int attempts = kDefaultAttempts;
+  double timeout = 0;  // 0: no limit
+};
+
+quvaidx_tools::CommandLine MakeLine(Options* o) {
+  using namespace quvaidx_tools;
+  return Subcommand(
+      kName,
+      {"--socket PATH [OPTIONS] [JSON|-]", "--daemon NAME [OPTIONS] [JSON|-]"},
       "Sends the JSON object JSON as one request to the daemon listening on\n"
       "the Unix-domain socket PATH, or on the socket of the index daemon\n"
-      "NAME, and prints its reply.\n"
-      "\n"
-      "Options:\n"
-      "  -s, --socket PATH   the daemon's socket (at most %zu bytes)\n"
-      "  -d, --daemon NAME   the socket of the index daemon NAME, one of\n"
-      "                      %s\n"
-      "                      (see 'quvaidx daemons')\n"
-      "      --handshake     have the daemon answer a HANDSHAKE request\n"
-      "                      before the request is sent\n"
-      "  -a, --attempts N    connection attempts, one second apart "
-      "(default %d)\n"
-      "  -c, --compact       print the reply on one line\n"
-      "  -v, --verbose       also show the library's log lines on stderr\n"
-      "  -h, --help          show this help\n"
-      "\n"
-      "The reply is awaited without a time limit.\n"
+      "NAME, and prints its reply. Without JSON, or with -, the request is\n"
+      "read from standard input.\n",
+      {
+          Noted(Text("socket", 's', "PATH", &o->socket,
+                     "the daemon's socket (at most " +
+                         std::to_string(kMaxSocketPath) + " bytes)"),
+                &o->socket_given),
+          Noted(Text("daemon", 'd', "NAME", &o->daemon,
+                     "the socket of the index daemon NAME (see\n'quvaidx "
+                     "daemons'): " +
+                         DaemonNameList()),
+                &o->daemon_given),
+          quvaidx_tools::Flag(
+              "handshake", 0, &o->handshake,
+              "have the daemon answer a HANDSHAKE request\nbefore the request "
+              "is sent"),
+          Number("attempts", 'a', "N", 1, kMaxAttempts, &o->attempts,
+                 "connection attempts, one second apart\n(default " +
+                     std::to_string(kDefaultAttempts) + ")"),
+          Seconds("timeout", 't', 86400, &o->timeout,
+                  "give up when no reply has come SECONDS\nafter connecting "
+                  "(default: wait as long as\nit takes)"),
+          quvaidx_tools::Flag("compact", 'c', &o->compact,
+                              "print the reply on one line"),
+      },
+      "The reply is printed as UTF-8, numbers in their shortest exact form.\n"
       "\n"
       "Exit status:\n"
       "  0  the reply holds \"success\": true\n"
       "  1  the reply holds \"success\": false, or no \"success\" at all\n"
       "  2  usage error, invalid request, or no reply could be obtained\n"
       "\n"
-      "Example:\n"
+      "Examples:\n"
       "  quvaidx send --socket /tmp/demo.sock '{\"command\":\"HANDSHAKE\"}'\n"
-      "  quvaidx send --daemon scand --handshake '{\"command\":\"STATS\"}'\n",
-      kMaxSocketPath, DaemonNameList().c_str(), kDefaultAttempts);
+      "  echo '{\"command\":\"STATS\"}' | quvaidx send --daemon scand "
+      "--timeout 5\n");
 }
 
 // Parses `text` into `request`. On failure prints one line and returns
@@ -75,31 +108,140 @@ bool ParseRequest(const std::string& text, Json::Value* request) {
   return true;
 }
 
+// Reads all of standard input into *text. On failure prints one line.
+bool ReadStandardInput(std::string* text) {
+  char buffer[8192];
+  for (;;) {
+    size_t n = fread(buffer, 1, sizeof(buffer), stdin);
+    text->append(buffer, n);
+    if (text->size() > kMaxInput) {
+      PrintError(kName, "the request on standard input is longer than " +
+                            std::to_string(kMaxInput) + " bytes");
+      return false;
+    }
+    if (n < sizeof(buffer)) break;
+  }
+  if (ferror(stdin)) {
+    PrintError(kName,
+               std::string("cannot read standard input: ") + strerror(errno));
+    return false;
+  }
+  return true;
+}
+
 // Resolves --socket and --daemon into the socket path. On failure prints
 // one line and returns false.
-bool ChooseSocket(const std::string& socket_arg, const std::string& daemon_arg,
-                  bool socket_given, bool daemon_given, std::string* path) {
-  if (socket_given && daemon_given) {
+bool ChooseSocket(const Options& o, std::string* path) {
+  if (o.socket_given && o.daemon_given) {
     UsageError(kName, "give either --socket PATH or --daemon NAME, not both");
     return false;
   }
-  if (!socket_given && !daemon_given) {
+  if (!o.socket_given && !o.daemon_given) {
     UsageError(kName, "--socket PATH or --daemon NAME is required");
     return false;
   }
-  if (daemon_given) {
+  if (o.daemon_given) {
     // Checked first: the directory's lookup answers an unknown name with
     // an empty path, which would read as a missing option.
-    if (!IsDaemonName(daemon_arg)) {
-      PrintError(kName, "unknown daemon '" + daemon_arg +
+    if (!IsDaemonName(o.daemon)) {
+      PrintError(kName, "unknown daemon '" + o.daemon +
                             "'; known daemons: " + DaemonNameList());
       return false;
     }
-    *path = DaemonInfo().get(daemon_arg, "sock");
+    *path = DaemonInfo().get(o.daemon, "sock");
   } else {
-    *path = socket_arg;
+    *path = o.socket;
   }
   return CheckSocketPath(kName, *path);
+}
+
+// Connects to `path` once, waiting at most kConnectTimeoutMs. Returns the
+// descriptor, or -1 with errno set (ETIMEDOUT when the wait ran out).
+int ConnectOnce(const std::string& path) {
+  struct sockaddr_un address;
+  memset(&address, 0, sizeof(address));
+  address.sun_family = AF_UNIX;
+  memcpy(address.sun_path, path.data(), path.size());
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  if (fd < 0) return -1;
+  int result = connect(fd, reinterpret_cast<struct sockaddr*>(&address),
+                       sizeof(address));
+  if (result != 0 && (errno == EAGAIN || errno == EINPROGRESS)) {
+    // A full backlog: wait until the daemon accepts, or give up.
+    struct pollfd wait = {fd, POLLOUT, 0};
+    int ready = poll(&wait, 1, kConnectTimeoutMs);
+    int error = 0;
+    socklen_t length = sizeof(error);
+    if (ready == 0) {
+      error = ETIMEDOUT;
+    } else if (ready < 0 ||
+               getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0) {
+      error = errno;
+    }
+    result = error == 0 ? 0 : -1;
+    errno = error;
+  }
+  if (result != 0) {
+    int saved = errno;
+    close(fd);
+    errno = saved;
+    return -1;
+  }
+  // The library's exchanges block.
+  fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) & ~O_NONBLOCK);
+  return fd;
+}
+
+// Why connecting to `path` failed with `error`, in a few words.
+std::string ConnectFailure(const std::string& path, int error) {
+  struct stat status;
+  if (lstat(path.c_str(), &status) != 0) {
+    return errno == ENOENT ? "no such socket" : strerror(errno);
+  }
+  if (!S_ISSOCK(status.st_mode)) return "not a socket";
+  switch (error) {
+    case EACCES:
+    case EPERM:
+      return "permission denied";
+    case ECONNREFUSED:
+      return "connection refused (no daemon listens there)";
+    case ETIMEDOUT:
+      return "the daemon did not accept the connection within " +
+             std::to_string(kConnectTimeoutMs / 1000) + " seconds";
+    default:
+      return strerror(error);
+  }
+}
+
+// The reply time limit: when it runs out, the connection is shut down,
+// which ends the library's blocking read with a failure.
+volatile sig_atomic_t g_watched_fd = -1;
+volatile sig_atomic_t g_timed_out = 0;
+
+void OnTimeout(int) {
+  if (g_watched_fd >= 0) shutdown(g_watched_fd, SHUT_RDWR);
+  g_timed_out = 1;
+}
+
+// Arms (seconds > 0) or disarms (0) the reply time limit for `fd`.
+void WatchReply(int fd, double seconds) {
+  struct itimerval timer = {};
+  if (seconds > 0) {
+    struct sigaction action = {};
+    action.sa_handler = OnTimeout;
+    sigemptyset(&action.sa_mask);
+    sigaction(SIGALRM, &action, nullptr);
+    g_watched_fd = fd;
+    timer.it_value.tv_sec = static_cast<time_t>(seconds);
+    timer.it_value.tv_usec = static_cast<suseconds_t>(
+        (seconds - static_cast<double>(timer.it_value.tv_sec)) * 1e6);
+    if (timer.it_value.tv_sec == 0 && timer.it_value.tv_usec == 0) {
+      timer.it_value.tv_usec = 1;
+    }
+  } else {
+    g_watched_fd = -1;
+  }
+  setitimer(ITIMER_REAL, &timer, nullptr);
 }
 
 // The daemon's verdict: only a boolean true "success" counts as success.
@@ -109,94 +251,80 @@ bool ReplySucceeded(const Json::Value& reply) {
   return success.isBool() && success.asBool();
 }
 
+std::string Attempts(int n) {
+  return std::to_string(n) + (n == 1 ? " attempt" : " attempts");
+}
+
 }  // namespace
 
 int RunSend(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"socket", required_argument, nullptr, 's'},
-      {"daemon", required_argument, nullptr, 'd'},
-      {"handshake", no_argument, nullptr, 'H'},
-      {"attempts", required_argument, nullptr, 'a'},
-      {"compact", no_argument, nullptr, 'c'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
-  std::string socket_arg, daemon_arg, path;
-  bool socket_given = false, daemon_given = false;
-  bool handshake = false;
-  bool compact = false;
-  int attempts = kDefaultAttempts;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":s:d:a:cvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 's':
-        socket_arg = optarg;
-        socket_given = true;
-        break;
-      case 'd':
-        daemon_arg = optarg;
-        daemon_given = true;
-        break;
-      case 'H':
-        handshake = true;
-        break;
-      case 'a':
-        if (!ParseInt(optarg, 1, kMaxAttempts, &attempts)) {
-          return UsageError(kName, std::string("--attempts needs a whole "
-                                               "number from 1 to ") +
-                                       std::to_string(kMaxAttempts) +
-                                       ", not '" + optarg + "'");
-        }
-        break;
-      case 'c':
-        compact = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
-  if (optind >= argc) return UsageError(kName, "missing the JSON request");
-  if (argc - optind > 1) {
+  Options o;
+  int first = 0;
+  int status = ParseArguments(MakeLine(&o), argc, argv, &first);
+  if (status != kContinue) return status;
+  if (argc - first > 1) {
     return UsageError(kName, std::string("expects one JSON request; "
                                          "unexpected argument '") +
-                                 argv[optind + 1] + "'");
+                                 argv[first + 1] + "'");
   }
-  if (!ChooseSocket(socket_arg, daemon_arg, socket_given, daemon_given,
-                    &path)) {
+  std::string path;
+  if (!ChooseSocket(o, &path)) return kExitError;
+  std::string text;
+  if (first < argc && strcmp(argv[first], "-") != 0) {
+    text = argv[first];
+  } else if (!ReadStandardInput(&text)) {
     return kExitError;
   }
-
   Json::Value value;
-  if (!ParseRequest(argv[optind], &value)) return kExitError;
+  if (!ParseRequest(text, &value)) return kExitError;
 
-  int fd = ConnectPeer(path.c_str(), handshake, attempts);
+  int fd = -1;
+  std::string failure;
+  for (int attempt = 0; attempt < o.attempts && fd < 0; ++attempt) {
+    if (attempt > 0) sleep(1);  // never after the last attempt
+    fd = ConnectOnce(path);
+    if (fd < 0) {
+      failure = ConnectFailure(path, errno);
+      continue;
+    }
+    if (!o.handshake) break;
+    WatchReply(fd, o.timeout);
+    bool answered = Handshake(fd) == 0;
+    WatchReply(-1, 0);
+    if (!answered) {
+      failure = g_timed_out ? "no answer to the handshake in time"
+                            : "the daemon did not answer the handshake";
+      g_timed_out = 0;
+      close(fd);
+      fd = -1;
+    }
+  }
   if (fd < 0) {
     PrintError(kName, std::string("no daemon answered") +
-                          (handshake ? " the handshake" : "") + " on " + path +
-                          " after " + std::to_string(attempts) +
-                          (attempts == 1 ? " attempt" : " attempts"));
+                          (o.handshake ? " the handshake" : "") + " on " +
+                          path + " after " + Attempts(o.attempts) + ": " +
+                          failure);
     return kExitError;
   }
+  WatchReply(fd, o.timeout);
   int result = AutoSendRecvPacketByFd(fd, value, 0);
+  WatchReply(-1, 0);
   DisconnectPeer(fd);
   if (result != 0) {
-    PrintError(kName,
-               "the daemon on " + path +
-                   (result == -2 ? " closed the connection before replying"
-                                 : " gave no reply (the connection failed "
-                                   "or ended early)"));
+    std::string why;
+    if (g_timed_out) {
+      char limit[32];
+      snprintf(limit, sizeof(limit), "%g", o.timeout);
+      why = " sent no reply within " + std::string(limit) + " s";
+    } else if (result == -2) {
+      why = " closed the connection before replying";
+    } else {
+      why = " gave no reply (the connection failed or ended early)";
+    }
+    PrintError(kName, "the daemon on " + path + why);
     return kExitError;
   }
-  PrintJson(value, compact);
+  PrintJson(value, o.compact);
   return ReplySucceeded(value) ? kExitOk : kExitFalse;
 }
 

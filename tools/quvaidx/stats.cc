@@ -5,7 +5,6 @@
 // user's descriptors, a kernel thread's memory) is shown as "-", or null in
 // JSON, rather than as a number that would mislead.
 #include <errno.h>
-#include <getopt.h>
 #include <limits.h>
 #include <stdio.h>
 #include <sys/stat.h>
@@ -24,23 +23,19 @@ namespace {
 
 constexpr char kName[] = "stats";
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx stats [--json] [PID]\n"
-      "\n"
+quvaidx_tools::CommandLine MakeLine(bool* json) {
+  return Subcommand(
+      kName, {"[--json] [PID]"},
       "Prints the open descriptors, resident and virtual memory of process\n"
       "PID (default: this tool's own process) and the machine's total\n"
       "memory, in kB, from /proc. A figure that cannot be read is shown as\n"
-      "\"-\".\n"
-      "\n"
-      "Options:\n"
-      "  -j, --json     print a JSON object with the members pid,\n"
-      "                 descriptors, rss_kb, vmsize_kb and mem_total_kb\n"
-      "                 (null when unreadable)\n"
-      "  -v, --verbose  also show the library's log lines on stderr\n"
-      "  -h, --help     show this help\n"
-      "\n"
-      "Exit status: 0, or 2 on a usage error or when no process PID exists.\n");
+      "\"-\".\n",
+      {quvaidx_tools::Flag(
+          "json", 'j', json,
+          "print a JSON object with the members pid,\ndescriptors, rss_kb, "
+          "vmsize_kb and\nmem_total_kb (null when unreadable)")},
+      "Exit status: 0, or 2 on a usage error or when no process PID "
+      "exists.\n");
 }
 
 // The figures; -1 where unreadable.
@@ -69,18 +64,19 @@ Json::Value JsonNumber(long value) {
 
 int RunStats(int argc, char** argv) {
   bool json = false;
-  int status = ParseFlags(argc, argv, kName, {{"json", 'j', &json}}, PrintHelp);
+  int first = 0;
+  int status = ParseArguments(MakeLine(&json), argc, argv, &first);
   if (status != kContinue) return status;
   Figures figures = {static_cast<int>(getpid()), -1, -1, -1, -1};
-  if (argc - optind > 1) {
+  if (argc - first > 1) {
     return UsageError(
-        kName, std::string("unexpected argument '") + argv[optind + 1] + "'");
+        kName, std::string("unexpected argument '") + argv[first + 1] + "'");
   }
-  if (optind < argc && !ParseInt(argv[optind], 1, INT_MAX, &figures.pid)) {
+  if (first < argc && !ParseInt(argv[first], 1, INT_MAX, &figures.pid)) {
     return UsageError(kName, std::string("PID needs a whole number from 1 "
                                          "to ") +
                                  std::to_string(INT_MAX) + ", not '" +
-                                 argv[optind] + "'");
+                                 argv[first] + "'");
   }
   if (!ProcessExists(figures.pid)) {
     PrintError(kName, "no process " + std::to_string(figures.pid));

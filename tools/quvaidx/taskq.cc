@@ -5,11 +5,13 @@
 // the library is called, so every mistake gets one line of its own; a
 // queue is opened only when it exists, never created by accident.
 #include <errno.h>
-#include <getopt.h>
 #include <limits.h>
+#include <signal.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/time.h>
+#include <unistd.h>
 
 #include <string>
 
@@ -28,51 +30,6 @@ constexpr size_t kMaxTaskText = 8191;
 constexpr int kMaxAttempts = 3600;
 constexpr int kMaxSizeKib = INT_MAX / 1024;
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx taskq create PATH PROJECT [--size KIB]\n"
-      "       quvaidx taskq push   PATH PROJECT JSON [--type N]\n"
-      "       quvaidx taskq pop    PATH PROJECT [--type N] [--nowait "
-      "[--attempts N]]\n"
-      "       quvaidx taskq count  PATH PROJECT\n"
-      "       quvaidx taskq delete PATH PROJECT\n"
-      "\n"
-      "Works on the task queue named by the existing file PATH and the\n"
-      "project number PROJECT (1 to 255); tasks are JSON objects.\n"
-      "\n"
-      "  create  makes a fresh, empty queue (an old one under the same name\n"
-      "          is discarded with its tasks) and prints its identifier\n"
-      "  push    adds the task JSON; waits while the queue is full\n"
-      "  pop     takes one task off and prints it on one line; waits for\n"
-      "          one unless --nowait is given\n"
-      "  count   prints the number of tasks in the queue\n"
-      "  delete  removes the queue, if there is one\n"
-      "\n"
-      "Options:\n"
-      "  -s, --size KIB      create: the queue's byte limit in KiB (default:\n"
-      "                      the system's; a limit the system refuses is\n"
-      "                      silently not applied)\n"
-      "  -t, --type N        push: the task's type, 1 or more (default 1);\n"
-      "                      pop: 0 takes the oldest task (default), N > 0\n"
-      "                      the oldest of type N, N < 0 the oldest of the\n"
-      "                      lowest type not above -N\n"
-      "  -n, --nowait        pop: do not wait; each empty attempt costs one\n"
-      "                      second\n"
-      "  -a, --attempts N    pop --nowait: attempts (default 1, at most %d)\n"
-      "  -v, --verbose       also show the library's log lines on stderr\n"
-      "  -h, --help          show this help\n"
-      "\n"
-      "Exit status: 0 on success, 1 when pop found no task, 2 on a usage\n"
-      "error, a missing key file or queue, or a failed operation.\n"
-      "\n"
-      "Example:\n"
-      "  touch /tmp/q.key && quvaidx taskq create /tmp/q.key 7\n"
-      "  quvaidx taskq push /tmp/q.key 7 '{\"path\":\"/share/a.jpg\"}'\n"
-      "  quvaidx taskq pop /tmp/q.key 7 --nowait\n"
-      "  quvaidx taskq delete /tmp/q.key 7\n",
-      kMaxAttempts);
-}
-
 // The command line after option parsing.
 struct Request {
   std::string operation, path, json;
@@ -83,6 +40,53 @@ struct Request {
   bool nowait = false, attempts_given = false;
   int attempts = 1;
 };
+
+quvaidx_tools::CommandLine MakeLine(Request* r) {
+  using namespace quvaidx_tools;
+  return Subcommand(
+      kName,
+      {"create PATH PROJECT [--size KIB]",
+       "push   PATH PROJECT JSON [--type N]",
+       "pop    PATH PROJECT [--type N] [--nowait [--attempts N]]",
+       "count  PATH PROJECT", "delete PATH PROJECT"},
+      "Works on the task queue named by the existing file PATH and the\n"
+      "project number PROJECT (1 to 255); tasks are JSON objects.\n"
+      "\n"
+      "  create  makes a fresh, empty queue (an old one under the same name\n"
+      "          is discarded with its tasks) and prints its identifier\n"
+      "  push    adds the task JSON; waits while the queue is full\n"
+      "  pop     takes one task off and prints it on one line; waits for\n"
+      "          one unless --nowait is given\n"
+      "  count   prints the number of tasks in the queue\n"
+      "  delete  removes the queue, if there is one\n",
+      {
+          Noted(Number("size", 's', "KIB", 1, kMaxSizeKib, &r->size_kib,
+                       "create: the queue's byte limit in KiB\n(default: "
+                       "the system's; a limit the system\nrefuses is "
+                       "silently not applied)"),
+                &r->size_given),
+          Noted(Number("type", 't', "N", -INT_MAX, INT_MAX, &r->type,
+                       "push: the task's type, 1 or more (default 1);\n"
+                       "pop: 0 takes the oldest task (default), N > 0\nthe "
+                       "oldest of type N, N < 0 the oldest of the\nlowest "
+                       "type not above -N"),
+                &r->type_given),
+          quvaidx_tools::Flag(
+              "nowait", 'n', &r->nowait,
+              "pop: do not wait for a task; attempts are\none second apart"),
+          Noted(Number("attempts", 'a', "N", 1, kMaxAttempts, &r->attempts,
+                       "pop --nowait: attempts (default 1)"),
+                &r->attempts_given),
+      },
+      "Exit status: 0 on success, 1 when pop found no task, 2 on a usage\n"
+      "error, a missing key file or queue, or a failed operation.\n"
+      "\n"
+      "Example:\n"
+      "  touch /tmp/q.key && quvaidx taskq create /tmp/q.key 7\n"
+      "  quvaidx taskq push /tmp/q.key 7 '{\"path\":\"/share/a.jpg\"}'\n"
+      "  quvaidx taskq pop /tmp/q.key 7 --nowait\n"
+      "  quvaidx taskq delete /tmp/q.key 7\n");
+}
 
 std::string QueueName(const Request& request) {
   return "key file " + request.path + ", project " +
@@ -135,12 +139,43 @@ int Push(const Request& request) {
   return kExitOk;
 }
 
+void Wake(int) {}
+
+// One attempt to take a task without waiting. The library sleeps a second
+// after an empty attempt; a one-shot timer cuts that sleep short, so that
+// the attempts are spaced by this tool alone, with no wait after the last.
+// The receive itself does not wait, so the signal cannot interrupt it.
+int PopOnce(int id, int type, Json::Value& task) {
+  struct sigaction action = {}, previous;
+  action.sa_handler = Wake;  // no SA_RESTART: sleep(3) returns early
+  sigemptyset(&action.sa_mask);
+  sigaction(SIGALRM, &action, &previous);
+  struct itimerval timer = {}, off = {};
+  timer.it_value.tv_usec = 20 * 1000;
+  setitimer(ITIMER_REAL, &timer, nullptr);
+  int result = PopTaskFromQueue(id, type, false, 1, task);
+  setitimer(ITIMER_REAL, &off, nullptr);
+  sigaction(SIGALRM, &previous, nullptr);
+  return result;
+}
+
 int Pop(const Request& request) {
   int id = OpenQueue(request);
   if (id < 0) return kExitError;
   Json::Value task;  // the library parses into it without clearing it
-  if (PopTaskFromQueue(id, request.type, !request.nowait, request.attempts,
-                       task) == 0) {
+  int result = -1;
+  if (!request.nowait) {
+    result = PopTaskFromQueue(id, request.type, true, 1, task);
+  } else {
+    for (int attempt = 0; attempt < request.attempts && result != 0;
+         ++attempt) {
+      if (attempt > 0) sleep(1);  // never after the last attempt
+      result = PopOnce(id, request.type, task);
+      // A queue whose status cannot be read is gone: no use trying on.
+      if (result != 0 && GetNumOfMessageInQueue(id) < 0) break;
+    }
+  }
+  if (result == 0) {
     PrintJson(task, true);
     return kExitOk;
   }
@@ -242,61 +277,11 @@ bool CheckRequest(Request* request, int count, char** args) {
 }  // namespace
 
 int RunTaskq(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"size", required_argument, nullptr, 's'},
-      {"type", required_argument, nullptr, 't'},
-      {"nowait", no_argument, nullptr, 'n'},
-      {"attempts", required_argument, nullptr, 'a'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
   Request request;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":s:t:na:vh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 's':
-        if (!ParseInt(optarg, 1, kMaxSizeKib, &request.size_kib)) {
-          return UsageError(kName, std::string("--size needs a whole number "
-                                               "of KiB from 1 to ") +
-                                       std::to_string(kMaxSizeKib) + ", not '" +
-                                       optarg + "'");
-        }
-        request.size_given = true;
-        break;
-      case 't':
-        if (!ParseInt(optarg, -INT_MAX, INT_MAX, &request.type)) {
-          return UsageError(kName, std::string("--type needs a whole number, "
-                                               "not '") +
-                                       optarg + "'");
-        }
-        request.type_given = true;
-        break;
-      case 'n':
-        request.nowait = true;
-        break;
-      case 'a':
-        if (!ParseInt(optarg, 1, kMaxAttempts, &request.attempts)) {
-          return UsageError(kName, std::string("--attempts needs a whole "
-                                               "number from 1 to ") +
-                                       std::to_string(kMaxAttempts) +
-                                       ", not '" + optarg + "'");
-        }
-        request.attempts_given = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
-  if (!CheckRequest(&request, argc - optind, argv + optind)) return kExitError;
+  int first = 0;
+  int status = ParseArguments(MakeLine(&request), argc, argv, &first);
+  if (status != kContinue) return status;
+  if (!CheckRequest(&request, argc - first, argv + first)) return kExitError;
   const std::string& op = request.operation;
   if (op == "create") return Create(request);
   if (op == "push") return Push(request);
