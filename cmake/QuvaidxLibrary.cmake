@@ -22,7 +22,10 @@ function(quvaidx_package_library name)
       $<BUILD_INTERFACE:${PROJECT_SOURCE_DIR}/include>
       $<INSTALL_INTERFACE:${CMAKE_INSTALL_INCLUDEDIR}>)
   endforeach()
+  # A library finds the libraries installed beside it (libquvaidx.so its
+  # libquvahost.so) without the loader's cache or LD_LIBRARY_PATH.
   set_target_properties(${name} PROPERTIES
+    INSTALL_RPATH "$ORIGIN"
     VERSION ${ARG_VERSION}
     SOVERSION ${ARG_SOVERSION}
     LINK_DEPENDS ${ARG_MAP})

@@ -1,5 +1,6 @@
 #include "daemon_runner.h"
 
+#include <ctype.h>
 #include <errno.h>
 #include <grp.h>
 #include <limits.h>
@@ -65,7 +66,10 @@ quvaidx_tools::CommandLine MakeCommandLine(const DaemonSpec& spec,
   CommandLine line;
   line.program = spec.program;
   line.usage = {"[OPTIONS]"};
-  line.description = spec.description;
+  // The summary opens the help, as the man page's NAME line is made from it.
+  std::string summary = spec.summary;
+  if (!summary.empty()) summary[0] = static_cast<char>(toupper(summary[0]));
+  line.description = summary + ".\n\n" + spec.description;
   line.version = VersionLine(spec.program);
   line.epilog = spec.epilog;
   if (spec.default_socket != nullptr) {

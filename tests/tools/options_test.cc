@@ -115,7 +115,7 @@ TEST(OptionsTest, HelpAndVersionComeFromTheDescription) {
   EXPECT_EQ(help.status, kExitOk);
   EXPECT_EQ(help.out,
             "Usage: prog sub [OPTIONS] FILE...\n"
-            "       prog sub --other\n"
+            "  or:  prog sub --other\n"
             "\n"
             "Does things.\n"
             "\n"

@@ -158,8 +158,10 @@ bool ParseInt(const char* text, int min, int max, int* out) {
 
 void PrintHelp(const CommandLine& line, FILE* out) {
   for (size_t i = 0; i < line.usage.size(); ++i) {
-    fprintf(out, "%s %s %s\n", i == 0 ? "Usage:" : "      ",
-            line.program.c_str(), line.usage[i].c_str());
+    // Later forms start with "or:", as help2man reads them.
+    fprintf(out, "%s %s %s\n",
+            i == 0 ? "Usage:" : "  or: ", line.program.c_str(),
+            line.usage[i].c_str());
   }
   if (!line.description.empty()) {
     fprintf(out, "\n%s", line.description.c_str());

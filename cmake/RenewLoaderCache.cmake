@@ -1,0 +1,47 @@
+cmake_minimum_required(VERSION 3.25)
+# Runs at the end of an install and of an uninstall. Programs and libraries
+# installed together find each other through their RUNPATH; other programs
+# find libquvaidx.so through the loader's cache when it lies in a directory
+# that the loader is configured to search (/usr/local/lib and the like).
+# That cache is renewed here when the shared libraries went into (or left)
+# such a directory without DESTDIR; when it cannot be, this says what to
+# run. QUVAIDX_CHANGED_FILES lists the files installed or removed; without
+# it, the files of this install so far.
+if(NOT DEFINED QUVAIDX_CHANGED_FILES)
+  set(QUVAIDX_CHANGED_FILES ${CMAKE_INSTALL_MANIFEST_FILES})
+endif()
+if(NOT "$ENV{DESTDIR}" STREQUAL "")
+  return()
+endif()
+file(GLOB _confs /etc/ld.so.conf /etc/ld.so.conf.d/*.conf)
+set(_searched /lib /usr/lib /lib64 /usr/lib64)
+foreach(_conf IN LISTS _confs)
+  file(STRINGS "${_conf}" _lines REGEX "^/")
+  foreach(_line IN LISTS _lines)
+    string(STRIP "${_line}" _line)
+    list(APPEND _searched "${_line}")
+  endforeach()
+endforeach()
+set(_renew FALSE)
+foreach(_file IN LISTS QUVAIDX_CHANGED_FILES)
+  if(_file MATCHES "/libquva(idx|host)\\.so[.0-9]*$")
+    get_filename_component(_dir "${_file}" DIRECTORY)
+    if(_dir IN_LIST _searched)
+      set(_renew TRUE)
+      set(_where "${_dir}")
+    endif()
+  endif()
+endforeach()
+if(_renew)
+  find_program(_ldconfig ldconfig PATHS /sbin /usr/sbin)
+  set(_rc 1)
+  if(_ldconfig)
+    execute_process(COMMAND ${_ldconfig} RESULT_VARIABLE _rc ERROR_QUIET)
+  endif()
+  if(_rc EQUAL 0)
+    message(STATUS "Renewed the loader cache for ${_where} (ldconfig)")
+  else()
+    message(STATUS "Run 'sudo ldconfig' to renew the loader cache for "
+                   "${_where}")
+  endif()
+endif()
