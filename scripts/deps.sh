@@ -1,10 +1,42 @@
 #!/usr/bin/env bash
-# Installs the Debian packages that building, testing, benchmarking and
-# fuzzing need, when any is missing. Needs root (or sudo) only to install.
+# Installs the Debian packages that a job needs, when any is missing:
+#
+#   scripts/deps.sh PURPOSE...
+#
+# PURPOSE is one or more of:
+#   build  compile the library, the tool and the daemons, and make the man
+#          pages (every other purpose includes it)
+#   demo   what scripts/demo.sh runs besides the programs
+#   test   the test suite: GoogleTest, the fixture makers and oracles, and
+#          the tools the install and CLI tests call
+#   bench  Google Benchmark and the programs measured against
+#   fuzz   clang with libFuzzer and the sanitizer runtimes
+#
+# Needs root (or sudo) only to install; without either it prints the
+# apt-get line to run.
 set -euo pipefail
-packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
-          libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev
-          python3 strace time)
+
+build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
+       help2man)
+demo=(python3)
+test=(libgtest-dev libgmock-dev python3 man-db systemd)
+bench=(libbenchmark-dev strace time)
+fuzz=(clang libclang-rt-14-dev)
+
+[ $# -ge 1 ] || set -- build
+packages=("${build[@]}")
+for purpose in "$@"; do
+  case $purpose in
+    build) ;;
+    demo) packages+=("${demo[@]}") ;;
+    test) packages+=("${test[@]}") ;;
+    bench) packages+=("${bench[@]}") ;;
+    fuzz) packages+=("${fuzz[@]}") ;;
+    *) echo "deps.sh: unknown purpose '$purpose' (build, demo, test, bench, fuzz)" >&2
+       exit 2 ;;
+  esac
+done
+
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" \

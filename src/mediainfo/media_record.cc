@@ -5,9 +5,9 @@
 
 #include <type_traits>
 
-#include "util/json_read.h"
 #include "mediainfo/media_fields.h"
 #include "quvaidx/mediainfo.h"
+#include "util/json_read.h"
 
 // The record crosses process and library boundaries by pointer: its layout
 // must never move.

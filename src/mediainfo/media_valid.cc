@@ -8,10 +8,10 @@
 
 #include <unicode/ustring.h>
 
-#include "util/utf8_cut.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/text.h"
 #include "util/log_internal.h"
+#include "util/utf8_cut.h"
 
 namespace {
 

@@ -5,9 +5,9 @@
 
 #include <unicode/ustring.h>
 
-#include "util/utf8_cut.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/text.h"
+#include "util/utf8_cut.h"
 
 extern "C" {
 

@@ -4,11 +4,11 @@
 #include <string.h>
 #include <syslog.h>
 
-#include "requests/index_requests_internal.h"
-#include "util/json_read.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"
+#include "requests/index_requests_internal.h"
+#include "util/json_read.h"
 #include "util/log_internal.h"
 
 namespace {

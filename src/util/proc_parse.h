@@ -11,8 +11,7 @@ namespace quvaidx {
 // a line and reads the number after the line's first word. Sets *rss and
 // *vmsize to -1 first; a label without a number leaves its output at -1.
 // Returns true when both labels were seen.
-bool ParseProcStatus(const char* text, size_t length, long* rss,
-                     long* vmsize);
+bool ParseProcStatus(const char* text, size_t length, long* rss, long* vmsize);
 
 // Reads the number of the first line holding "MemTotal:" into *total (-1
 // first). Returns true when such a line was seen.

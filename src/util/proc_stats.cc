@@ -52,10 +52,10 @@ void ForEachLine(const char* text, size_t length, Visit visit) {
   size_t start = 0;
   while (start < length) {
     const void* newline = memchr(text + start, '\n', length - start);
-    size_t end = newline != nullptr
-                     ? static_cast<size_t>(static_cast<const char*>(newline) -
-                                           text)
-                     : length;
+    size_t end =
+        newline != nullptr
+            ? static_cast<size_t>(static_cast<const char*>(newline) - text)
+            : length;
     if (!visit(text + start, end - start)) return;
     start = end + 1;
   }
@@ -81,8 +81,7 @@ ssize_t ReadProcFile(const char* path, char* buf) {
 
 namespace quvaidx {
 
-bool ParseProcStatus(const char* text, size_t length, long* rss,
-                     long* vmsize) {
+bool ParseProcStatus(const char* text, size_t length, long* rss, long* vmsize) {
   *rss = -1;
   *vmsize = -1;
   bool have_rss = false;
@@ -145,5 +144,5 @@ int GetTotalMemory(long& total) {
   ssize_t length = ReadProcFile("/proc/meminfo", text);
   if (length < 0) return -1;
   return quvaidx::ParseMemInfo(text, static_cast<size_t>(length), &total) ? 0
-                                                                         : -1;
+                                                                          : -1;
 }

@@ -11,9 +11,9 @@
 
 #include <gtest/gtest.h>
 
-#include "requests/index_requests_internal.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"
+#include "requests/index_requests_internal.h"
 #include "support/fake_host.h"
 #include "support/fake_sleep.h"
 #include "support/fd_check.h"
