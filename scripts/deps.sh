@@ -19,7 +19,7 @@ set -euo pipefail
 build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
        help2man)
 demo=(python3)
-test=(libgtest-dev libgmock-dev python3 man-db systemd)
+test=(libgtest-dev libgmock-dev python3 man-db systemd clang-format)
 bench=(libbenchmark-dev strace time)
 fuzz=(clang libclang-rt-14-dev)
 
