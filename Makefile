@@ -5,7 +5,7 @@ BUILD ?= build
 JOBS ?= $(shell nproc)
 # Steps, not directory chatter, from the makes that CMake runs.
 MAKEFLAGS += --no-print-directory
-step = @printf '==> %s\n'
+step = @printf '==> %s\n' "$(1)"
 
 .PHONY: all build demo test asan-test bench fuzz format-check install \
         uninstall clean
