@@ -6,7 +6,6 @@
 // for thumbnails on request. Nothing is kept per file: the list is written
 // as the walk finds the files, also in JSON.
 #include <errno.h>
-#include <getopt.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -33,10 +32,17 @@ constexpr double kProgressDelay = 1.0;    // seconds before progress shows
 constexpr double kProgressRefresh = 0.2;  // seconds between redraws
 constexpr int kDefaultColumns = 80;       // when the terminal does not say
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx scan [--list] [--json] [--queue-thumbs] DIR...\n"
-      "\n"
+struct Options {
+  bool list = false;
+  bool json = false;
+  bool queue_thumbs = false;
+  std::vector<std::string> roots;  // absolute, resolved
+};
+
+quvaidx_tools::CommandLine MakeLine(Options* o) {
+  using quvaidx_tools::Flag;
+  return Subcommand(
+      kName, {"[--list] [--json] [--queue-thumbs] DIR..."},
       "Walks each folder tree DIR with the index's rules and reports what\n"
       "the index would hold: files per media table (music, video, photo,\n"
       "playlist, other), videos playable on the web, photos that need\n"
@@ -48,22 +54,21 @@ void PrintHelp() {
       "folders inside a share's recycle bin, network and image mounts,\n"
       "symbolic links (never followed), folder loops, and devices, sockets\n"
       "and pipes. Each DIR is resolved to its absolute path first (a DIR\n"
-      "that is a symbolic link is followed); paths are shown that way.\n"
-      "\n"
-      "Options:\n"
-      "  -l, --list          print each file that passed the rules with its\n"
-      "                      table, \"TABLE<tab>PATH\", on stdout; the\n"
-      "                      summary then goes to stderr. Control characters\n"
-      "                      and '\\' in paths are written as C escapes\n"
-      "  -j, --json          print one JSON object: the summary and, with\n"
-      "                      --list, \"files\": [{\"table\", \"path\"}...]\n"
-      "                      (names that are not UTF-8 are not exact there)\n"
-      "      --queue-thumbs  queue every folder holding photos that need\n"
-      "                      thumbnails for the thumbnail daemon, which must\n"
-      "                      be running\n"
-      "  -v, --verbose       also show the library's log lines on stderr\n"
-      "  -h, --help          show this help\n"
-      "\n"
+      "that is a symbolic link is followed); paths are shown that way.\n",
+      {
+          Flag("list", 'l', &o->list,
+               "print each file that passed the rules with its\ntable, "
+               "\"TABLE<tab>PATH\", on stdout; the\nsummary then goes to "
+               "stderr. Control characters\nand '\\' in paths are written "
+               "as C escapes"),
+          Flag("json", 'j', &o->json,
+               "print one JSON object: the summary and, with\n--list, "
+               "\"files\": [{\"table\", \"path\"}...]\n(names that are "
+               "not UTF-8 are not exact there)"),
+          Flag("queue-thumbs", 0, &o->queue_thumbs,
+               "queue every folder holding photos that need\nthumbnails for "
+               "the thumbnail daemon, which must\nbe running"),
+      },
       "On a terminal, a scan that takes over a second shows its progress\n"
       "on stderr. Unreadable folders get one line each on stderr.\n"
       "\n"
@@ -75,13 +80,6 @@ void PrintHelp() {
       "  quvaidx scan /share/Multimedia\n"
       "  quvaidx scan --list /share/Photos | grep '^photo'\n");
 }
-
-struct Options {
-  bool list = false;
-  bool json = false;
-  bool queue_thumbs = false;
-  std::vector<std::string> roots;  // absolute, resolved
-};
 
 double Now() {
   struct timespec ts;
@@ -340,42 +338,12 @@ bool ResolveRoots(int count, char** args, Options* options) {
 }  // namespace
 
 int RunScan(int argc, char** argv) {
-  enum { kQueueThumbs = 1000 };
-  static const struct option kOptions[] = {
-      {"list", no_argument, nullptr, 'l'},
-      {"json", no_argument, nullptr, 'j'},
-      {"queue-thumbs", no_argument, nullptr, kQueueThumbs},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
   Options options;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":ljvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'l':
-        options.list = true;
-        break;
-      case 'j':
-        options.json = true;
-        break;
-      case kQueueThumbs:
-        options.queue_thumbs = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
-  if (optind >= argc) return UsageError(kName, "missing the folder DIR");
-  if (!ResolveRoots(argc - optind, argv + optind, &options)) return kExitError;
+  int first = 0;
+  int status = ParseArguments(MakeLine(&options), argc, argv, &first);
+  if (status != kContinue) return status;
+  if (first >= argc) return UsageError(kName, "missing the folder DIR");
+  if (!ResolveRoots(argc - first, argv + first, &options)) return kExitError;
 
   // Progress shares the terminal with nothing but the final summary: not
   // with a list written to the same terminal.
