@@ -1,4 +1,4 @@
-// Every entry of g_host_ops becomes a hook that counts the call, applies a
+// Every host operation becomes a hook that counts the call, applies a
 // failure or int answer, and otherwise calls its entry of the "next" table:
 // the previous operation, a typed answer, or the in-memory shares.
 #include "support/fake_host.h"
@@ -72,20 +72,13 @@ struct HookFor<kOp, R (*)(A...)> {
   }
 };
 
-// clang-format off
-#define HOOK(name) \
-  &HookFor<HostOp::k##name, decltype(HostOps::name)>::Call<&HostOps::name>
+// The hook of every operation of QUVAHOST_OPS, matched to its slot by name.
 constexpr HostOps kHooks = {
-    HOOK(ShareGet), HOOK(ShareGetByAttrStr), HOOK(ShareUpdate),
-    HOOK(ShareFree), HOOK(GetFSType), HOOK(FSIsRemoteFS), HOOK(FSIsImageFS),
-    HOOK(EADirPath), HOOK(EAMKDir), HOOK(EAIsHiddenDir),
-    HOOK(SystemGetBootStep), HOOK(ErrGet), HOOK(ErrorGetFile),
-    HOOK(ErrorGetLine), HOOK(FileGetLine), HOOK(FileGetSectionValue),
-    HOOK(FileStat), HOOK(ReadPidFile), HOOK(ProcAliveByPidFile),
-    HOOK(CodePageGet), HOOK(UnicodeStrUTF16ToUTF8), HOOK(UnicodeStrCPToUTF8),
-    HOOK(UnicodeUTF8StrCountChar), HOOK(UnicodeUTF8ForwardNChar)};
-#undef HOOK
-// clang-format on
+#define QUVAHOST_FAKE_HOOK(prefix, name, result, params, args) \
+  &HookFor<HostOp::k##name, decltype(HostOps::name)>::Call<&HostOps::name>,
+    QUVAHOST_OPS(QUVAHOST_FAKE_HOOK)
+#undef QUVAHOST_FAKE_HOOK
+};
 
 int Refuse(int code) { return HostFail(code, __FILE__, __LINE__); }
 
@@ -158,14 +151,14 @@ int CopyAnswer(HostOp op, char* out, int size) {
 
 }  // namespace
 
-FakeHost::FakeHost() : previous_(g_host_ops) {
+FakeHost::FakeHost() {
   g_state = new FakeState;
+  previous_ = SetHostOps(&kHooks);
   g_state->previous = g_state->next = previous_;
-  g_host_ops = kHooks;
 }
 
 FakeHost::~FakeHost() {
-  g_host_ops = previous_;
+  SetHostOps(&previous_);
   delete g_state;
   g_state = nullptr;
 }

@@ -22,17 +22,13 @@
 
 namespace quvahost::test {
 
-// One per host operation, in the order of HostOps.
-// clang-format off
+// One per host operation, named as in QUVAHOST_OPS (host_ops.h).
 enum class HostOp {
-  kShareGet, kShareGetByAttrStr, kShareUpdate, kShareFree, kGetFSType,
-  kFSIsRemoteFS, kFSIsImageFS, kEADirPath, kEAMKDir, kEAIsHiddenDir,
-  kSystemGetBootStep, kErrGet, kErrorGetFile, kErrorGetLine, kFileGetLine,
-  kFileGetSectionValue, kFileStat, kReadPidFile, kProcAliveByPidFile,
-  kCodePageGet, kUnicodeStrUTF16ToUTF8, kUnicodeStrCPToUTF8,
-  kUnicodeUTF8StrCountChar, kUnicodeUTF8ForwardNChar, kCount
+#define QUVAHOST_FAKE_OP(prefix, name, result, params, args) k##name,
+  QUVAHOST_OPS(QUVAHOST_FAKE_OP)
+#undef QUVAHOST_FAKE_OP
+      kCount
 };
-// clang-format on
 
 class FakeHost {
  public:
