@@ -27,7 +27,7 @@
 
 namespace {
 
-constexpr char kDefaultPidFile[] = "/var/run/quvamediaparserd.pid";
+constexpr char kDefaultPidFile[] = QUVAIDX_MEDIAD_PID_FILE;
 
 const char kUsage[] =
     "Usage: mediaparserd [--socket PATH] [--pidfile FILE] [--daemon]\n"
