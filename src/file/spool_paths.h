@@ -15,8 +15,9 @@ struct SpoolPaths {
 };
 
 // Installs `paths` (whose texts must outlive their use) and returns the
-// previous ones. A null member restores its well-known path. Not
-// synchronised: call it while no WriteThumbQueue runs.
+// previous ones. A null member restores its well-known path (the seam
+// convention of util/hooks.h). Not synchronised: call it while no
+// WriteThumbQueue runs.
 SpoolPaths SetSpoolPaths(const SpoolPaths& paths);
 
 }  // namespace quvaidx

@@ -11,12 +11,14 @@
 #include <gtest/gtest.h>
 
 #include "quvaidx/system.h"
+#include "support/fake_sleep.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
 namespace {
 
+using quvaidx::test::FakeSleep;
 using quvaidx::test::kNobody;
 using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
@@ -61,18 +63,23 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
 }
 
 // A missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries.
+// failure (a folder into itself: EINVAL) after sixteen tries, each followed
+// by a yield through the sleep seam.
 TEST_F(FileTest, RenameFailures) {
   LogCapture log;
+  FakeSleep sleep;
   EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
   EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
   std::string nowhere = dir_.File("no/such/dir");
   EXPECT_EQ(RenameFile(source_.c_str(), nowhere.c_str()), -1);
   EXPECT_EQ(ReadFile(source_), "s");
+  EXPECT_EQ(sleep.yields(), 0);
   ASSERT_EQ(mkdir(dir_.File("d").c_str(), 0755), 0);
   std::string inside = dir_.File("d/sub");
   EXPECT_EQ(RenameFile(dir_.File("d").c_str(), inside.c_str()), -1);
+  EXPECT_EQ(sleep.yields(), 16);
+  EXPECT_EQ(sleep.calls(), 0);
   EXPECT_EQ(
       log.Normalized(),
       (std::vector<std::string>{
