@@ -22,6 +22,7 @@ using quvaidx::test::FakeSleep;
 using quvaidx::test::kNobody;
 using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
+using quvaidx::test::RunWithFileSizeLimit;
 using quvaidx::test::TempDir;
 
 using quvaidx::test::ReadFile;
@@ -111,6 +112,22 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   EXPECT_EQ(FileRemoveHeadingLine(dir_.path().c_str(), 1), -1);
   EXPECT_EQ(FileRemoveHeadingLine(nullptr, 1), -1);
   EXPECT_EQ(EntriesIn(dir_.path()), 1);
+}
+
+// A disk that fills while the copy is written must fail the trim and keep
+// every line: reporting success would replace the queue by a cut copy.
+// The failed write must not be retried for ever either.
+TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
+  std::string text;
+  for (int i = 0; i < 300; ++i)
+    text += "/share/entry" + std::to_string(i) + "\n";
+  WriteFile(source_, text);
+  auto trim_fails = [&] {
+    return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
+  };
+  EXPECT_EQ(RunWithFileSizeLimit(1000, trim_fails), 0);
+  EXPECT_EQ(ReadFile(source_), text);
+  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
 }
 
 TEST_F(FileTest, TrimKeepsOwnerAndMode) {

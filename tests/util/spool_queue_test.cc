@@ -26,6 +26,7 @@ namespace {
 using quvaidx::test::FakeSleep;
 using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
+using quvaidx::test::RunWithFileSizeLimit;
 using quvaidx::test::TempDir;
 
 using quvaidx::test::ReadFile;
@@ -83,6 +84,34 @@ TEST_F(IndexQueueTest, OpenFailuresAndRetries) {
   });
   EXPECT_EQ(code, 0);
   EXPECT_EQ(ReadFile(queue_), "");
+}
+
+// A disk that fills during the append must not leave a torn line that
+// would glue itself to the next entry: a short write is taken back, and a
+// write that fails outright adds nothing.
+TEST_F(IndexQueueTest, FullDiskLeavesNoTornLine) {
+  const std::string kept = "/share/a\n";
+  const struct {
+    long limit;          // bytes the queue may grow to
+    const char* reason;  // in the log line
+  } kCases[] = {{static_cast<long>(kept.size()) + 3, "No space left on device"},
+                {static_cast<long>(kept.size()), "File too large"}};
+  for (const auto& c : kCases) {
+    WriteFile(queue_, kept);
+    auto append_fails = [&] {
+      LogCapture log;
+      bool failed = WriteIndexQueue("/share/bb", queue_.c_str()) == -1;
+      bool logged = log.lines().size() == 1 &&
+                    log.lines()[0].text.find(std::string("reason=") +
+                                             c.reason) != std::string::npos;
+      return (failed ? 0 : 1) | (logged ? 0 : 2);
+    };
+    int code = RunWithFileSizeLimit(c.limit, append_fails);
+    EXPECT_EQ(code, 0) << c.reason;
+    EXPECT_EQ(ReadFile(queue_), kept) << c.reason;
+  }
+  EXPECT_EQ(WriteIndexQueue("/share/bb", queue_.c_str()), 0);
+  EXPECT_EQ(ReadFile(queue_), kept + "/share/bb\n");
 }
 
 TEST_F(IndexQueueTest, WriterWaitingForTheLockFollowsATrimmedQueue) {
