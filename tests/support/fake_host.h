@@ -24,12 +24,14 @@
 namespace quvahost::test {
 
 // One per host operation, named as in QUVAHOST_OPS (host_ops.h).
+// clang-format off
 enum class HostOp {
 #define QUVAHOST_FAKE_OP(prefix, name, result, params, args) k##name,
   QUVAHOST_OPS(QUVAHOST_FAKE_OP)
 #undef QUVAHOST_FAKE_OP
-      kCount
+  kCount
 };
+// clang-format on
 
 class FakeHost {
  public:
