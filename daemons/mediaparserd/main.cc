@@ -71,10 +71,8 @@ int main(int argc, char** argv) {
       "Answers HANDSHAKE, GET_MEDIA_INFO, GET_MEDIA_RESOLUTION and\n"
       "GET_VIDEO_METADATA {\"path\": ABSOLUTE_PATH} on a Unix-domain "
       "socket\nuntil SIGINT or SIGTERM.\n";
-  static const std::string socket = DaemonInfo().get("mediad", "sock");
-  static const std::string pid_file = DaemonInfo().get("mediad", "pid");
-  spec.default_socket = socket.c_str();
-  spec.default_pidfile = pid_file.c_str();
+  spec.default_socket = QUVAIDX_MEDIAD_SOCKET;
+  spec.default_pidfile = QUVAIDX_MEDIAD_PID_FILE;
   spec.handler = Handle;
   spec.context = nullptr;
   spec.start = nullptr;

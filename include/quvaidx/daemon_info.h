@@ -1,5 +1,6 @@
 // The directory of the index service's daemons: for each daemon's short
-// name, its pid file, its executable and its Unix-domain socket.
+// name, its pid file, its executable and its Unix-domain socket, as listed
+// in quvaidx/paths.h:
 //
 //   controld  pid  /var/run/quvaindexd.pid
 //             bin  /usr/quva/sbin/quvaindexd
@@ -30,7 +31,7 @@
 
 class QUVAIDX_API DaemonInfo {
  public:
-  // Fills the three maps with the table above.
+  // Fills the three maps from kIndexDaemons (quvaidx/paths.h).
   DaemonInfo();
 
   // Returns the path of `field` ("pid", "bin" or "sock", compared exactly)

@@ -41,14 +41,16 @@
 
 #include "quvaidx/export.h"
 #include "quvaidx/mediainfo.h"
+#include "quvaidx/paths.h"
 #include "quvaidx/system.h"  // _tag_THUMB_TYPE_
 
-// Socket of the media-parser daemon.
-#define QUVAIDX_MEDIA_PARSER_SOCKET "/tmp/quvamediaparserd_sock"
-// Socket of the plug-in daemon.
-#define QUVAIDX_PLUGIN_SOCKET "/tmp/quvaindexplugind_sock"
-// Pid file of the index daemon, read by IsQuvaindexAlive.
-#define QUVAIDX_INDEX_PID_FILE "/var/run/quvaindexd.pid"
+// Socket of the media-parser daemon: "/tmp/quvamediaparserd_sock".
+#define QUVAIDX_MEDIA_PARSER_SOCKET QUVAIDX_MEDIAD_SOCKET
+// Socket of the plug-in daemon: "/tmp/quvaindexplugind_sock".
+#define QUVAIDX_PLUGIN_SOCKET QUVAIDX_PLUGIND_SOCKET
+// Pid file of the index daemon, read by IsQuvaindexAlive:
+// "/var/run/quvaindexd.pid".
+#define QUVAIDX_INDEX_PID_FILE QUVAIDX_CONTROLD_PID_FILE
 // Connection attempts of every typed request.
 constexpr int kIndexRequestAttempts = 1800;
 

@@ -13,6 +13,7 @@
 #include "quvaidx/media_type.h"
 #include "quvaidx/mediainfo.h"
 #include "quvaidx/path_rules.h"
+#include "quvaidx/paths.h"
 #include "quvaidx/share_folder.h"
 #include "quvaidx/system.h"
 #include "quvaidx/task_queue.h"

@@ -5,9 +5,9 @@
 // Spool queues are text files with one entry per line, appended under an
 // exclusive flock. The thumbnail queue "/var/spool/thumb_create.queue" is
 // served by the daemon of "/var/run/quvamkthumbd.pid", the web-video queue
-// "/var/spool/flv_create.queue" by that of "/var/run/quvamkflvd.pid"; a
-// daemon that consumes a queue trims the lines it has done with
-// FileRemoveHeadingLine while holding the queue's exclusive flock.
+// "/var/spool/flv_create.queue" by that of "/var/run/quvamkflvd.pid"
+// (quvaidx/paths.h). A daemon that consumes a queue trims the lines it has done
+// with FileRemoveHeadingLine while holding the queue's exclusive flock.
 //
 // Module "quvaidx_system". Nothing here keeps state between calls.
 #ifndef QUVAIDX_SYSTEM_H_

@@ -2,32 +2,10 @@
 
 #include <string.h>
 
-namespace {
-
-struct DaemonEntry {
-  const char* name;
-  const char* pid_file;
-  const char* executable;
-  const char* socket;
-};
-
-constexpr DaemonEntry kDaemons[] = {
-    {"controld", "/var/run/quvaindexd.pid", "/usr/quva/sbin/quvaindexd",
-     "/tmp/quvaindexd_sock"},
-    {"scand", "/var/run/quvaindexscand.pid", "/usr/quva/sbin/quvaindexscand",
-     "/tmp/quvaindexscand_sock"},
-    {"workerd", "/var/run/quvaindexworkerd.pid",
-     "/usr/quva/sbin/quvaindexworkerd", "/tmp/quvaindexworkerd_sock"},
-    {"plugind", "/var/run/quvaindexplugind.pid",
-     "/usr/quva/sbin/quvaindexplugind", "/tmp/quvaindexplugind_sock"},
-    {"mediad", "/var/run/quvamediaparserd.pid",
-     "/usr/quva/sbin/quvamediaparserd", "/tmp/quvamediaparserd_sock"},
-};
-
-}  // namespace
+#include "quvaidx/paths.h"
 
 DaemonInfo::DaemonInfo() {
-  for (const DaemonEntry& daemon : kDaemons) {
+  for (const quvaidx::IndexDaemonPaths& daemon : quvaidx::kIndexDaemons) {
     pid_files_[daemon.name] = daemon.pid_file;
     executables_[daemon.name] = daemon.executable;
     sockets_[daemon.name] = daemon.socket;

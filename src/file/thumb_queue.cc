@@ -5,11 +5,12 @@
 #include <string.h>
 #include <sys/stat.h>
 
+#include "file/spool_paths.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/log.h"
 #include "quvaidx/media_type.h"
+#include "quvaidx/paths.h"
 #include "quvaidx/system.h"
-#include "util/spool_paths.h"
 
 namespace {
 
@@ -26,7 +27,34 @@ struct PreviewQueue {
   bool queues_parent;  // a wanted file queues its folder, not itself
 };
 
+using quvaidx::kFlvSpoolQueue;
+using quvaidx::kThumbSpoolQueue;
+
+constexpr quvaidx::SpoolPaths kWellKnownSpoolPaths = {
+    kThumbSpoolQueue.queue, kFlvSpoolQueue.queue, kThumbSpoolQueue.pid_file,
+    kFlvSpoolQueue.pid_file};
+
+quvaidx::SpoolPaths g_spool_paths = kWellKnownSpoolPaths;
+
+const char* OrDefault(const char* path, const char* well_known) {
+  return path != nullptr ? path : well_known;
+}
+
 }  // namespace
+
+namespace quvaidx {
+
+SpoolPaths SetSpoolPaths(const SpoolPaths& paths) {
+  SpoolPaths previous = g_spool_paths;
+  const SpoolPaths& known = kWellKnownSpoolPaths;
+  g_spool_paths = {OrDefault(paths.thumb_queue, known.thumb_queue),
+                   OrDefault(paths.flv_queue, known.flv_queue),
+                   OrDefault(paths.thumb_pid_file, known.thumb_pid_file),
+                   OrDefault(paths.flv_pid_file, known.flv_pid_file)};
+  return previous;
+}
+
+}  // namespace quvaidx
 
 int WriteThumbQueue(const char* path, _tag_THUMB_TYPE_ type) {
   struct stat st;
@@ -34,13 +62,14 @@ int WriteThumbQueue(const char* path, _tag_THUMB_TYPE_ type) {
       !(S_ISDIR(st.st_mode) || S_ISREG(st.st_mode))) {
     return -1;
   }
-  const quvaidx::SpoolPaths& paths = quvaidx::CurrentSpoolPaths();
+  const quvaidx::SpoolPaths& paths = g_spool_paths;
   PreviewQueue work;
   if (type == THUMB_TYPE_PHOTO) {
-    work = {paths.thumb_queue, paths.thumb_pid_file,        "quvamkthumbd",
-            "thumb",           BlQUVAIndexIsPhotoOnWebFile, true};
+    work = {paths.thumb_queue,           paths.thumb_pid_file,
+            kThumbSpoolQueue.daemon,     "thumb",
+            BlQUVAIndexIsPhotoOnWebFile, true};
   } else if (type == THUMB_TYPE_VIDEO) {
-    work = {paths.flv_queue, paths.flv_pid_file,          "quvamkflvd",
+    work = {paths.flv_queue, paths.flv_pid_file,          kFlvSpoolQueue.daemon,
             "flv",           BlQUVAIndexIsVideoOnWebFile, false};
   } else {
     return 0;

@@ -12,8 +12,8 @@ struct IndexSockets {
 };
 
 // Installs `sockets` (whose texts must outlive their use) and returns the
-// previous pair. A null member restores its default. Not synchronised: call
-// it while no typed request runs.
+// previous pair. A null member restores its default (the seam convention of
+// util/hooks.h). Not synchronised: call it while no typed request runs.
 IndexSockets SetIndexSockets(IndexSockets sockets);
 
 }  // namespace quvaidx

@@ -13,6 +13,7 @@
 
 #include "quvaidx/log.h"
 #include "quvaidx/system.h"
+#include "util/hooks.h"
 #include "util/log_internal.h"
 
 namespace {
@@ -72,7 +73,8 @@ bool CopyAfterLines(int in, int out, int n) {
     const char* start = block;
     const char* end = block + got;
     while (skipped < n && start < end) {
-      const void* newline = memchr(start, '\n', static_cast<size_t>(end - start));
+      const void* newline =
+          memchr(start, '\n', static_cast<size_t>(end - start));
       if (newline == nullptr) {
         start = end;  // the line goes on in the next block
       } else {
@@ -110,7 +112,7 @@ int RenameFile(const char* source, const char* destination) {
                   source, destination);
       return -1;
     }
-    sleep(0);  // yield, then try again
+    quvaidx::SleepSeconds(0);  // yield, then try again
   }
   AppLogError(3, "%s:%d [Error] rename reach max retry: %s -> %s", kModule,
               __LINE__, source, destination);

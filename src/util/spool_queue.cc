@@ -11,29 +11,6 @@
 #include "quvaidx/system.h"
 #include "util/hooks.h"
 #include "util/log_internal.h"
-#include "util/spool_paths.h"
-
-namespace quvaidx {
-namespace {
-
-SpoolPaths g_spool_paths = {
-    "/var/spool/thumb_create.queue",
-    "/var/spool/flv_create.queue",
-    "/var/run/quvamkthumbd.pid",
-    "/var/run/quvamkflvd.pid",
-};
-
-}  // namespace
-
-const SpoolPaths& CurrentSpoolPaths() { return g_spool_paths; }
-
-SpoolPaths SetSpoolPaths(const SpoolPaths& paths) {
-  SpoolPaths previous = g_spool_paths;
-  g_spool_paths = paths;
-  return previous;
-}
-
-}  // namespace quvaidx
 
 namespace {
 

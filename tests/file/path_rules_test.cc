@@ -30,10 +30,13 @@ TEST(EntryNameShouldIndex, SkipsExactlyTheReservedNames) {
   const struct {
     const char* name;
     int index;
-  } cases[] = {{".", 0},          {"..", 0},       {"Photos.app", 0},
-               {"Photos.APP", 1}, {"._", 0},       {"#recycle", 0},
-               {"#recycle2", 1},  {"#Recycle", 1}, {"#snapshot", 0},
-               {".quvameta", 0}};
+  } cases[] = {{".", 0},          {"..", 0},         {"...", 1},
+               {"Photos.app", 0}, {".app", 0},       {"Photos.APP", 1},
+               {"a.app.mp4", 1},  {"a.apps", 1},     {"._", 0},
+               {"._x.jpg", 0},    {".hidden", 1},    {"a._b", 1},
+               {"#recycle", 0},   {"#recycle2", 1},  {"#Recycle", 1},
+               {"#snapshot", 0},  {"#snapshots", 1}, {"#Snapshot", 1},
+               {"x#snapshot", 1}, {".quvameta", 0},  {".quvameta2", 1}};
   for (const auto& c : cases)
     EXPECT_EQ(c.index, EntryNameShouldIndex(c.name)) << c.name;
   EXPECT_EQ(0, EntryNameShouldIndex(nullptr));

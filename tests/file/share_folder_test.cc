@@ -6,6 +6,7 @@
 #include <syslog.h>
 
 #include <fstream>
+#include <functional>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -85,6 +86,39 @@ TEST(SharePath, ShareRelativePathsBecomeDiskPaths) {
   }
   EXPECT_EQ(-1, QUVAIndexSharePathGet(nullptr, nullptr, 64));
   EXPECT_EQ(0, host.OutstandingShareRecords());
+}
+
+// A host may hand out a record even when the lookup fails: every caller
+// releases it, so none leaks on a failed lookup either.
+TEST(ShareRecords, ReleasedAfterAFailedLookupToo) {
+  TempDir outside;
+  LogCapture log;
+  FakeHost host;
+  host.AddShare("video", "/vol1/video", 0);
+  host.HandOutRecordsOnFailure();
+  char out[64] = "untouched";
+  DirInfo info = {};
+  const struct {
+    const char* call;
+    std::function<int()> run;
+    int result;
+  } cases[] = {
+      {"SharePath, no such share",
+       [&] { return QUVAIndexSharePathGet("/music/a", out, sizeof out); }, -1},
+      {"IndexStatusSet", [] { return ShareIndexStatusSet("music"); }, -1},
+      {"GetDirInfo, outside the shares",
+       [&] { return GetDirInfo(outside.path().c_str(), &info); }, 0},
+      {"SharePath, host failure",
+       [&] {
+         host.Fail(HostOp::kShareGet, EIO);
+         return QUVAIndexSharePathGet("/video/a", out, sizeof out);
+       },
+       -1}};
+  for (const auto& c : cases) {
+    EXPECT_EQ(c.result, c.run()) << c.call;
+    EXPECT_EQ(0, host.OutstandingShareRecords()) << c.call;
+  }
+  EXPECT_STREQ("untouched", out);
 }
 
 TEST(DirInfo, GuidFromTheMapOnlyInsideAShare) {

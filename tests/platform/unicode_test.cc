@@ -53,6 +53,11 @@ TEST(UTF16Test, ByteOrderAndCharacters) {
       {std::string("A\0B\0\0\0", 6), 2, "AB"},          // LE, no BOM
       {std::string("\377\376A\0B\0\0\0", 8), 2, "AB"},  // LE BOM
       {std::string("\xFE\xFF\0A\0B\0\0", 8), 2, "AB"},  // BE BOM
+      // Only both bytes make a mark: one of them alone is text.
+      {std::string("\376\0\0\0", 4), 2, "\xC3\xBE"},     // U+00FE
+      {std::string("\377\0\0\0", 4), 2, "\xC3\xBF"},     // U+00FF
+      {std::string("A\377\0\0", 4), 3, "\xEF\xBD\x81"},  // U+FF41
+      {std::string("A\376\0\0", 4), 3, "\xEF\xB9\x81"},  // U+FE41
       {std::string("\xE5\x65\x2C\x67\0\0", 6), 6, "日本"},
       {std::string("\x3D\xD8\x00\xDE\0\0", 6), 4, "\xF0\x9F\x98\x80"},
       {std::string("\0\336A\0\0\0", 6), -1, "untouched"},  // lone trail

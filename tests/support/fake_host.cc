@@ -1,4 +1,4 @@
-// Every entry of g_host_ops becomes a hook that counts the call, applies a
+// Every host operation becomes a hook that counts the call, applies a
 // failure or int answer, and otherwise calls its entry of the "next" table:
 // the previous operation, a typed answer, or the in-memory shares.
 #include "support/fake_host.h"
@@ -34,16 +34,23 @@ struct FakeState {
   Shares shares;  // name to normalized path and status
   std::vector<std::pair<std::string, unsigned>> share_updates;
   int outstanding_records = 0;
+  bool records_on_failure = false;  // failed lookups hand out a record
 };
 
 FakeState* g_state = nullptr;
 
 OpState& Op(HostOp op) { return g_state->ops[static_cast<int>(op)]; }
 
+// What a failed share lookup leaves in *record: null, or a blank record
+// when the fake plays a host that hands one out all the same.
 template <typename T>
-void ClearShareOutput(T) {}
-void ClearShareOutput(ShareRecord** record) {
-  if (record != nullptr) *record = nullptr;
+void FailedShareOutput(T) {}
+void FailedShareOutput(ShareRecord** record) {
+  if (record == nullptr) return;
+  int error = 0;
+  *record =
+      g_state->records_on_failure ? NewShareRecord("", "", 0, &error) : nullptr;
+  if (*record != nullptr) ++g_state->outstanding_records;
 }
 
 template <HostOp kOp, typename Fn>
@@ -56,7 +63,7 @@ struct HookFor<kOp, R (*)(A...)> {
     OpState& op = Op(kOp);
     ++op.calls;
     if (op.fail) {
-      (ClearShareOutput(args), ...);
+      (FailedShareOutput(args), ...);
       HostFail(op.fail_code, __FILE__, __LINE__);
       if constexpr (std::is_pointer_v<R>) return nullptr;
       if constexpr (!std::is_pointer_v<R>) return R(op.fail_result);
@@ -72,38 +79,36 @@ struct HookFor<kOp, R (*)(A...)> {
   }
 };
 
-// clang-format off
-#define HOOK(name) \
-  &HookFor<HostOp::k##name, decltype(HostOps::name)>::Call<&HostOps::name>
+// The hook of every operation of QUVAHOST_OPS, matched to its slot by name.
 constexpr HostOps kHooks = {
-    HOOK(ShareGet), HOOK(ShareGetByAttrStr), HOOK(ShareUpdate),
-    HOOK(ShareFree), HOOK(GetFSType), HOOK(FSIsRemoteFS), HOOK(FSIsImageFS),
-    HOOK(EADirPath), HOOK(EAMKDir), HOOK(EAIsHiddenDir),
-    HOOK(SystemGetBootStep), HOOK(ErrGet), HOOK(ErrorGetFile),
-    HOOK(ErrorGetLine), HOOK(FileGetLine), HOOK(FileGetSectionValue),
-    HOOK(FileStat), HOOK(ReadPidFile), HOOK(ProcAliveByPidFile),
-    HOOK(CodePageGet), HOOK(UnicodeStrUTF16ToUTF8), HOOK(UnicodeStrCPToUTF8),
-    HOOK(UnicodeUTF8StrCountChar), HOOK(UnicodeUTF8ForwardNChar)};
-#undef HOOK
-// clang-format on
+#define QUVAHOST_FAKE_HOOK(prefix, name, result, params, args) \
+  &HookFor<HostOp::k##name, decltype(HostOps::name)>::Call<&HostOps::name>,
+    QUVAHOST_OPS(QUVAHOST_FAKE_HOOK)
+#undef QUVAHOST_FAKE_HOOK
+};
 
 int Refuse(int code) { return HostFail(code, __FILE__, __LINE__); }
+
+int RefuseLookup(int code, ShareRecord** record) {
+  FailedShareOutput(record);
+  return Refuse(code);
+}
 
 // --- in-memory shares, installed by the first AddShare ---------------------
 
 int HandOut(Shares::const_iterator it, ShareRecord** record) {
-  if (it == g_state->shares.end()) return Refuse(ENOENT);
+  if (it == g_state->shares.end()) return RefuseLookup(ENOENT, record);
   int error = 0;
   *record =
       NewShareRecord(it->first, it->second.first, it->second.second, &error);
-  if (*record == nullptr) return Refuse(error);
+  if (*record == nullptr) return RefuseLookup(error, record);
   ++g_state->outstanding_records;
   return 0;
 }
 
 int ShareGet(const char* name, ShareRecord** record) {
   if (record != nullptr) *record = nullptr;
-  if (name == nullptr || record == nullptr) return Refuse(EINVAL);
+  if (name == nullptr || record == nullptr) return RefuseLookup(EINVAL, record);
   return HandOut(g_state->shares.find(name), record);
 }
 
@@ -113,7 +118,7 @@ int ShareGetByAttrStr(const char* value, int attribute, ShareRecord** record) {
   if (record != nullptr) *record = nullptr;
   if (value == nullptr || record == nullptr ||
       attribute != QUVA_SHARE_ATTR_PATH || !NormalizeAbsolutePath(value, &path))
-    return Refuse(EINVAL);
+    return RefuseLookup(EINVAL, record);
   auto best = g_state->shares.cend();
   for (auto it = g_state->shares.cbegin(); it != g_state->shares.cend(); ++it) {
     if (ShareHoldsPath(it->second.first, path) &&
@@ -158,14 +163,14 @@ int CopyAnswer(HostOp op, char* out, int size) {
 
 }  // namespace
 
-FakeHost::FakeHost() : previous_(g_host_ops) {
+FakeHost::FakeHost() {
   g_state = new FakeState;
+  previous_ = SetHostOps(&kHooks);
   g_state->previous = g_state->next = previous_;
-  g_host_ops = kHooks;
 }
 
 FakeHost::~FakeHost() {
-  g_host_ops = previous_;
+  SetHostOps(&previous_);
   delete g_state;
   g_state = nullptr;
 }
@@ -247,6 +252,11 @@ unsigned FakeHost::ShareStatus(const std::string& name) const {
 const std::vector<std::pair<std::string, unsigned>>& FakeHost::ShareUpdates()
     const {
   return g_state->share_updates;
+}
+
+void FakeHost::HandOutRecordsOnFailure() {
+  g_state->records_on_failure = true;
+  g_state->next.ShareFree = ShareFree;  // counts the releases
 }
 
 int FakeHost::OutstandingShareRecords() const {

@@ -4,8 +4,9 @@
 // answered as told, or else passed on to the stand-in (the real files under
 // $QUVA_HOST_ETC); the destructor restores the previous operations. A failed
 // call returns -1 (or the result given to Fail; null for pointer results),
-// nulls *record for share lookups, and leaves the code in errno and in the
-// thread's error stack with file "fake_host.cc". One FakeHost at a time;
+// nulls *record for share lookups (unless HandOutRecordsOnFailure), and
+// leaves the code in errno and in the thread's error stack with file
+// "fake_host.cc". One FakeHost at a time;
 // configure it while no other thread calls the host.
 #ifndef QUVAIDX_TESTS_SUPPORT_FAKE_HOST_H_
 #define QUVAIDX_TESTS_SUPPORT_FAKE_HOST_H_
@@ -22,15 +23,13 @@
 
 namespace quvahost::test {
 
-// One per host operation, in the order of HostOps.
+// One per host operation, named as in QUVAHOST_OPS (host_ops.h).
 // clang-format off
 enum class HostOp {
-  kShareGet, kShareGetByAttrStr, kShareUpdate, kShareFree, kGetFSType,
-  kFSIsRemoteFS, kFSIsImageFS, kEADirPath, kEAMKDir, kEAIsHiddenDir,
-  kSystemGetBootStep, kErrGet, kErrorGetFile, kErrorGetLine, kFileGetLine,
-  kFileGetSectionValue, kFileStat, kReadPidFile, kProcAliveByPidFile,
-  kCodePageGet, kUnicodeStrUTF16ToUTF8, kUnicodeStrCPToUTF8,
-  kUnicodeUTF8StrCountChar, kUnicodeUTF8ForwardNChar, kCount
+#define QUVAHOST_FAKE_OP(prefix, name, result, params, args) k##name,
+  QUVAHOST_OPS(QUVAHOST_FAKE_OP)
+#undef QUVAHOST_FAKE_OP
+  kCount
 };
 // clang-format on
 
@@ -64,6 +63,10 @@ class FakeHost {
                 unsigned status);
   unsigned ShareStatus(const std::string& name) const;
   const std::vector<std::pair<std::string, unsigned>>& ShareUpdates() const;
+  // From now on a failing share lookup (Fail, or no in-memory share) still
+  // hands out a blank record in *record, as a host may: callers must
+  // release *record after a failed lookup too. Counted as outstanding.
+  void HandOutRecordsOnFailure();
   int OutstandingShareRecords() const;  // handed out, not freed
   int Calls(HostOp op) const;           // calls of `op` since installation
 

@@ -18,6 +18,8 @@ class FakeSleep {
   // Number of sleeps of one second or more, and their total in seconds.
   int calls() const;
   unsigned total_seconds() const;
+  // Number of sleep(0) calls: the yields of the retry loops.
+  int yields() const;
 
  private:
   SleepFunction previous_;

@@ -1,25 +1,52 @@
 #include "support/unprivileged.h"
 
 #include <grp.h>
+#include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 namespace quvaidx::test {
 
-int RunUnprivileged(const std::function<int()>& check) {
+namespace {
+
+// Runs `check` in a child after `restrict` (false: could not, exit 255).
+int RunInChild(const std::function<bool()>& restrict,
+               const std::function<int()>& check) {
   pid_t child = fork();
   if (child < 0) return -1;
   if (child == 0) {
-    if (getuid() == 0 && (setgroups(0, nullptr) != 0 || setgid(kNobody) != 0 ||
-                          setuid(kNobody) != 0)) {
-      _exit(255);
-    }
+    if (!restrict()) _exit(255);
     _exit(check() & 0xff);
   }
   int status = 0;
   if (waitpid(child, &status, 0) != child || !WIFEXITED(status)) return -1;
   int code = WEXITSTATUS(status);
   return code == 255 ? -1 : code;
+}
+
+}  // namespace
+
+int RunUnprivileged(const std::function<int()>& check) {
+  return RunInChild(
+      [] {
+        return getuid() != 0 || (setgroups(0, nullptr) == 0 &&
+                                 setgid(kNobody) == 0 && setuid(kNobody) == 0);
+      },
+      check);
+}
+
+int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
+                         unsigned seconds) {
+  return RunInChild(
+      [&] {
+        struct rlimit limit = {static_cast<rlim_t>(bytes),
+                               static_cast<rlim_t>(bytes)};
+        alarm(seconds);
+        return signal(SIGXFSZ, SIG_IGN) != SIG_ERR &&
+               setrlimit(RLIMIT_FSIZE, &limit) == 0;
+      },
+      check);
 }
 
 }  // namespace quvaidx::test

@@ -1,5 +1,7 @@
-// Runs a check as an unprivileged user, so that permission failures happen
-// even when the tests run as root.
+// Runs a check in a child process with less than this process may do: as
+// an unprivileged user, so that permission failures happen even when the
+// tests run as root, or with a file-size limit, so that writes fail as on a
+// full disk.
 #ifndef QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 #define QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 
@@ -14,6 +16,14 @@ constexpr unsigned kNobody = 65534;
 // becomes user and group kNobody. Returns the value `check` returned, or -1
 // when the child could not run it.
 int RunUnprivileged(const std::function<int()>& check);
+
+// Runs `check` in a child process whose files cannot grow beyond `bytes`
+// (RLIMIT_FSIZE, with SIGXFSZ ignored): a write that crosses the limit
+// comes back short, the next one fails with EFBIG. The child is killed
+// after `seconds`, so a check that retries a failed write for ever ends.
+// Returns the value `check` returned, or -1 when the child did not finish.
+int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
+                         unsigned seconds = 5);
 
 }  // namespace quvaidx::test
 

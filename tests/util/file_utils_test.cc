@@ -11,15 +11,18 @@
 #include <gtest/gtest.h>
 
 #include "quvaidx/system.h"
+#include "support/fake_sleep.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
 namespace {
 
+using quvaidx::test::FakeSleep;
 using quvaidx::test::kNobody;
 using quvaidx::test::LogCapture;
 using quvaidx::test::RunUnprivileged;
+using quvaidx::test::RunWithFileSizeLimit;
 using quvaidx::test::TempDir;
 
 using quvaidx::test::ReadFile;
@@ -61,18 +64,23 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
 }
 
 // A missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries.
+// failure (a folder into itself: EINVAL) after sixteen tries, each followed
+// by a yield through the sleep seam.
 TEST_F(FileTest, RenameFailures) {
   LogCapture log;
+  FakeSleep sleep;
   EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
   EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
   std::string nowhere = dir_.File("no/such/dir");
   EXPECT_EQ(RenameFile(source_.c_str(), nowhere.c_str()), -1);
   EXPECT_EQ(ReadFile(source_), "s");
+  EXPECT_EQ(sleep.yields(), 0);
   ASSERT_EQ(mkdir(dir_.File("d").c_str(), 0755), 0);
   std::string inside = dir_.File("d/sub");
   EXPECT_EQ(RenameFile(dir_.File("d").c_str(), inside.c_str()), -1);
+  EXPECT_EQ(sleep.yields(), 16);
+  EXPECT_EQ(sleep.calls(), 0);
   EXPECT_EQ(
       log.Normalized(),
       (std::vector<std::string>{
@@ -104,6 +112,22 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   EXPECT_EQ(FileRemoveHeadingLine(dir_.path().c_str(), 1), -1);
   EXPECT_EQ(FileRemoveHeadingLine(nullptr, 1), -1);
   EXPECT_EQ(EntriesIn(dir_.path()), 1);
+}
+
+// A disk that fills while the copy is written must fail the trim and keep
+// every line: reporting success would replace the queue by a cut copy.
+// The failed write must not be retried for ever either.
+TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
+  std::string text;
+  for (int i = 0; i < 300; ++i)
+    text += "/share/entry" + std::to_string(i) + "\n";
+  WriteFile(source_, text);
+  auto trim_fails = [&] {
+    return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
+  };
+  EXPECT_EQ(RunWithFileSizeLimit(1000, trim_fails), 0);
+  EXPECT_EQ(ReadFile(source_), text);
+  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
 }
 
 TEST_F(FileTest, TrimKeepsOwnerAndMode) {

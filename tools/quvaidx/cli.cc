@@ -13,6 +13,7 @@
 #include "json_text.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/log.h"
+#include "quvaidx/paths.h"
 
 namespace quvaidx_cli {
 
@@ -44,17 +45,17 @@ std::string FirstError(const std::string& report) {
 }  // namespace
 
 bool IsDaemonName(const std::string& name) {
-  for (const char* known : kDaemonNames) {
-    if (name == known) return true;
+  for (const quvaidx::IndexDaemonPaths& known : quvaidx::kIndexDaemons) {
+    if (name == known.name) return true;
   }
   return false;
 }
 
 std::string DaemonNameList() {
   std::string list;
-  for (const char* known : kDaemonNames) {
+  for (const quvaidx::IndexDaemonPaths& known : quvaidx::kIndexDaemons) {
     if (!list.empty()) list += ", ";
-    list += known;
+    list += known.name;
   }
   return list;
 }

@@ -70,12 +70,8 @@ int ParseFlags(int argc, char** argv, const char* command,
 // otherwise.
 bool CheckSocketPath(const char* command, const std::string& path);
 
-// The short names of the index daemons, in the order of the library's
-// daemon directory (DaemonInfo), which offers no way to list them.
-constexpr const char* kDaemonNames[] = {"controld", "scand", "workerd",
-                                        "plugind", "mediad"};
-
-// True when `name` is one of kDaemonNames.
+// True when `name` is the short name of an index daemon (kIndexDaemons of
+// quvaidx/paths.h).
 bool IsDaemonName(const std::string& name);
 
 // "controld, scand, workerd, plugind, mediad", for error messages.

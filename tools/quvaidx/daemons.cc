@@ -15,6 +15,7 @@
 #include "commands.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/daemon_info.h"
+#include "quvaidx/paths.h"
 
 namespace quvaidx_cli {
 namespace {
@@ -112,8 +113,10 @@ int RunDaemons(int argc, char** argv) {
     }
     names.push_back(argv[i]);
   }
-  if (names.empty())
-    names.assign(std::begin(kDaemonNames), std::end(kDaemonNames));
+  if (names.empty()) {
+    for (const quvaidx::IndexDaemonPaths& daemon : quvaidx::kIndexDaemons)
+      names.push_back(daemon.name);
+  }
   DaemonInfo info;
   std::vector<Row> rows;
   for (const std::string& name : names) rows.push_back(Describe(info, name));

@@ -18,6 +18,7 @@
 #include "cli.h"
 #include "commands.h"
 #include "quvahost/quvahost.h"
+#include "quvaidx/paths.h"
 #include "quvaidx/system.h"
 
 namespace quvaidx_cli {
@@ -25,8 +26,8 @@ namespace {
 
 constexpr char kName[] = "thumb";
 
-// The daemons that serve the two queues, as the library's system header
-// names them.
+// The daemons that serve the two queues, from the library's table of
+// well-known paths.
 struct PreviewDaemon {
   const char* name;
   const char* pid_file;
@@ -34,11 +35,11 @@ struct PreviewDaemon {
   const char* work;  // the kind of daemon, for messages
 };
 constexpr PreviewDaemon kPhotoDaemon = {
-    "quvamkthumbd", "/var/run/quvamkthumbd.pid",
-    "/var/spool/thumb_create.queue", "thumbnail"};
-constexpr PreviewDaemon kVideoDaemon = {"quvamkflvd", "/var/run/quvamkflvd.pid",
-                                        "/var/spool/flv_create.queue",
-                                        "web-video"};
+    quvaidx::kThumbSpoolQueue.daemon, quvaidx::kThumbSpoolQueue.pid_file,
+    quvaidx::kThumbSpoolQueue.queue, "thumbnail"};
+constexpr PreviewDaemon kVideoDaemon = {
+    quvaidx::kFlvSpoolQueue.daemon, quvaidx::kFlvSpoolQueue.pid_file,
+    quvaidx::kFlvSpoolQueue.queue, "web-video"};
 
 void PrintHelp() {
   printf(

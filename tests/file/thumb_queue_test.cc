@@ -1,0 +1,154 @@
+// The preview queues, with a real (child) daemon to signal.
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+#include <utility>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "file/spool_paths.h"
+#include "quvaidx/system.h"
+#include "support/fd_check.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
+using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+
+// A stand-in for the thumbnail or web-video daemon: a child process that
+// reports every SIGUSR1 it receives through a pipe.
+class FakeDaemon {
+ public:
+  FakeDaemon() {
+    int fds[2];
+    if (pipe(fds) != 0) return;
+    sigset_t usr1, saved;
+    sigemptyset(&usr1);
+    sigaddset(&usr1, SIGUSR1);
+    sigprocmask(SIG_BLOCK, &usr1, &saved);
+    if ((pid_ = fork()) == 0) {
+      for (int signal_number;
+           sigwait(&usr1, &signal_number) != 0 || write(fds[1], "U", 1) == 1;) {
+      }
+      _exit(0);
+    }
+    sigprocmask(SIG_SETMASK, &saved, nullptr);
+    close(fds[1]);
+    report_ = fds[0];
+  }
+  ~FakeDaemon() {
+    kill(pid_, SIGKILL);
+    waitpid(pid_, nullptr, 0);
+    close(report_);
+  }
+  pid_t pid() const { return pid_; }
+  // Signals received within `ms` milliseconds.
+  int Signals(int ms = 200) {
+    int count = 0;
+    struct pollfd p = {report_, POLLIN, 0};
+    char c;
+    for (; poll(&p, 1, ms) > 0 && read(report_, &c, 1) == 1; ms = 20) ++count;
+    return count;
+  }
+
+ private:
+  pid_t pid_ = -1;
+  int report_ = -1;
+};
+
+class ThumbQueueTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    paths_ = {thumb_queue_.c_str(), flv_queue_.c_str(), thumb_pid_.c_str(),
+              flv_pid_.c_str()};
+    previous_ = quvaidx::SetSpoolPaths(paths_);
+    ASSERT_EQ(mkdir(media_.c_str(), 0755), 0);
+    for (const char* name : {"x.jpg", "x.txt", "x.mp4", "x.mkv"}) {
+      WriteFile(media_ + "/" + name, "data");
+    }
+    WriteFile(thumb_pid_, std::to_string(daemon_.pid()));
+    WriteFile(flv_pid_, std::to_string(daemon_.pid()));
+  }
+  void TearDown() override { quvaidx::SetSpoolPaths(previous_); }
+
+  TempDir dir_;
+  std::string media_ = dir_.File("album.2015");
+  std::string thumb_queue_ = dir_.File("thumb_create.queue");
+  std::string flv_queue_ = dir_.File("flv_create.queue");
+  std::string thumb_pid_ = dir_.File("quvamkthumbd.pid");
+  std::string flv_pid_ = dir_.File("quvamkflvd.pid");
+  quvaidx::SpoolPaths paths_;
+  quvaidx::SpoolPaths previous_;
+  FakeDaemon daemon_;
+};
+
+// A photo queues its folder (once), a web video the file itself; a file of
+// no interest queues nothing but still wakes the daemon.
+TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
+  const std::pair<std::string, _tag_THUMB_TYPE_> calls[] = {
+      {media_ + "/x.jpg", THUMB_TYPE_PHOTO},
+      {media_, THUMB_TYPE_PHOTO},
+      {media_ + "/x.txt", THUMB_TYPE_PHOTO},
+      {media_ + "/x.mkv", THUMB_TYPE_VIDEO}};
+  for (const auto& c : calls) {
+    EXPECT_EQ(WriteThumbQueue(c.first.c_str(), c.second), 0) << c.first;
+    EXPECT_EQ(daemon_.Signals(), 1) << c.first;
+  }
+  EXPECT_EQ(ReadFile(thumb_queue_), media_ + "\n");
+  EXPECT_EQ(ReadFile(flv_queue_), "");
+  std::string video = media_ + "/x.mp4";
+  EXPECT_EQ(WriteThumbQueue(video.c_str(), THUMB_TYPE_VIDEO), 0);
+  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), 0);
+  EXPECT_EQ(ReadFile(flv_queue_), video + "\n" + media_ + "\n");
+  EXPECT_GE(daemon_.Signals(), 1);
+}
+
+// Other types do nothing; paths that are neither file nor folder fail.
+TEST_F(ThumbQueueTest, OtherTypesAndPathsDoNothing) {
+  for (int type : {0, 3}) {
+    auto t = static_cast<_tag_THUMB_TYPE_>(type);
+    EXPECT_EQ(WriteThumbQueue((media_ + "/x.jpg").c_str(), t), 0);
+    EXPECT_EQ(WriteThumbQueue(dir_.File("missing.jpg").c_str(), t), -1);
+  }
+  EXPECT_EQ(WriteThumbQueue(nullptr, THUMB_TYPE_PHOTO), -1);
+  EXPECT_EQ(WriteThumbQueue("/dev/null", THUMB_TYPE_PHOTO), -1);
+  EXPECT_EQ(daemon_.Signals(50), 0);
+  EXPECT_EQ(ReadFile(thumb_queue_), "");
+}
+
+// A missing, dead or recycled daemon (its pid file older than the process
+// now holding the pid) is never signalled and nothing is queued.
+TEST_F(ThumbQueueTest, MissingDeadOrRecycledDaemonQueuesNothing) {
+  LogCapture log;
+  unlink(thumb_pid_.c_str());
+  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
+  pid_t dead = fork();
+  if (dead == 0) _exit(0);
+  waitpid(dead, nullptr, 0);
+  WriteFile(flv_pid_, std::to_string(dead));
+  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), -1);
+  WriteFile(thumb_pid_, std::to_string(daemon_.pid()));
+  struct timespec old[2] = {{time(nullptr) - 3600, 0},
+                            {time(nullptr) - 3600, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, thumb_pid_.c_str(), old, 0), 0);
+  EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
+  EXPECT_EQ(daemon_.Signals(100), 0);
+  EXPECT_EQ(log.Normalized(),
+            (std::vector<std::string>{
+                "quvaidx_system:N [Error] quvamkthumbd is dead",
+                "quvaidx_system:N [Error] quvamkflvd is dead",
+                "quvaidx_system:N [Error] quvamkthumbd is dead"}));
+  EXPECT_EQ(ReadFile(thumb_queue_), "");
+  EXPECT_EQ(ReadFile(flv_queue_), "");
+}
+
+}  // namespace
