@@ -6,7 +6,6 @@
 // daemon that is not running is reported on one line and nothing at all is
 // queued.
 #include <errno.h>
-#include <getopt.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -41,29 +40,25 @@ constexpr PreviewDaemon kVideoDaemon = {
     quvaidx::kFlvSpoolQueue.daemon, quvaidx::kFlvSpoolQueue.pid_file,
     quvaidx::kFlvSpoolQueue.queue, "web-video"};
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx thumb [--video] PATH...\n"
-      "\n"
-      "Queues preview work for each PATH, a directory or a regular file, and\n"
-      "wakes the daemon that does it:\n"
-      "  photos (default)  the folder of a web photo, or a directory, goes to\n"
-      "                    %s for %s\n"
-      "  --video           a web video, or a directory, goes to\n"
-      "                    %s for %s\n"
-      "Files of no interest queue nothing. Paths are queued as canonical\n"
-      "absolute paths. The daemon must be running (its pid file names a live\n"
-      "process); otherwise nothing is queued.\n"
-      "\n"
-      "Options:\n"
-      "  -V, --video    queue web-video work instead of thumbnails\n"
-      "  -v, --verbose  also show the library's log lines on stderr\n"
-      "  -h, --help     show this help\n"
-      "\n"
+quvaidx_tools::CommandLine MakeLine(bool* video) {
+  return Subcommand(
+      kName, {"[--video] PATH..."},
+      std::string("Queues preview work for each PATH, a directory or a "
+                  "regular file, and\nwakes the daemon that does it:\n"
+                  "  photos (default)  the folder of a web photo, or a "
+                  "directory, goes to\n                    ") +
+          kPhotoDaemon.queue + " for " + kPhotoDaemon.name +
+          "\n  --video           a web video, or a directory, goes to\n"
+          "                    " +
+          kVideoDaemon.queue + " for " + kVideoDaemon.name +
+          "\nFiles of no interest queue nothing. Paths are queued as "
+          "canonical\nabsolute paths. The daemon must be running (its pid "
+          "file names a live\nprocess); otherwise nothing is queued.\n",
+      {quvaidx_tools::Flag("video", 'V', video,
+                           "queue web-video work instead of thumbnails")},
       "Exit status: 0 when every PATH was handled, 2 on a usage error, a\n"
-      "missing PATH, a daemon that is not running or a failed queue write.\n",
-      kPhotoDaemon.queue, kPhotoDaemon.name, kVideoDaemon.queue,
-      kVideoDaemon.name);
+      "missing PATH, a daemon that is not running or a failed queue "
+      "write.\n");
 }
 
 // The canonical absolute path of `path`, which must name a directory or a
@@ -93,12 +88,12 @@ bool ResolvePath(const char* path, std::string* resolved) {
 
 int RunThumb(int argc, char** argv) {
   bool video = false;
-  int status =
-      ParseFlags(argc, argv, kName, {{"video", 'V', &video}}, PrintHelp);
+  int first = 0;
+  int status = ParseArguments(MakeLine(&video), argc, argv, &first);
   if (status != kContinue) return status;
-  if (optind >= argc) return UsageError(kName, "missing PATH");
+  if (first >= argc) return UsageError(kName, "missing PATH");
   std::vector<std::string> paths;
-  for (int i = optind; i < argc; ++i) {
+  for (int i = first; i < argc; ++i) {
     std::string resolved;
     if (!ResolvePath(argv[i], &resolved)) return kExitError;
     paths.push_back(resolved);
