@@ -72,7 +72,8 @@ bool CopyAfterLines(int in, int out, int n) {
     const char* start = block;
     const char* end = block + got;
     while (skipped < n && start < end) {
-      const void* newline = memchr(start, '\n', static_cast<size_t>(end - start));
+      const void* newline =
+          memchr(start, '\n', static_cast<size_t>(end - start));
       if (newline == nullptr) {
         start = end;  // the line goes on in the next block
       } else {
@@ -119,8 +120,16 @@ int RenameFile(const char* source, const char* destination) {
 
 int FileRemoveHeadingLine(const char* path, int n) {
   if (path == nullptr) return -1;
-  int in = open(path, O_RDONLY | O_CLOEXEC);
-  if (in < 0) return -1;
+  // The copy replaces whatever the path names: through a link, the link
+  // would become a copy of its target.
+  int in = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (in < 0) {
+    if (errno == ELOOP) {
+      AppLogError(3, "%s:%d [Error] %s is a symbolic link; not trimmed",
+                  kModule, __LINE__, path);
+    }
+    return -1;
+  }
   struct stat st;
   if (fstat(in, &st) != 0 || S_ISDIR(st.st_mode)) {
     close(in);
