@@ -172,7 +172,15 @@ bool TrackConnection(struct bufferevent* bev, EventArgs* args) {
     delete connection;
     return false;
   }
-  g_by_fd[static_cast<size_t>(fd)] = connection;
+  Connection*& slot = g_by_fd[static_cast<size_t>(fd)];
+  if (slot != nullptr) {
+    // The descriptor was closed behind the server's back (its bufferevent
+    // freed elsewhere): the old record describes nothing any more.
+    g_pending_total -= slot->pending_output;
+    --g_tracked;
+    delete slot;
+  }
+  slot = connection;
   ++g_tracked;
   ArmDeadlineCheck();
   return true;
