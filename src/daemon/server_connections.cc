@@ -63,8 +63,7 @@ Connection* Find(struct bufferevent* bev) {
   return connection != nullptr && connection->bev == bev ? connection : nullptr;
 }
 
-// Keeps the unsent byte counts current as replies are queued and written;
-// a write the peer took counts as progress.
+// Keeps the unsent byte counts current as replies are queued and written.
 void OnOutputChanged(struct evbuffer*, const struct evbuffer_cb_info* info,
                      void* arg) {
   Connection* connection = static_cast<Connection*>(arg);
@@ -72,7 +71,10 @@ void OnOutputChanged(struct evbuffer*, const struct evbuffer_cb_info* info,
   connection->pending_output -= info->n_deleted;
   g_pending_total += info->n_added;
   g_pending_total -= info->n_deleted;
-  if (info->n_deleted > 0 && connection->wait != Wait::kPacket) {
+  // Only a connection waiting on its peer to take replies counts writes as
+  // progress; the others restart their clocks as requests are answered.
+  if (info->n_deleted > 0 &&
+      (connection->wait == Wait::kDrain || connection->wait == Wait::kFlush)) {
     connection->since_ms = NowMs();
   }
 }
