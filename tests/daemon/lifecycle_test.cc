@@ -42,16 +42,27 @@ class LifecycleTest : public ::testing::Test {
   std::string pid_file_ = dir_.File("d.pid");
 };
 
-// The pid goes in without a line end, replacing a dead instance's; a live
-// instance is refused, its pid file kept, and BecomeDaemon does not detach.
-// A pid file that cannot be made is an error; a missing one is deleted.
+// The pid goes in without a line end, replacing a dead instance's, with
+// mode 0644 whatever the umask or the old file's mode; a live instance is
+// refused, its pid file kept, and BecomeDaemon does not detach. A pid file
+// that cannot be made is an error; a missing one is deleted.
 TEST_F(LifecycleTest, OneInstanceAtATime) {
   pid_t dead = fork();
   if (dead == 0) _exit(0);
   waitpid(dead, nullptr, 0);
   WriteFile(pid_file_, std::to_string(dead) + "\n");
+  chmod(pid_file_.c_str(), 0666);
+  mode_t saved = umask(0);
   ASSERT_EQ(BecomeProcess(pid_file_.c_str()), 0);
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
+  std::string fresh = dir_.File("fresh.pid");
+  ASSERT_EQ(BecomeProcess(fresh.c_str()), 0);
+  umask(saved);
+  for (const std::string& path : {pid_file_, fresh}) {
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0644u) << path;
+  }
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
   EXPECT_EQ(BecomeDaemon(pid_file_.c_str()), -1);
@@ -114,23 +125,6 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   EXPECT_NE(access(dir_.File("nowhere").c_str(), F_OK), 0);
 }
 
-// A pid file is readable by all and writable by its owner alone, whatever
-// the umask and whatever mode an earlier file had.
-TEST_F(LifecycleTest, PidFileModeIs0644) {
-  mode_t saved = umask(0);
-  const std::string old_file = dir_.File("old.pid");
-  WriteFile(old_file, "4000000");
-  chmod(old_file.c_str(), 0666);
-  for (const std::string& path : {pid_file_, old_file}) {
-    ASSERT_EQ(BecomeProcess(path.c_str()), 0);
-    struct stat st;
-    ASSERT_EQ(stat(path.c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode & 07777, 0644u) << path;
-    EXPECT_EQ(ReadFile(path), std::to_string(getpid()));
-  }
-  umask(saved);
-}
-
 // Of instances started at the same moment exactly one runs, every time:
 // the check of the pid in the file alone lets several through.
 TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
@@ -171,47 +165,6 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
     ASSERT_EQ(std::count(outcome.begin(), outcome.end(), 'R'), 1)
         << "attempt " << attempt << ": " << outcome;
   }
-}
-
-// The detached daemon keeps the lock it took before detaching: a second
-// instance is refused even when the pid in the file misleads the check.
-TEST_F(LifecycleTest, LockOutlivesDetaching) {
-  std::string stop = dir_.File("stop");
-  pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    if (BecomeDaemon(pid_file_.c_str()) != 0) _exit(3);
-    for (int i = 0; i < 200 && access(stop.c_str(), F_OK) != 0; ++i) {
-      usleep(25 * 1000);
-    }
-    _exit(0);
-  }
-  int status = 0;
-  waitpid(child, &status, 0);
-  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  auto end = std::chrono::steady_clock::now() + std::chrono::seconds(2);
-  std::string daemon_pid;
-  while ((daemon_pid = ReadFile(pid_file_)) == std::to_string(child) ||
-         daemon_pid.empty()) {
-    ASSERT_LT(std::chrono::steady_clock::now(), end);
-    usleep(2000);
-  }
-  WriteFile(pid_file_, "4000000");  // same file, a pid that is not alive
-  ::testing::internal::CaptureStdout();
-  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
-  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
-            "Daemon alive. No need to start\n");
-  WriteFile(stop, "");
-  // Ended (a zombie its new parent has not reaped yet counts).
-  const std::string stat_path = "/proc/" + daemon_pid + "/stat";
-  auto running = [&] {
-    std::string stat = ReadFile(stat_path);
-    size_t close = stat.rfind(')');
-    return close != std::string::npos && stat.compare(close, 3, ") Z") != 0;
-  };
-  end = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-  while (running() && std::chrono::steady_clock::now() < end) usleep(2000);
-  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), 0);  // the lock went with it
 }
 
 // DeletePidFile removes a stale pid file and this process's own, never that
@@ -273,8 +226,11 @@ TEST_F(LifecycleTest, RecycledPidDoesNotLockTheDaemonOut) {
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
 }
 
+// The detached process also keeps the lock taken before detaching: a second
+// instance is refused even when the pid in the file misleads the check.
 TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   std::string report = dir_.File("report");
+  std::string stop = dir_.File("stop");
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
@@ -290,6 +246,9 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
     std::ofstream(report + ".tmp") << getpid() << " " << (getsid(0) == getpid())
                                    << " " << cwd << " " << in;
     rename((report + ".tmp").c_str(), report.c_str());
+    for (int i = 0; i < 200 && access(stop.c_str(), F_OK) != 0; ++i) {
+      usleep(25 * 1000);
+    }
     _exit(0);
   }
   int status = 0;
@@ -308,6 +267,21 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   EXPECT_EQ(leader, "1");
   EXPECT_EQ(cwd, "/");
   EXPECT_EQ(stdin_target, "/dev/null");
+  WriteFile(pid_file_, "4000000");  // same file, a pid that is not alive
+  ::testing::internal::CaptureStdout();
+  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
+  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
+            "Daemon alive. No need to start\n");
+  WriteFile(stop, "");
+  // Ended: a zombie its new parent has not reaped yet counts.
+  auto running = [&] {
+    std::string stat = ReadFile("/proc/" + pid + "/stat");
+    size_t close = stat.rfind(')');
+    return close != std::string::npos && stat.compare(close, 3, ") Z") != 0;
+  };
+  end = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+  while (running() && std::chrono::steady_clock::now() < end) usleep(2000);
+  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), 0);  // the lock went with it
 }
 
 // Ready at once, polled every ten seconds, or given up after fifteen
