@@ -6,6 +6,10 @@
 //            at the end (lets replies pile up: backpressure);
 //     bit 1: half-close the connection right after the last chunk;
 //     bits 2-3: loop iterations run between two chunks (0 to 3);
+//     bit 4: stall: the deadlines are cut to a few milliseconds and the
+//            client goes quiet, once the server has settled (a lazy client
+//            at once, leaving its replies unread), so the server must close
+//            the connection;
 //   byte 1: chunk sizes: 0 writes the stream in one piece, otherwise the low
 //           four bits give the largest chunk (1 << bits) and the high four
 //           bits seed the generator choosing each chunk's size;
@@ -19,12 +23,11 @@
 //
 // Every run checks that each reply is a well-formed packet, that replies come
 // in request order, that a connection the server keeps open had every
-// complete request answered, and that no descriptor and no connection
-// outlives the run. A violation aborts with a message.
-//
-// With QUVAIDX_FUZZ_EXPECT_FLUSH=1 in the environment, a connection that the
-// server closed (handler refusal, oversized header, or the client's
-// half-close) must also have delivered every reply queued before the close.
+// complete request answered, that a connection the server closed (handler
+// refusal, oversized header, or the client's half-close) delivered every
+// reply queued before the close, that a stalled connection is closed within
+// a bounded time, and that no descriptor and no connection outlives the
+// run. A violation aborts with a message.
 #include <dirent.h>
 #include <errno.h>
 #include <signal.h>
@@ -36,6 +39,7 @@
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <linux/sockios.h>
@@ -69,13 +73,13 @@ constexpr int kMaxCloseRounds = 1000;
 constexpr unsigned kMaxPad = kMaxSendBody + 64;
 
 char g_path[sizeof(sockaddr_un::sun_path)];
+// Deadlines in stall mode, and how long the server may take to act on them.
+constexpr ServerLimits kStallLimits = {2, 4, kMaxTotalPendingOutput};
+constexpr int kMaxStallMs = 2000;
 // Requests handed to the handler during the current run, and how many of
 // those the handler refused (returned non-zero or threw).
 uint32_t g_handler_calls = 0;
 uint32_t g_handler_refusals = 0;
-// Set from QUVAIDX_FUZZ_EXPECT_FLUSH: also require that a connection the
-// server closes first delivers the replies it had queued.
-bool g_expect_flush = false;
 
 [[noreturn]] void Fail(const char* what) {
   fprintf(stderr, "fuzz_event_server: %s\n", what);
@@ -313,6 +317,25 @@ void Settle(Client& client) {
   }
 }
 
+// Goes quiet with deadlines of a few milliseconds: whatever the connection
+// was waiting for, the server must close it.
+void Stall(Client& client) {
+  SetServerLimits(&kStallLimits);
+  struct timespec start;
+  clock_gettime(CLOCK_MONOTONIC, &start);
+  while (GetCurrentConnCount() != 0) {
+    struct timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    long long ms = (now.tv_sec - start.tv_sec) * 1000LL +
+                   (now.tv_nsec - start.tv_nsec) / 1000000;
+    if (ms > kMaxStallMs) Fail("a stalled connection was never closed");
+    Step(client.base);
+    if (!client.lazy) Drain(client);
+    usleep(100);
+  }
+  SetServerLimits(nullptr);
+}
+
 void RunSession(struct event_base* base, const uint8_t* data, size_t size) {
   const uint8_t flags = data[0];
   Chunker chunker(data[1], data[2]);
@@ -320,6 +343,7 @@ void RunSession(struct event_base* base, const uint8_t* data, size_t size) {
   const size_t stream_size = size - kControlBytes;
   const int steps_between_chunks = (flags >> 2) & 3;
   const bool half_close = (flags & 2) != 0;
+  const bool stall = (flags & 16) != 0;
 
   Client client;
   client.base = base;
@@ -351,9 +375,15 @@ void RunSession(struct event_base* base, const uint8_t* data, size_t size) {
     }
   }
   if (half_close) shutdown(client.fd, SHUT_WR);
-  Settle(client);
+  if (stall && client.lazy) {
+    // Replies left unread, perhaps with reading paused for them or a close
+    // waiting on them: the server must give up on the connection.
+    Stall(client);
+  } else {
+    Settle(client);
+  }
 
-  if (open && !half_close && !client.server_closed) {
+  if (!stall && open && !half_close && !client.server_closed) {
     // The server kept the connection: it must have read everything and
     // answered every complete request, in order.
     const uint32_t expected = CompletePackets(stream, stream_size);
@@ -369,7 +399,9 @@ void RunSession(struct event_base* base, const uint8_t* data, size_t size) {
     }
   }
 
-  if (g_expect_flush && client.server_closed) {
+  if (stall && !client.lazy) Stall(client);
+
+  if (!stall && client.server_closed) {
     // Every handler call that returned 0 was promised a reply.
     const uint32_t answered = g_handler_calls - g_handler_refusals;
     if (client.checker.replies() != answered) {
@@ -394,8 +426,6 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
   ChageLogLevel(7);
   // As a daemon must: libevent's socket writes raise SIGPIPE otherwise.
   signal(SIGPIPE, SIG_IGN);
-  const char* expect_flush = getenv("QUVAIDX_FUZZ_EXPECT_FLUSH");
-  g_expect_flush = expect_flush != nullptr && strcmp(expect_flush, "1") == 0;
   const char* dir = getenv("TMPDIR");
   if (dir == nullptr || *dir == '\0') dir = "/tmp";
   int n = snprintf(g_path, sizeof(g_path), "%s/quvaidx-fuzz-%d.sock", dir,

@@ -15,14 +15,28 @@
 // plain variables without locking. A slow handler holds up every connection
 // of the daemon.
 //
-// Robustness: a handler that throws is logged and its connection closed; a
-// header announcing more than kMaxRecvBody bytes closes the connection
-// without calling the handler; a reply too large for a packet is replaced by
-// {"success":false,"reason":"reply too large"}; every complete request in a
-// connection's input buffer is answered, in order, in the same callback; a
-// connection stops being read while more than kMaxPendingOutput bytes of its
-// replies wait to be sent; running out of descriptors pauses accepting for
-// kAcceptPauseMs instead of ending the loop.
+// Robustness:
+// - a handler that throws is logged and its connection closed;
+// - a header announcing more than kMaxRecvBody bytes closes the connection
+//   without calling the handler;
+// - a body the JSON reader rejects reaches the handler as an empty object,
+//   never as a half-read value;
+// - a reply too large for a packet is replaced by
+//   {"success":false,"reason":"reply too large"};
+// - every complete request in a connection's input buffer is answered, in
+//   order, in the same callback;
+// - a peer that shuts down its sending side still gets every reply queued
+//   for it before the server closes the connection;
+// - a connection stops being read while more than kMaxPendingOutput bytes of
+//   its replies wait to be sent, and the unsent replies of all connections
+//   together are bounded (ServerLimits);
+// - a peer that stalls in the middle of a request, or waits too long between
+//   requests, is closed (ServerLimits);
+// - running out of descriptors first closes the connections that have
+//   waited longest, and only when none has waited kAcceptPauseMs pauses
+//   accepting for that long, instead of ending the loop;
+// - BuildServer never removes anything at its socket path but a stale
+//   socket: it takes no socket away from a daemon that still answers on it.
 //
 // Log lines carry the module name "quvaidx_daemon" and go through
 // AppLogError.
@@ -32,6 +46,7 @@
 #include <stddef.h>
 #include <stdint.h>
 #include <sys/socket.h>
+#include <sys/types.h>
 
 #include <json/json.h>
 
@@ -45,8 +60,28 @@ struct bufferevent;
 // its requests until the output drains.
 constexpr size_t kMaxPendingOutput = 1024 * 1024;
 // How long accepting pauses after the process or system ran out of
-// descriptors.
+// descriptors, when no connection has waited that long (see OnAcceptError).
 constexpr int kAcceptPauseMs = 100;
+// Defaults of ServerLimits.
+constexpr int kPacketDeadlineMs = 10 * 1000;
+constexpr int kIdleDeadlineMs = 5 * 60 * 1000;
+constexpr size_t kMaxTotalPendingOutput = 64 * 1024 * 1024;
+
+// The limits the server holds its peers to. A field of 0 or less turns that
+// limit off.
+struct ServerLimits {
+  // A request must have arrived whole this many milliseconds after its
+  // first byte, however steadily its bytes trickle in.
+  int packet_deadline_ms;
+  // A connection may wait this many milliseconds for its next request, and
+  // a connection whose replies wait to be sent (or that is finishing) may go
+  // this long without the peer taking any of them.
+  int idle_deadline_ms;
+  // Unsent reply bytes of all connections together. When a reply takes the
+  // sum past it, the connection holding the most unsent bytes is closed
+  // (logged at level 3), until the sum is back within the bound.
+  size_t max_total_pending_output;
+};
 
 struct EventArgs;
 
@@ -54,7 +89,7 @@ struct EventArgs;
 // returns 0 to have the reply sent; any other result ends the connection
 // without a reply and without reading further requests (replies already
 // queued for earlier requests of the same connection are still delivered
-// before it closes).
+// before it closes). GetPeerCredentials tells it who is asking.
 typedef int (*EventHandler)(Json::Value& request, Json::Value& reply,
                             EventArgs* args);
 
@@ -67,22 +102,72 @@ struct EventArgs {
   EventHandler handler;  // called once for every request received
 };
 
+// How BuildServerWithAccess sets up the socket file.
+struct ServerSocketAccess {
+  mode_t mode;  // permission bits of the socket file (e.g. 0660)
+  gid_t group;  // its group, or (gid_t)-1 to keep the one it is created with
+};
+
+// The process at the other end of a connection, as the kernel recorded it
+// when the process connected.
+struct PeerCredentials {
+  pid_t pid;
+  uid_t uid;
+  gid_t gid;
+};
+
 // The listener of the running server; null while none runs.
 QUVAIDX_API extern struct evconnlistener* g_listener;
 // Number of connections open at the moment.
 QUVAIDX_API extern int32_t g_conn_count;
 
-// Removes whatever file is at `path` (a socket left from an earlier run) and
-// listens there, on `base`, with a backlog of 16. The socket file gets the
-// process's file-creation mask. When SIGPIPE still has its default action
-// (ending the process), it is set to be ignored: a client that goes away
-// while its reply is being written must not end the daemon.
-// Returns 0 with g_listener set. Returns -1 when the old file cannot be
-// removed, when the listener cannot be created (g_listener stays null), or
-// when the path is longer than kMaxSocketPath bytes (no file is removed or
-// created). Each failure is logged at level 3.
+// Listens on `path`, on `base`, with a backlog of 16, as
+// BuildServerWithAccess(base, path, args, nullptr) does: the socket file
+// gets the process's file-creation mask.
 QUVAIDX_API int BuildServer(struct event_base* base, const char* path,
                             EventArgs* args);
+
+// Makes way for the socket at `path` and listens there, on `base`, with a
+// backlog of 16.
+// - Nothing at `path`: the socket is created there.
+// - A stale socket (one that refuses connections, left by a daemon that
+//   died): removed and replaced.
+// - A socket on which a daemon still takes connections: left alone; -1, and
+//   a level-3 line saying it is in use.
+// - A regular file, directory, link or anything else, or a path that cannot
+//   be examined or removed: left alone; -1 and the level-3 line
+//   "remove <path>".
+// With `access` null the socket file gets the process's file-creation mask.
+// Otherwise it is created for the owner alone (0600 at most, where the
+// system allows setting a socket's mode before binding it), then given
+// access->group (unless (gid_t)-1) and finally access->mode, so at no moment
+// can a process outside the owner and the intended group connect. Failing to
+// set either removes the socket again and gives -1 (logged at level 3).
+// When SIGPIPE still has its default action (ending the process), it is set
+// to be ignored: a client that goes away while its reply is being written
+// must not end the daemon.
+// Returns 0 with g_listener set. Returns -1, with g_listener unchanged, on
+// the refusals above, when a server already runs, when the listener cannot
+// be created, or when the path is longer than kMaxSocketPath bytes (nothing
+// is examined or created then). Each failure is logged at level 3.
+QUVAIDX_API int BuildServerWithAccess(struct event_base* base, const char* path,
+                                      EventArgs* args,
+                                      const ServerSocketAccess* access);
+
+// Sets the limits of the running server and of later ones; null restores
+// the defaults (kPacketDeadlineMs, kIdleDeadlineMs, kMaxTotalPendingOutput).
+// Deadlines are checked about every quarter of the shorter one (at least
+// once a second while connections are open), and connections closed for
+// them are counted in one level-6 line per check. Connections that a daemon
+// serves with these callbacks on a listener of its own are not held to
+// them.
+QUVAIDX_API void SetServerLimits(const ServerLimits* limits);
+
+// During a handler call: stores in *peer the credentials of the process on
+// the other end of the connection whose request is being handled, and
+// returns 0. Returns -1, leaving *peer unchanged, outside a handler call (or
+// when peer is null or the system does not tell).
+QUVAIDX_API int GetPeerCredentials(PeerCredentials* peer);
 
 // When a server runs: frees its listener (closing the listening socket),
 // sets g_listener to null and removes the file at `path`. Otherwise does
@@ -101,7 +186,9 @@ QUVAIDX_API Json::Value MakeResponse(bool success, const char* reason);
 QUVAIDX_API int CheckBufferevent(struct bufferevent* bev);
 
 // Takes one packet out of the input buffer of `bev` and parses its body into
-// `value`, as RecvPacket does.
+// `value`. Unlike RecvPacket, `value` is replaced only when the JSON reader
+// accepts the body (trailing bytes after a complete value are accepted); an
+// empty or rejected body leaves it as it was, never half-read.
 // REQUIRES: CheckBufferevent(bev) returned 1.
 // Returns 0, or -1 (logged at level 3) when fewer bytes came out than the
 // header announced or the header announces more than kMaxRecvBody bytes.
@@ -114,6 +201,13 @@ QUVAIDX_API int SendPacketEv(struct bufferevent* bev, Json::Value& value);
 
 // libevent callbacks registered by BuildServer and OnAccept. Exported so
 // that a daemon can reuse them on connections of its own.
+// onEvent: the end of the peer's stream (BEV_EVENT_EOF) stops reading and
+// closes the connection once the replies already queued are written; any
+// other event closes it at once.
+// OnAcceptError: on running out of descriptors, closes up to 16 connections
+// that have waited longest for their peer, if they waited kAcceptPauseMs or
+// more, and accepts again at once; else pauses accepting for kAcceptPauseMs.
+// Any other error ends the loop.
 QUVAIDX_API void OnAccept(struct evconnlistener* listener, int fd,
                           struct sockaddr* address, int address_length,
                           void* args);

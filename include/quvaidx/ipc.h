@@ -14,8 +14,9 @@
 // Only -2 makes the path-based exchanges reconnect and repeat the request.
 //
 // Blocking. Every call blocks its thread until the transfer completes or
-// fails; sockets get no time-outs. Waits between connection attempts are one
-// second each.
+// fails; reads and writes get no time-outs. A connection attempt waits at
+// most kConnectTimeoutMs for a daemon that does not take it; waits between
+// connection attempts are one second each.
 //
 // Threads. No shared state: any number of threads may use these functions at
 // once, each on its own descriptor.
@@ -44,6 +45,10 @@ constexpr size_t kMaxRecvBody = kPacketBufferSize - 1;
 // Longest socket path, in bytes, that fits a Unix-domain address with its
 // terminating zero. Longer paths are refused, never cut.
 constexpr size_t kMaxSocketPath = 107;
+// How long one connection attempt waits, at most, for a daemon that does not
+// take the connection (its listen backlog is full) before it counts as
+// failed.
+constexpr int kConnectTimeoutMs = 3000;
 // How many times a path-based exchange reconnects and repeats its request
 // after the daemon closed or reset the connection, before it gives up.
 constexpr int kMaxExchangeRestarts = 3;
@@ -76,7 +81,9 @@ QUVAIDX_API int SendPacket(int fd, Json::Value& value);
 // Receives one packet and parses its body into `value`. The body is read up
 // to its first zero byte; a body that is not valid JSON (including one
 // nested too deeply) still yields 0 and leaves `value` as the parser left
-// it, so callers receive into a fresh null value and judge it by its keys.
+// it (possibly half-read), so callers receive into a fresh null value and
+// judge it by its keys. (The event server is stricter with requests: see
+// RecvPacketEv in quvaidx/daemon.h.)
 // Returns 0 when header and body were read in full; -2 when a read was
 // reset; -1 otherwise: an error, an end of stream before the packet was
 // complete, or a header announcing more than kMaxRecvBody bytes (logged at
@@ -89,7 +96,9 @@ QUVAIDX_API int RecvPacket(int fd, Json::Value& value);
 
 // Connects to the daemon listening on `path`, making up to `attempts`
 // attempts one second apart (a wait follows every failed attempt, the last
-// included). With `handshake`, each connected socket must also answer a
+// included). An attempt that the daemon does not take within
+// kConnectTimeoutMs (its backlog stays full) fails like a refused one. With
+// `handshake`, each connected socket must also answer a
 // {"command":"HANDSHAKE"} request with one packet, whatever it holds.
 // Returns the connected descriptor, which belongs to the caller, or -1 when
 // every attempt failed, when attempts <= 0, or at once when the path is

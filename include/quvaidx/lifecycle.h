@@ -6,36 +6,47 @@
 // is made (BecomeDaemon forks); the event base, BuildServer and the loop;
 // StopServer; DeletePidFile.
 //
-// A pid file holds the process id in decimal, with no line end. Whether the
-// process a pid file names is alive is the host's decision
-// (QLIBCProcAliveByPidFile): it must exist and must not have started after
-// the pid file was written, so a pid recycled by an unrelated process does
-// not lock a crashed daemon out.
+// A pid file holds the process id in decimal, with no line end, and has
+// mode 0644 whatever the file-creation mask. Whether the process a pid file
+// names is alive is the host's decision (QLIBCProcAliveByPidFile): it must
+// exist and must not have started after the pid file was written, so a pid
+// recycled by an unrelated process does not lock a crashed daemon out.
 //
-// Failures are logged at level 3 (module "quvaidx_daemon"). Nothing here
-// keeps state or takes a lock; the alive check and the pid-file write are
-// two steps, so two instances started at the same moment can both pass.
+// Single instance: besides that check, the daemon holds an exclusive flock
+// on its open pid file for the rest of its life (the descriptor stays open,
+// close-on-exec). A second instance that cannot take the lock is refused
+// exactly as one that finds a live pid, so of any number started at the same
+// moment exactly one runs. Only a regular file of one name is used as a pid
+// file: a symbolic link, FIFO, device, directory or hard-linked file at the
+// path is refused (logged) and left alone, and the open never waits.
+//
+// Failures are logged at level 3 (module "quvaidx_daemon"). Call these
+// functions from one thread.
 #ifndef QUVAIDX_LIFECYCLE_H_
 #define QUVAIDX_LIFECYCLE_H_
 
 #include "quvaidx/export.h"
 
-// Refuses to start when the process named in `pid_file` is alive (prints
-// "Daemon alive. No need to start" on standard output and returns -1,
-// leaving the file alone). Otherwise detaches with daemon(0, 0) (background,
-// new session, working directory /, standard streams on /dev/null) and
-// writes the detached process's id into `pid_file` (a relative path is
-// taken from the working directory before detaching).
-// Returns 0 in the detached process; -1 when detaching failed, or when the
-// pid file could not be created or written (the process then stays
-// detached).
+// Refuses to start when the process named in `pid_file` is alive or another
+// instance holds the file's lock (prints "Daemon alive. No need to start" on
+// standard output and returns -1, leaving the file alone, without
+// detaching). Otherwise opens and locks the pid file (a relative path is
+// taken from the current working directory), detaches with daemon(0, 0)
+// (background, new session, working directory /, standard streams on
+// /dev/null), and writes the detached process's id into it; the detached
+// process inherits the lock.
+// Returns 0 in the detached process; -1 when the pid file is refused or
+// cannot be created, locked or written, or when detaching failed (logged).
 QUVAIDX_API int BecomeDaemon(const char* pid_file);
 
 // As BecomeDaemon without detaching: the pid file gets the id of the
 // calling process, which keeps its streams and working directory.
 QUVAIDX_API int BecomeProcess(const char* pid_file);
 
-// Removes `path`. Always returns 0.
+// Removes the pid file `path`, unless it names another process that is
+// alive (then it is left in place and a level-3 line says so): a stale file,
+// or this process's own, goes. When this process holds the file's lock, the
+// lock is released after the removal. Always returns 0.
 QUVAIDX_API int DeletePidFile(const char* path);
 
 // Creates the marker file `path`, or empties it. Returns 0, or -1 when it

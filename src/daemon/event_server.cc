@@ -1,5 +1,10 @@
 // The event server: listener, per-connection packet assembly, handler calls
-// and replies, all inside the daemon's libevent loop.
+// and replies, all inside the daemon's libevent loop. The socket file is made
+// in server_socket.cc; the record of connections and the limits drawn from
+// it live in server_connections.cc.
+//
+// Map: ending connections; the packet at the head of a connection's input;
+// handling one packet; exported operations; libevent callbacks.
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
@@ -8,6 +13,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <exception>
 
 #include <event2/buffer.h>
@@ -16,6 +22,8 @@
 #include <event2/listener.h>
 #include <event2/util.h>
 
+#include "daemon/server_connections.h"
+#include "daemon/server_socket.h"
 #include "ipc/packet_codec.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/log.h"
@@ -25,21 +33,27 @@ int32_t g_conn_count = 0;
 
 namespace {
 
+using quvaidx::CloseConnection;
+using quvaidx::PacketPeek;
+using quvaidx::PeekStatus;
+using quvaidx::Wait;
+
 constexpr char kModule[] = "quvaidx_daemon";
+// Connections closed at most, longest waiting first, each time accepting
+// runs out of descriptors: a listen backlog's worth.
+constexpr int kClosedPerAcceptFailure = 16;
 
 // Re-enables the listener after accepting paused for lack of descriptors.
 // Lives as long as the listener.
 struct event* g_accept_resume = nullptr;
+// The connection whose request the handler is answering; null outside
+// handler calls (GetPeerCredentials).
+struct bufferevent* g_handler_connection = nullptr;
 
 const char* DaemonName(void* args) {
   const EventArgs* event_args = static_cast<const EventArgs*>(args);
   return event_args != nullptr && event_args->name != nullptr ? event_args->name
                                                               : "";
-}
-
-void CloseConnection(struct bufferevent* bev) {
-  --g_conn_count;
-  bufferevent_free(bev);  // closes the socket
 }
 
 void CloseWhenFlushed(struct bufferevent* bev, void*) { CloseConnection(bev); }
@@ -59,6 +73,7 @@ void FinishConnection(struct bufferevent* bev) {
   bufferevent_disable(bev, EV_READ);
   bufferevent_setcb(bev, nullptr, CloseWhenFlushed, CloseOnEvent, nullptr);
   bufferevent_enable(bev, EV_WRITE);
+  quvaidx::NoteWait(bev, Wait::kFlush, /*progress=*/true);
 }
 
 bool IsOutOfDescriptors(int err) {
@@ -112,30 +127,70 @@ int CallHandler(EventArgs* args, Json::Value& request, Json::Value& reply) {
   return -1;
 }
 
+// Logs why the packet at the head of an input of `arrived` bytes cannot be
+// taken yet. The one place of both lines, so that CheckBufferevent and the
+// server's own path write them alike.
+void LogIncomplete(size_t arrived, const PacketPeek& peek) {
+  if (arrived < kPacketHeaderSize) {
+    AppLogError(3, "%s:%d bufferevent at least %d bytes [%d bytes]", kModule,
+                __LINE__, static_cast<int>(kPacketHeaderSize),
+                static_cast<int>(arrived));
+    return;
+  }
+  AppLogError(6,
+              "%s:%d bufferevent hasn't arrived completely, and wait "
+              "[arrived=%d, total=%d]",
+              kModule, __LINE__, static_cast<int>(arrived),
+              static_cast<int>(peek.total));
+}
+
+// Reads the header at the head of `input` without removing anything.
+PacketPeek PeekInput(struct evbuffer* input, size_t* arrived) {
+  *arrived = evbuffer_get_length(input);
+  unsigned char head[kPacketHeaderSize] = {0, 0, 0, 0};
+  if (*arrived > 0) {
+    evbuffer_copyout(input, head, std::min(*arrived, sizeof(head)));
+  }
+  return quvaidx::PeekPacket(head, *arrived);
+}
+
+// Replaces `value` with the parsed body, unless the reader rejects it: a
+// half-read request must not reach a handler.
+void ParseRequest(const char* body, size_t length, Json::Value& value) {
+  Json::Value parsed;
+  if (quvaidx::ParsePacketBody(body, length, parsed)) value.swap(parsed);
+}
+
 enum class PacketOutcome { kAnswered, kWaiting, kClosed };
 
 // Handles the packet at the head of the connection's input, if it is
-// complete: parse, handler, reply.
+// complete: parse, handler, reply. The header is read once.
 PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
   struct evbuffer* input = bufferevent_get_input(bev);
-  if (evbuffer_get_length(input) >= kPacketHeaderSize) {
-    unsigned char header[kPacketHeaderSize];
-    evbuffer_copyout(input, header, sizeof(header));
-    size_t length = quvaidx::DecodeBodyLength(header);
-    if (length > kMaxRecvBody) {
-      AppLogError(3, "%s:%d [Error] [%s] packet too large: %zu bytes, fd = %d",
-                  kModule, __LINE__, DaemonName(args), length,
-                  static_cast<int>(bufferevent_getfd(bev)));
-      FinishConnection(bev);
-      return PacketOutcome::kClosed;
-    }
+  size_t arrived = 0;
+  PacketPeek peek = PeekInput(input, &arrived);
+  if (peek.status == PeekStatus::kTooLarge) {
+    AppLogError(3, "%s:%d [Error] [%s] packet too large: %zu bytes, fd = %d",
+                kModule, __LINE__, DaemonName(args), peek.body_length,
+                static_cast<int>(bufferevent_getfd(bev)));
+    FinishConnection(bev);
+    return PacketOutcome::kClosed;
   }
-  if (CheckBufferevent(bev) != 1) return PacketOutcome::kWaiting;
+  if (peek.status == PeekStatus::kNeedMore) {
+    LogIncomplete(arrived, peek);
+    return PacketOutcome::kWaiting;
+  }
 
+  char body[kPacketBufferSize];
+  evbuffer_drain(input, kPacketHeaderSize);
+  evbuffer_remove(input, body, peek.body_length);
   Json::Value request(Json::objectValue);
   Json::Value reply(Json::objectValue);
-  RecvPacketEv(bev, request);
-  if (CallHandler(args, request, reply) != 0) {
+  ParseRequest(body, peek.body_length, request);
+  g_handler_connection = bev;
+  int result = CallHandler(args, request, reply);
+  g_handler_connection = nullptr;
+  if (result != 0) {
     FinishConnection(bev);
     return PacketOutcome::kClosed;
   }
@@ -144,12 +199,18 @@ PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
     // Answer anyway, so the client is not left waiting for ever.
     QueuePacket(bev, MakeResponse(false, "reply too large"), &too_large);
   }
+  if (quvaidx::EnforceOutputLimit(bev)) return PacketOutcome::kClosed;
   return PacketOutcome::kAnswered;
 }
 
 }  // namespace
 
 int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
+  return BuildServerWithAccess(base, path, args, nullptr);
+}
+
+int BuildServerWithAccess(struct event_base* base, const char* path,
+                          EventArgs* args, const ServerSocketAccess* access) {
   struct sockaddr_un address;
   if (!quvaidx::BuildUnixAddress(path, &address)) {
     AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
@@ -161,20 +222,23 @@ int BuildServer(struct event_base* base, const char* path, EventArgs* args) {
                 kModule, __LINE__, path);
     return -1;
   }
-  if (unlink(path) != 0 && errno != ENOENT) {
-    AppLogError(3, "%s:%d [Error] remove %s", kModule, __LINE__, path);
-    return -1;
-  }
+  int fd = quvaidx::BindServerSocket(path, address, access);
+  if (fd < 0) return -1;
 
   // Children a daemon starts must not inherit its sockets.
   const unsigned flags =
       LEV_OPT_CLOSE_ON_FREE | LEV_OPT_REUSEABLE | LEV_OPT_CLOSE_ON_EXEC;
-  g_listener = evconnlistener_new_bind(
-      base, OnAccept, args, flags, 16,
-      reinterpret_cast<struct sockaddr*>(&address), sizeof(address));
-  if (g_listener == nullptr) {
+  g_listener = evconnlistener_new(base, OnAccept, args, flags, 16, fd);
+  if (g_listener == nullptr || !quvaidx::StartDeadlines(base, args)) {
     AppLogError(3, "%s:%d [Error] Could not create a listener: %s", kModule,
                 __LINE__, path);
+    if (g_listener != nullptr) {
+      evconnlistener_free(g_listener);  // closes fd
+      g_listener = nullptr;
+    } else {
+      close(fd);
+    }
+    unlink(path);  // ours, made just now
     return -1;
   }
   evconnlistener_set_error_cb(g_listener, OnAcceptError);
@@ -188,6 +252,7 @@ int StopServer(const char* path) {
     event_free(g_accept_resume);
     g_accept_resume = nullptr;
   }
+  quvaidx::StopDeadlines();
   evconnlistener_free(g_listener);
   g_listener = nullptr;
   if (path != nullptr) unlink(path);  // don't care if this fails
@@ -203,23 +268,27 @@ Json::Value MakeResponse(bool success, const char* reason) {
   return response;
 }
 
-int CheckBufferevent(struct bufferevent* bev) {
-  struct evbuffer* input = bufferevent_get_input(bev);
-  size_t n = evbuffer_get_length(input);
-  if (n < kPacketHeaderSize) {
-    AppLogError(3, "%s:%d bufferevent at least %d bytes [%d bytes]", kModule,
-                __LINE__, static_cast<int>(kPacketHeaderSize),
-                static_cast<int>(n));
-    return 0;
+int GetPeerCredentials(PeerCredentials* peer) {
+  if (peer == nullptr || g_handler_connection == nullptr) return -1;
+  struct ucred credentials;
+  socklen_t length = sizeof(credentials);
+  if (getsockopt(static_cast<int>(bufferevent_getfd(g_handler_connection)),
+                 SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) {
+    return -1;
   }
-  unsigned char header[kPacketHeaderSize];
-  evbuffer_copyout(input, header, sizeof(header));
-  size_t total = quvaidx::DecodeBodyLength(header) + kPacketHeaderSize;
-  if (n >= total) return 1;
-  AppLogError(6,
-              "%s:%d bufferevent hasn't arrived completely, and wait "
-              "[arrived=%d, total=%d]",
-              kModule, __LINE__, static_cast<int>(n), static_cast<int>(total));
+  peer->pid = credentials.pid;
+  peer->uid = credentials.uid;
+  peer->gid = credentials.gid;
+  return 0;
+}
+
+int CheckBufferevent(struct bufferevent* bev) {
+  size_t arrived = 0;
+  PacketPeek peek = PeekInput(bufferevent_get_input(bev), &arrived);
+  // A whole packet is there once its bytes are, whatever the header
+  // announces; RecvPacketEv refuses one that is too large.
+  if (arrived >= kPacketHeaderSize && arrived >= peek.total) return 1;
+  LogIncomplete(arrived, peek);
   return 0;
 }
 
@@ -231,20 +300,20 @@ int RecvPacketEv(struct bufferevent* bev, Json::Value& value) {
                 static_cast<int>(got), static_cast<int>(sizeof(header)));
     return -1;
   }
-  size_t length = quvaidx::DecodeBodyLength(header);
-  if (length > kMaxRecvBody) {
+  PacketPeek peek = quvaidx::PeekPacket(header, sizeof(header));
+  if (peek.status == PeekStatus::kTooLarge) {
     AppLogError(3, "%s:%d [Error] packet too large: %zu bytes, limit %zu",
-                kModule, __LINE__, length, kMaxRecvBody);
+                kModule, __LINE__, peek.body_length, kMaxRecvBody);
     return -1;
   }
   char body[kPacketBufferSize];
-  got = bufferevent_read(bev, body, length);
-  if (got != length) {
+  got = bufferevent_read(bev, body, peek.body_length);
+  if (got != peek.body_length) {
     AppLogError(3, "%s:%d bufferevent_read, %d, %d", kModule, __LINE__,
-                static_cast<int>(got), static_cast<int>(length));
+                static_cast<int>(got), static_cast<int>(peek.body_length));
     return -1;
   }
-  quvaidx::ParsePacketBody(body, length, value);
+  ParseRequest(body, peek.body_length, value);
   return 0;
 }
 
@@ -265,6 +334,12 @@ void OnAccept(struct evconnlistener* listener, int fd, struct sockaddr*, int,
     close(fd);  // nobody else owns it
     return;
   }
+  if (!quvaidx::TrackConnection(bev, static_cast<EventArgs*>(args))) {
+    AppLogError(3, "%s:%d [Error] [%s] out of memory for fd = %d", kModule,
+                __LINE__, DaemonName(args), fd);
+    CloseConnection(bev);
+    return;
+  }
   bufferevent_setcb(bev, onRead, onWrite, onEvent, args);
   bufferevent_enable(bev, EV_READ);
 }
@@ -274,7 +349,19 @@ void OnAcceptError(struct evconnlistener* listener, void*) {
   struct event_base* base = evconnlistener_get_base(listener);
   if (IsOutOfDescriptors(err)) {
     // Any local user could otherwise stop the daemon by holding connections
-    // open: pause accepting and try again shortly.
+    // open: give up those that have waited longest for their peer, and
+    // accept again at once; with none to give up, pause and try again
+    // shortly.
+    int closed =
+        quvaidx::CloseLongestWaiting(kClosedPerAcceptFailure, kAcceptPauseMs);
+    if (closed > 0) {
+      AppLogError(3,
+                  "%s:%d [Error] accept: %d, %s; closed %d stalled "
+                  "connections",
+                  kModule, __LINE__, err, evutil_socket_error_to_string(err),
+                  closed);
+      return;
+    }
     AppLogError(3, "%s:%d [Error] accept: %d, %s; pausing for %d ms", kModule,
                 __LINE__, err, evutil_socket_error_to_string(err),
                 kAcceptPauseMs);
@@ -299,15 +386,24 @@ void onRead(struct bufferevent* bev, void* ptr) {
   struct evbuffer* output = bufferevent_get_output(bev);
   // Every complete request already buffered is answered now: libevent calls
   // again only when more bytes arrive, which may be never.
+  bool answered = false;
   do {
-    if (HandleOnePacket(bev, args) != PacketOutcome::kAnswered) return;
+    PacketOutcome outcome = HandleOnePacket(bev, args);
+    if (outcome == PacketOutcome::kClosed) return;
+    if (outcome == PacketOutcome::kWaiting) {
+      quvaidx::NoteWait(bev, Wait::kPacket, answered);
+      return;
+    }
+    answered = true;
     if (evbuffer_get_length(output) > kMaxPendingOutput) {
       // The peer is not reading its replies; stop reading its requests until
       // onWrite sees the output drained.
       bufferevent_disable(bev, EV_READ);
+      quvaidx::NoteWait(bev, Wait::kDrain, answered);
       return;
     }
   } while (evbuffer_get_length(input) > 0);
+  quvaidx::NoteWait(bev, Wait::kRequest, answered);
 }
 
 void onWrite(struct bufferevent* bev, void* args) {
@@ -315,7 +411,11 @@ void onWrite(struct bufferevent* bev, void* args) {
   // for backpressure, and answer what it had already sent.
   if ((bufferevent_get_enabled(bev) & EV_READ) != 0) return;
   bufferevent_enable(bev, EV_READ);
-  if (evbuffer_get_length(bufferevent_get_input(bev)) > 0) onRead(bev, args);
+  if (evbuffer_get_length(bufferevent_get_input(bev)) > 0) {
+    onRead(bev, args);
+  } else {
+    quvaidx::NoteWait(bev, Wait::kRequest, /*progress=*/true);
+  }
 }
 
 void onEvent(struct bufferevent* bev, short events, void* args) {
@@ -338,6 +438,12 @@ void onEvent(struct bufferevent* bev, short events, void* args) {
                 name, fd);
   } else {
     AppLogError(3, "%s:%d [%s] unknown: fd = %d", kModule, __LINE__, name, fd);
+  }
+  if ((events & BEV_EVENT_EOF) != 0) {
+    // The peer will send nothing more, but may still read: its replies go
+    // out before the close (libevent has stopped reading already).
+    FinishConnection(bev);
+    return;
   }
   CloseConnection(bev);
 }

@@ -3,9 +3,11 @@
 #include <errno.h>
 #include <string.h>
 #include <sys/socket.h>
+#include <sys/time.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include "ipc/connect_timeout.h"
 #include "ipc/packet_codec.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/log.h"
@@ -15,12 +17,48 @@ namespace {
 
 constexpr char kModule[] = "quvaidx_ipc_core";
 
+int g_connect_timeout_ms = kConnectTimeoutMs;
+
 // Closes a descriptor this module opened.
 void CloseSocket(int fd) {
   close(fd);  // nothing useful to do if this fails
 }
 
+// Connects fd, waiting at most g_connect_timeout_ms for a daemon whose
+// backlog is full. A Unix-domain connect never completes asynchronously: a
+// non-blocking one fails at once with EAGAIN on a full backlog, and there is
+// nothing to poll for. So the wait is bounded by the socket's send time-out,
+// which the kernel applies to connect and which wakes the caller as soon as
+// the daemon accepts; it is cleared again afterwards, because exchanges have
+// no time limit. Returns false when the connection was not made.
+bool ConnectWithinLimit(int fd, const struct sockaddr_un& address) {
+  struct timeval limit = {g_connect_timeout_ms / 1000,
+                          (g_connect_timeout_ms % 1000) * 1000};
+  if (setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof(limit)) != 0) {
+    return false;  // an unbounded wait is what this must prevent
+  }
+  bool connected =
+      connect(fd, reinterpret_cast<const struct sockaddr*>(&address),
+              sizeof(address)) == 0;
+  struct timeval none = {0, 0};
+  if (connected &&
+      setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &none, sizeof(none)) != 0) {
+    return false;  // sends would time out: not the connection promised
+  }
+  return connected;
+}
+
 }  // namespace
+
+namespace quvaidx {
+
+int SetConnectTimeoutMs(int ms) {
+  int previous = g_connect_timeout_ms;
+  g_connect_timeout_ms = ms > 0 ? ms : kConnectTimeoutMs;
+  return previous;
+}
+
+}  // namespace quvaidx
 
 int ConnectPeer(const char* path, bool handshake, int attempts) {
   struct sockaddr_un address;
@@ -39,8 +77,7 @@ int ConnectPeer(const char* path, bool handshake, int attempts) {
       quvaidx::SleepSeconds(1);
       continue;
     }
-    if (connect(fd, reinterpret_cast<struct sockaddr*>(&address),
-                sizeof(address)) != 0) {
+    if (!ConnectWithinLimit(fd, address)) {
       AppLogError(7, "%s:%d [Error] connect server: %d, %s", kModule, __LINE__,
                   i, path);
       CloseSocket(fd);

@@ -87,15 +87,17 @@ int RecvPacket(int fd, Json::Value& value) {
   unsigned char header[kPacketHeaderSize];
   int got = Readn(fd, header, sizeof(header));
   if (got != static_cast<int>(sizeof(header))) return PacketFailure(got);
-  size_t length = quvaidx::DecodeBodyLength(header);
-  if (length > kMaxRecvBody) {
+  quvaidx::PacketPeek peek = quvaidx::PeekPacket(header, sizeof(header));
+  if (peek.status == quvaidx::PeekStatus::kTooLarge) {
     AppLogError(3, "%s:%d [Error] packet too large: %zu bytes, limit %zu",
-                kModule, __LINE__, length, kMaxRecvBody);
+                kModule, __LINE__, peek.body_length, kMaxRecvBody);
     return -1;
   }
   char body[kPacketBufferSize];
-  got = Readn(fd, body, length);
-  if (got != static_cast<int>(length)) return PacketFailure(got);
-  quvaidx::ParsePacketBody(body, length, value);
+  got = Readn(fd, body, peek.body_length);
+  if (got != static_cast<int>(peek.body_length)) return PacketFailure(got);
+  // A reply the reader rejects is still received: the caller judges it by
+  // its keys (a missing "success" reads as false).
+  quvaidx::ParsePacketBody(body, peek.body_length, value);
   return 0;
 }

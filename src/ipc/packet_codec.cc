@@ -45,20 +45,28 @@ EncodeStatus EncodePacketOrLog(const Json::Value& value, char* packet,
   return status;
 }
 
-size_t DecodeBodyLength(const unsigned char* header) {
-  return (static_cast<size_t>(header[2]) << 8) | header[3];
+PacketPeek PeekPacket(const unsigned char* head, size_t available) {
+  if (available < kPacketHeaderSize) {
+    return {PeekStatus::kNeedMore, 0, kPacketHeaderSize};
+  }
+  size_t length = (static_cast<size_t>(head[2]) << 8) | head[3];
+  size_t total = kPacketHeaderSize + length;
+  if (length > kMaxRecvBody) return {PeekStatus::kTooLarge, length, total};
+  if (available < total) return {PeekStatus::kNeedMore, length, total};
+  return {PeekStatus::kComplete, length, total};
 }
 
-void ParsePacketBody(const char* body, size_t length, Json::Value& value) {
+bool ParsePacketBody(const char* body, size_t length, Json::Value& value) {
   thread_local Json::Reader reader;
   const void* zero = memchr(body, '\0', length);
   const char* end =
       zero != nullptr ? static_cast<const char*>(zero) : body + length;
   try {
-    reader.parse(body, end, value, true);
+    return reader.parse(body, end, value, true);
   } catch (...) {
     // Nesting beyond the reader's limit throws; such a body counts as
     // malformed, like any other.
+    return false;
   }
 }
 

@@ -28,15 +28,32 @@ EncodeStatus EncodePacket(const Json::Value& value, char* packet, size_t* size);
 EncodeStatus EncodePacketOrLog(const Json::Value& value, char* packet,
                                size_t* size, const char* module);
 
-// Returns the body length announced by a 4-byte header. The magic is not
-// examined.
-size_t DecodeBodyLength(const unsigned char* header);
+// What the head of a byte stream holds, as far as a receiver can tell.
+enum class PeekStatus {
+  kNeedMore,  // fewer than 4 bytes, or the announced body has not all come
+  kTooLarge,  // the header announces more than kMaxRecvBody bytes
+  kComplete,  // the header and the whole body are there
+};
+
+struct PacketPeek {
+  PeekStatus status;
+  size_t body_length;  // announced by the header; 0 before 4 bytes are there
+  size_t total;        // header and body; kPacketHeaderSize before that
+};
+
+// The one reading of a packet header, shared by the client and the server.
+// `head` holds the first min(available, kPacketHeaderSize) bytes of a stream
+// of which `available` bytes have arrived. The magic is not examined. The
+// body limit is checked here and nowhere else: kTooLarge as soon as the
+// header is there, whatever else has arrived.
+PacketPeek PeekPacket(const unsigned char* head, size_t available);
 
 // Parses body[0, length) up to its first zero byte into `value` with
-// Json::Reader, collecting comments. The parse result is not examined: on
-// malformed or too deeply nested input `value` holds what the parser left.
-// Never throws.
-void ParsePacketBody(const char* body, size_t length, Json::Value& value);
+// Json::Reader, collecting comments. Returns true when the reader accepted
+// it (trailing bytes after a complete value included); false when it
+// rejected it, and `value` then holds what the parser left, which may be a
+// half-read value. Never throws: input nested too deeply counts as rejected.
+bool ParsePacketBody(const char* body, size_t length, Json::Value& value);
 
 // Fills a zeroed Unix-domain address for `path`. Returns false, leaving
 // the address zeroed, when path is null or longer than kMaxSocketPath bytes:

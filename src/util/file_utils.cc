@@ -121,8 +121,16 @@ int RenameFile(const char* source, const char* destination) {
 
 int FileRemoveHeadingLine(const char* path, int n) {
   if (path == nullptr) return -1;
-  int in = open(path, O_RDONLY | O_CLOEXEC);
-  if (in < 0) return -1;
+  // The copy replaces whatever the path names: through a link, the link
+  // would become a copy of its target.
+  int in = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (in < 0) {
+    if (errno == ELOOP) {
+      AppLogError(3, "%s:%d [Error] %s is a symbolic link; not trimmed",
+                  kModule, __LINE__, path);
+    }
+    return -1;
+  }
   struct stat st;
   if (fstat(in, &st) != 0 || S_ISDIR(st.st_mode)) {
     close(in);

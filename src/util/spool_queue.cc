@@ -56,7 +56,9 @@ int WriteIndexQueue(const char* entry, const char* queue) {
   int fd = -1;
   for (int retries = 0;;) {
     if (QueueHoldsEntry(queue, entry, length)) return 0;
-    fd = open(queue, kQueueOpenFlags | O_CLOEXEC, 0777);
+    // O_NOFOLLOW: a link planted at the queue path is refused (ELOOP, in
+    // the line below), not written through.
+    fd = open(queue, kQueueOpenFlags | O_CLOEXEC | O_NOFOLLOW, 0777);
     if (fd >= 0) {
       if (flock(fd, LOCK_EX) != 0) {
         int err = errno;

@@ -1,5 +1,5 @@
-// The event server in-process: a real event base and real client sockets on
-// the same thread, the loop driven step by step.
+// The event server in-process: framing, handler results, the socket file,
+// running out of descriptors, slow and vanished clients.
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
@@ -8,11 +8,10 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
-#include <chrono>
-#include <functional>
-#include <map>
+#include <iterator>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -20,138 +19,20 @@
 #include <event2/event.h>
 #include <gtest/gtest.h>
 
+#include "daemon/server_fixture.h"
 #include "quvaidx/ipc.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
+#include "support/unprivileged.h"
 
 namespace {
 
-using quvaidx::test::FdLeakCheck;
+using quvaidx::test::Echo;
+using quvaidx::test::EventServerTest;
 using quvaidx::test::LogCapture;
-using quvaidx::test::TempDir;
-
-std::string Packet(const std::string& body) {
-  const size_t n = body.size();
-  return std::string("\x15\xbe", 2) + static_cast<char>(n >> 8) +
-         static_cast<char>(n & 0xff) + body;
-}
-
-std::string Request(const std::string& command) {
-  return Packet("{\"command\":\"" + command + "\"}\n");
-}
-
-class EventServerTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    base_ = event_base_new();
-    ASSERT_NE(base_, nullptr);
-    args_.name = "testd";
-    args_.context = this;
-    args_.handler = [](Json::Value& request, Json::Value& reply,
-                       EventArgs* args) {
-      auto* self = static_cast<EventServerTest*>(args->context);
-      self->requests_.push_back(request);
-      return self->handler_ ? self->handler_(request, reply) : 0;
-    };
-  }
-
-  void TearDown() override {
-    for (int fd : clients_) close(fd);
-    clients_.clear();
-    RunFor(5);  // let the server see the closes
-    EXPECT_EQ(GetCurrentConnCount(), 0);
-    StopServer(path_.c_str());
-    event_base_free(base_);
-    EXPECT_TRUE(leaks_.NoLeak());
-  }
-
-  void Start() { ASSERT_EQ(BuildServer(base_, path_.c_str(), &args_), 0); }
-
-  // Connects without running the loop, so nothing is accepted yet.
-  int RawConnect() {
-    clients_.push_back(ConnectPeer(path_.c_str(), false, 1));
-    return clients_.back();
-  }
-
-  int Connect() {
-    int fd = RawConnect();
-    RunFor(2);  // accept
-    return fd;
-  }
-
-  void Send(int fd, const std::string& bytes) {
-    ASSERT_EQ(write(fd, bytes.data(), bytes.size()),
-              static_cast<ssize_t>(bytes.size()));
-  }
-
-  // Runs the loop without blocking for about `ms` milliseconds.
-  void RunFor(int ms) {
-    auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
-    do {
-      event_base_loop(base_, EVLOOP_NONBLOCK);
-      usleep(200);
-    } while (std::chrono::steady_clock::now() < end);
-  }
-
-  // Runs the loop and collects what arrives on fd until `n` bytes are
-  // there, the peer closed, or `seconds` passed. Returns at most n bytes;
-  // the rest stays for the next call.
-  std::string Receive(int fd, size_t n, bool* closed = nullptr,
-                      int seconds = 1) {
-    std::string& pending = pending_[fd];
-    auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
-    while (pending.size() < n && std::chrono::steady_clock::now() < end) {
-      event_base_loop(base_, EVLOOP_NONBLOCK);
-      char buf[65536];
-      ssize_t got = recv(fd, buf, sizeof(buf), MSG_DONTWAIT);
-      if (got > 0) {
-        pending.append(buf, static_cast<size_t>(got));
-      } else if (got == 0) {
-        if (closed != nullptr) *closed = true;
-        break;
-      } else {
-        usleep(200);
-      }
-    }
-    std::string out = pending.substr(0, n);
-    pending.erase(0, out.size());
-    return out;
-  }
-
-  // Receives one reply packet and returns its body.
-  std::string ReceiveBody(int fd, int seconds = 1) {
-    std::string header = Receive(fd, 4, nullptr, seconds);
-    if (header.size() < 4) return "";
-    return Receive(fd, (static_cast<unsigned char>(header[2]) << 8) |
-                           static_cast<unsigned char>(header[3]));
-  }
-
-  // True when the server closed fd without sending anything more.
-  bool ClosedSilently(int fd) {
-    bool closed = false;
-    return Receive(fd, 1, &closed).empty() && closed;
-  }
-
-  FdLeakCheck leaks_;
-  TempDir dir_;
-  std::string path_ = dir_.File("testd.sock");
-  struct event_base* base_ = nullptr;
-  EventArgs args_{};
-  std::function<int(Json::Value&, Json::Value&)> handler_;
-  std::vector<Json::Value> requests_;
-  std::vector<int> clients_;
-  std::map<int, std::string> pending_;
-};
-
-int Succeed(Json::Value&, Json::Value& reply) {
-  reply = MakeResponse(true, nullptr);
-  return 0;
-}
-
-int Echo(Json::Value& request, Json::Value& reply) {
-  reply["echo"] = request["command"];
-  return request["command"] == "QUIT" ? -1 : 0;
-}
+using quvaidx::test::Packet;
+using quvaidx::test::Request;
+using quvaidx::test::Succeed;
 
 // A request in pieces reaches the handler once, after its last byte.
 TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPiecesAreJoined) {
@@ -192,6 +73,61 @@ TEST_F(EventServerTest, PipelinedRequestsAndRefusal) {
   EXPECT_EQ(ReceiveBody(other), "{\"echo\":\"STILL_HERE\"}\n");
 }
 
+// A body the JSON reader rejects must not run with half-read arguments: the
+// handler gets an empty object. Bodies that parse, trailing bytes included,
+// arrive as they are.
+TEST_F(EventServerTest, RejectedBodyReachesTheHandlerEmpty) {
+  handler_ = Succeed;
+  Start();
+  struct Case {
+    std::string body;
+    const char* request;  // as the handler saw it, compact
+  } cases[] = {
+      {"{\"command\":\"ECHO\",\"x\":1", "{}"},  // truncated
+      {"{\"command\":\"ECHO\",\"x\":", "{}"},
+      {"[\"ECHO\"", "{}"},
+      {"plain words", "{}"},
+      {std::string(5000, '['), "{}"},  // nested too deeply
+      {"", "{}"},
+      {"{\"command\":\"ECHO\"} and more", "{\"command\":\"ECHO\"}"},
+      {"{\"command\":\"ECHO\"}\n", "{\"command\":\"ECHO\"}"},
+      {"7", "7"},
+  };
+  int fd = Connect();
+  for (const Case& c : cases) Send(fd, Packet(c.body));
+  for (size_t i = 0; i < std::size(cases); ++i) {
+    EXPECT_EQ(ReceiveBody(fd), "{\"success\":true}\n");
+  }
+  ASSERT_EQ(requests_.size(), std::size(cases));
+  Json::FastWriter writer;
+  for (size_t i = 0; i < std::size(cases); ++i) {
+    EXPECT_EQ(writer.write(requests_[i]), std::string(cases[i].request) + "\n")
+        << cases[i].body.substr(0, 40);
+  }
+}
+
+// During a handler call the peer's credentials are known; outside, not.
+TEST_F(EventServerTest, HandlerLearnsWhoIsAsking) {
+  PeerCredentials seen = {-1, 0, 0};
+  int result = 1;
+  handler_ = [&](Json::Value&, Json::Value& reply) {
+    result = GetPeerCredentials(&seen);
+    reply["success"] = result == 0;
+    return 0;
+  };
+  Start();
+  int fd = Connect();
+  Send(fd, Request("WHO"));
+  EXPECT_EQ(ReceiveBody(fd), "{\"success\":true}\n");
+  EXPECT_EQ(result, 0);
+  EXPECT_EQ(seen.pid, getpid());
+  EXPECT_EQ(seen.uid, getuid());
+  EXPECT_EQ(seen.gid, getgid());
+  PeerCredentials untouched = {-7, 0, 0};
+  EXPECT_EQ(GetPeerCredentials(&untouched), -1);
+  EXPECT_EQ(untouched.pid, -7);
+}
+
 // A throwing handler is logged and its connection closed; a reply too large
 // is replaced; a request announcing too many bytes closes the connection.
 TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
@@ -222,10 +158,75 @@ TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
   EXPECT_EQ(log.lines().size(), 3u);
 }
 
+// A listening socket at `path` that never accepts: a live daemon.
+int Listen(const std::string& path) {
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  path.copy(address.sun_path, sizeof(address.sun_path) - 1);
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) !=
+          0 ||
+      listen(fd, 4) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// Only a stale socket is replaced. Anything else at the path stays as it
+// was: a regular file, a directory, a link, and above all a socket a daemon
+// still listens on, whose clients would otherwise be taken over.
+TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
+  int live = Listen(dir_.File("live.sock"));
+  ASSERT_GE(live, 0);
+  close(Listen(dir_.File("stale.sock")));  // its daemon died
+  close(open(dir_.File("file").c_str(), O_CREAT | O_WRONLY, 0600));
+  mkdir(dir_.File("dir").c_str(), 0700);
+  symlink(dir_.File("stale.sock").c_str(), dir_.File("link").c_str());
+  const std::string in_use = " is in use: a daemon listens there";
+  struct Case {
+    const char* name;
+    int result;
+    std::string line;  // after "quvaidx_daemon:N [Error] " and the path
+    mode_t type;       // what is at the path afterwards
+  } cases[] = {
+      {"absent.sock", 0, "", S_IFSOCK},    {"stale.sock", 0, "", S_IFSOCK},
+      {"live.sock", -1, in_use, S_IFSOCK}, {"file", -1, "remove", S_IFREG},
+      {"dir", -1, "remove", S_IFDIR},      {"link", -1, "remove", S_IFLNK},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    const std::string path = dir_.File(c.name);
+    struct stat before = {};
+    lstat(path.c_str(), &before);
+    LogCapture log;
+    EXPECT_EQ(BuildServer(base_, path.c_str(), &args_), c.result);
+    EXPECT_EQ(g_listener != nullptr, c.result == 0);
+    struct stat after = {};
+    ASSERT_EQ(lstat(path.c_str(), &after), 0);
+    EXPECT_EQ(after.st_mode & S_IFMT, c.type);
+    if (c.result == 0) {
+      EXPECT_TRUE(log.lines().empty());
+      int client = ConnectPeer(path.c_str(), false, 1);  // ours now
+      EXPECT_GE(client, 0);
+      close(client);
+      RunFor(5);
+      StopServer(path.c_str());
+      EXPECT_NE(access(path.c_str(), F_OK), 0);
+      continue;
+    }
+    EXPECT_EQ(after.st_ino, before.st_ino);
+    const std::string line =
+        c.line == in_use ? path + c.line : c.line + " " + path;
+    EXPECT_EQ(log.Normalized(),
+              std::vector<std::string>{"quvaidx_daemon:N [Error] " + line});
+  }
+  close(live);
+}
+
 // An overlong path is refused, not cut: the file at the cut path stays. A
-// stale file is replaced by the socket, which is removed on stop. A second
-// server is refused.
-TEST_F(EventServerTest, SocketFile) {
+// second server is refused.
+TEST_F(EventServerTest, OverlongPathAndSecondServer) {
   LogCapture log;
   std::string too_long = dir_.File(std::string(120, 'l'));
   std::string cut = too_long.substr(0, kMaxSocketPath);
@@ -236,15 +237,41 @@ TEST_F(EventServerTest, SocketFile) {
   ASSERT_EQ(stat(cut.c_str(), &st), 0);
   EXPECT_TRUE(S_ISREG(st.st_mode));
   EXPECT_EQ(log.lines().size(), 1u);
-  close(open(path_.c_str(), O_CREAT | O_WRONLY, 0600));
   Start();
-  ASSERT_EQ(stat(path_.c_str(), &st), 0);
-  EXPECT_TRUE(S_ISSOCK(st.st_mode));
   std::string other = dir_.File("other.sock");  // a second server
   EXPECT_EQ(BuildServer(base_, other.c_str(), &args_), -1);
   EXPECT_NE(access(other.c_str(), F_OK), 0);
+}
+
+// Without an access record the socket file follows the umask; with one it
+// gets the mode and group asked for, and is never created open to others.
+TEST_F(EventServerTest, SocketModeAndGroup) {
+  mode_t saved = umask(0);
+  Start();
+  struct stat st;
+  ASSERT_EQ(stat(path_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0777u);
   StopServer(path_.c_str());
-  EXPECT_NE(access(path_.c_str(), F_OK), 0);
+  gid_t group = getuid() == 0 ? 65534 : getgid();
+  ServerSocketAccess wanted = {0660, group};
+  ASSERT_EQ(BuildServerWithAccess(base_, path_.c_str(), &args_, &wanted), 0);
+  ASSERT_EQ(stat(path_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0660u);
+  EXPECT_EQ(st.st_gid, group);
+  StopServer(path_.c_str());
+  umask(saved);
+  // A group the process may not give: refused, and the socket goes again.
+  chmod(dir_.path().c_str(), 0777);
+  EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
+              struct event_base* base = event_base_new();
+              ServerSocketAccess root_group = {0660, 0};
+              int result = BuildServerWithAccess(base, path_.c_str(), &args_,
+                                                 &root_group);
+              bool gone = access(path_.c_str(), F_OK) != 0;
+              event_base_free(base);
+              return result == -1 && gone && g_listener == nullptr ? 0 : 1;
+            }),
+            0);
 }
 
 TEST_F(EventServerTest, AcceptErrorEndsTheLoop) {

@@ -2,12 +2,16 @@
 // lines, handshake, one-call exchanges, restarts, ownership of descriptors.
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
+#include "ipc/connect_timeout.h"
 #include "quvaidx/ipc.h"
 #include "support/fake_sleep.h"
 #include "support/fd_check.h"
@@ -70,6 +74,47 @@ TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
   LogCapture quiet;  // threshold 3
   EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
   EXPECT_EQ(quiet.Normalized(), std::vector<std::string>{line + path_});
+}
+
+// A daemon whose backlog stays full does not hold the client: each attempt
+// gives up after the connect limit and counts as failed, with its line.
+TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  path_.copy(address.sun_path, sizeof(address.sun_path) - 1);
+  int daemon = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  ASSERT_EQ(bind(daemon, reinterpret_cast<struct sockaddr*>(&address),
+                 sizeof(address)),
+            0);
+  ASSERT_EQ(listen(daemon, 0), 0);  // never accepts
+  std::vector<int> queued;
+  for (int i = 0; i < 8; ++i) {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (connect(fd, reinterpret_cast<struct sockaddr*>(&address),
+                sizeof(address)) != 0) {
+      close(fd);
+      break;
+    }
+    queued.push_back(fd);
+  }
+  int previous = quvaidx::SetConnectTimeoutMs(50);
+  LogCapture log(7);
+  auto start = std::chrono::steady_clock::now();
+  alarm(10);  // a connect that waits for ever would end the test here
+  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
+  alarm(0);
+  auto waited = std::chrono::steady_clock::now() - start;
+  quvaidx::SetConnectTimeoutMs(previous);
+  EXPECT_GE(waited, std::chrono::milliseconds(90));
+  EXPECT_LT(waited, std::chrono::seconds(2));
+  EXPECT_EQ(sleep_.calls(), 2);
+  const std::string line = "quvaidx_ipc_core:N [Error] connect server: ";
+  EXPECT_EQ(log.Normalized(),
+            (std::vector<std::string>{line + "0, " + path_,
+                                      line + "1, " + path_, line + path_}));
+  for (int fd : queued) close(fd);
+  close(daemon);
+  unlink(path_.c_str());
 }
 
 // A daemon listening at the first 107 bytes of an overlong path must not be

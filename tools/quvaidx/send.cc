@@ -7,8 +7,6 @@
 // after the last) so that it can say why a connection failed, and bounds
 // the wait for the reply with --timeout.
 #include <errno.h>
-#include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
 #include <stdio.h>
 #include <string.h>
@@ -33,8 +31,6 @@ namespace {
 constexpr char kName[] = "send";
 constexpr int kDefaultAttempts = 3;
 constexpr int kMaxAttempts = 3600;
-// A connect to a daemon whose backlog is full waits at most this long.
-constexpr int kConnectTimeoutMs = 5000;
 // Longest request read from standard input; a packet carries far less.
 constexpr size_t kMaxInput = 1 << 20;
 
@@ -155,40 +151,31 @@ bool ChooseSocket(const Options& o, std::string* path) {
   return CheckSocketPath(kName, *path);
 }
 
-// Connects to `path` once, waiting at most kConnectTimeoutMs. Returns the
-// descriptor, or -1 with errno set (ETIMEDOUT when the wait ran out).
+// Connects to `path` once, waiting at most kConnectTimeoutMs for a daemon
+// whose listen backlog is full. Returns the descriptor, or -1 with errno set
+// (ETIMEDOUT when the wait ran out). A Unix-domain connect cannot complete
+// later, so the wait is bounded by the socket's send time-out, as the
+// library's own attempts are.
 int ConnectOnce(const std::string& path) {
   struct sockaddr_un address;
   memset(&address, 0, sizeof(address));
   address.sun_family = AF_UNIX;
   memcpy(address.sun_path, path.data(), path.size());
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return -1;
+  struct timeval limit = {kConnectTimeoutMs / 1000,
+                          (kConnectTimeoutMs % 1000) * 1000};
+  setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof(limit));
   int result = connect(fd, reinterpret_cast<struct sockaddr*>(&address),
                        sizeof(address));
-  if (result != 0 && (errno == EAGAIN || errno == EINPROGRESS)) {
-    // A full backlog: wait until the daemon accepts, or give up.
-    struct pollfd wait = {fd, POLLOUT, 0};
-    int ready = poll(&wait, 1, kConnectTimeoutMs);
-    int error = 0;
-    socklen_t length = sizeof(error);
-    if (ready == 0) {
-      error = ETIMEDOUT;
-    } else if (ready < 0 ||
-               getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0) {
-      error = errno;
-    }
-    result = error == 0 ? 0 : -1;
-    errno = error;
-  }
   if (result != 0) {
-    int saved = errno;
+    int saved = errno == EAGAIN || errno == EINPROGRESS ? ETIMEDOUT : errno;
     close(fd);
     errno = saved;
     return -1;
   }
-  // The library's exchanges block.
-  fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) & ~O_NONBLOCK);
+  struct timeval none = {0, 0};  // the exchange itself has --timeout
+  setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &none, sizeof(none));
   return fd;
 }
 

@@ -1,25 +1,26 @@
 // quvaidx serve: a sample daemon on the library's event server.
 //
 // It answers HANDSHAKE, ECHO and STATS and refuses everything else, runs
-// until SIGINT or SIGTERM, and removes its socket when it stops. It refuses
-// to start on a path that holds anything but a stale socket, so it deletes
-// no other kind of file and never takes a socket away from a daemon that
-// still answers on it.
+// until SIGINT or SIGTERM, and removes its socket when it stops. Like every
+// daemon on the library's server it cannot start on a path that holds
+// anything but a stale socket (BuildServer refuses), so it deletes no other
+// kind of file and never takes a socket away from a daemon that still
+// answers on it.
 //
 // It goes through a daemon's whole life in the library's order: wait for
 // the system to boot; with a pid file, refuse a second instance and, if
 // asked, detach (before any event base exists, since detaching forks); the
 // event base and the server; on stop, the socket and the pid file go.
 #include <errno.h>
+#include <fcntl.h>
 #include <getopt.h>
 #include <limits.h>
 #include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <string.h>
-#include <sys/socket.h>
+#include <sys/file.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <string>
@@ -85,6 +86,8 @@ void PrintHelp() {
       "Options:\n"
       "  -s, --socket PATH   where to listen (at most %zu bytes); a stale\n"
       "                      socket there is replaced, any other file is not\n"
+      "                      (with --daemon, a refusal is told only to the\n"
+      "                      system log)\n"
       "  -p, --pidfile FILE  refuse to start while the process named in FILE\n"
       "                      is alive (printing \"Daemon alive. No need to\n"
       "                      start\"); else write this process's id into\n"
@@ -133,38 +136,31 @@ void OnStopSignal(evutil_socket_t signal_number, short, void* arg) {
   event_base_loopexit(stop->base, nullptr);
 }
 
-// True when something answers a connection on `path` right now.
-bool SomeoneListens(const std::string& path) {
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return false;
-  struct sockaddr_un address;
-  memset(&address, 0, sizeof(address));
-  address.sun_family = AF_UNIX;
-  memcpy(address.sun_path, path.data(), path.size());
-  bool connected = connect(fd, reinterpret_cast<struct sockaddr*>(&address),
-                           sizeof(address)) == 0;
-  close(fd);
-  return connected;
-}
-
-// Refuses paths whose file BuildServer would remove but must not: a file
-// that is not a socket, or a socket a live daemon still listens on.
-bool PathIsFree(const std::string& path) {
+// Explains why the server could not listen on `path`. BuildServer has
+// decided and logged why; this only puts it in the user's words.
+std::string ListenFailure(const std::string& path) {
   struct stat info;
   if (lstat(path.c_str(), &info) != 0) {
-    if (errno == ENOENT) return true;
-    PrintError(kName, "cannot examine " + path + ": " + strerror(errno));
-    return false;
+    return "cannot listen on " + path +
+           " (is its directory there and writable? --verbose shows the "
+           "library's report)";
   }
   if (!S_ISSOCK(info.st_mode)) {
-    PrintError(kName, path + " exists and is not a socket; not replacing it");
-    return false;
+    return path + " exists and is not a socket; not replacing it";
   }
-  if (SomeoneListens(path)) {
-    PrintError(kName, "a daemon is already listening on " + path);
-    return false;
-  }
-  return true;
+  // The library removes a socket nobody answers on: this one answered.
+  return "a daemon is already listening on " + path;
+}
+
+// True when another process holds the lock of `pid_file`, as a daemon that
+// is starting does before its pid is in the file.
+bool PidFileLocked(const std::string& pid_file) {
+  int fd =
+      open(pid_file.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) return false;
+  bool locked = flock(fd, LOCK_SH | LOCK_NB) != 0 && errno == EWOULDBLOCK;
+  close(fd);
+  return locked;
 }
 
 // Listens on `path` until a stop signal or an accept failure ends the loop.
@@ -184,9 +180,7 @@ int Serve(const std::string& path) {
       evsignal_add(sigint, nullptr) || evsignal_add(sigterm, nullptr)) {
     Fail("cannot watch for SIGINT and SIGTERM");
   } else if (BuildServer(base, path.c_str(), &args) != 0) {
-    Fail("cannot listen on " + path +
-         " (is its directory there and writable? --verbose shows the "
-         "library's report)");
+    Fail(ListenFailure(path));
   } else {
     if (!g_detached) {
       printf("quvaidx serve: listening on %s\n", path.c_str());
@@ -272,7 +266,8 @@ bool TakePidFile(const std::string& pid_file, bool detach) {
   // has ended with status 0 inside it.
   if (detach && result == 0) g_detached = true;
   if (result == 0) return true;
-  if (QLIBCProcAliveByPidFile(pid_file.c_str()) != 1) {
+  if (QLIBCProcAliveByPidFile(pid_file.c_str()) != 1 &&
+      !PidFileLocked(pid_file)) {
     Fail(std::string(detach ? "cannot detach or " : "cannot ") +
          "write the pid file " + pid_file +
          " (--verbose shows the library's report)");
@@ -334,9 +329,6 @@ int RunServe(int argc, char** argv) {
     return kExitError;
   }
   WaitForBoot();
-  // The socket is checked before detaching, so that its errors still reach
-  // the terminal.
-  if (!PathIsFree(path)) return kExitError;
   if (pid_file.empty()) return Serve(path);
   if (!TakePidFile(pid_file, detach)) return kExitError;
   int status = Serve(path);

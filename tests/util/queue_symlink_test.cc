@@ -1,0 +1,45 @@
+// A link planted at a queue's path: the writer and the trimmer refuse it,
+// and the file it points to stays as it was.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "quvaidx/system.h"
+#include "support/fd_check.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
+using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+
+TEST(QueueSymlinkTest, LinkAtTheQueuePathIsNotFollowed) {
+  TempDir dir;
+  const std::string target = dir.File("target");
+  const std::string queue = dir.File("q.queue");
+  WriteFile(target, "first\nsecond\n");
+  ASSERT_EQ(symlink(target.c_str(), queue.c_str()), 0);
+  LogCapture log;
+  EXPECT_EQ(WriteIndexQueue("/share/a", queue.c_str()), -1);
+  EXPECT_EQ(FileRemoveHeadingLine(queue.c_str(), 1), -1);
+  EXPECT_EQ(ReadFile(target), "first\nsecond\n");
+  struct stat st;
+  ASSERT_EQ(lstat(queue.c_str(), &st), 0);
+  EXPECT_TRUE(S_ISLNK(st.st_mode));
+  std::vector<std::string> lines = log.Normalized();
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_NE(lines[0].find("open(" + queue), std::string::npos) << lines[0];
+  EXPECT_NE(lines[0].find("reason=Too many levels of symbolic links"),
+            std::string::npos)
+      << lines[0];
+  EXPECT_EQ(lines[1], "quvaidx_system:N [Error] " + queue +
+                          " is a symbolic link; not trimmed");
+}
+
+}  // namespace
