@@ -126,23 +126,25 @@ void OnStopSignal(evutil_socket_t, short, void* base) {
   event_base_loopexit(static_cast<event_base*>(base), nullptr);
 }
 
-// Gives the socket file the mode and group asked for. False (logged) when
-// the system refuses.
-bool SetSocketAccess(const char* program, const Settings& settings) {
+// Listens on the socket, with the mode and group asked for (the socket is
+// never open to others meanwhile). Without either, the file-creation mask
+// decides, as for any daemon.
+int Listen(event_base* base, const Settings& settings, EventArgs* args) {
   const char* path = settings.socket.c_str();
-  if (settings.socket_group != static_cast<gid_t>(-1) &&
-      chown(path, static_cast<uid_t>(-1), settings.socket_group) != 0) {
-    syslog(LOG_ERR, "%s: cannot give %s group %u: %s", program, path,
-           static_cast<unsigned>(settings.socket_group), strerror(errno));
-    return false;
+  if (settings.socket_mode < 0 &&
+      settings.socket_group == static_cast<gid_t>(-1)) {
+    return BuildServer(base, path, args);
   }
-  if (settings.socket_mode >= 0 &&
-      chmod(path, static_cast<mode_t>(settings.socket_mode)) != 0) {
-    syslog(LOG_ERR, "%s: cannot give %s mode %o: %s", program, path,
-           settings.socket_mode, strerror(errno));
-    return false;
+  ServerSocketAccess access;
+  if (settings.socket_mode >= 0) {
+    access.mode = static_cast<mode_t>(settings.socket_mode);
+  } else {
+    mode_t mask = umask(0);  // read it: umask has no query of its own
+    umask(mask);
+    access.mode = 0777 & ~mask;
   }
-  return true;
+  access.group = settings.socket_group;
+  return BuildServerWithAccess(base, path, args, &access);
 }
 
 // Runs the event loop part of the daemon's life (steps 5 to 9 but the pid
@@ -159,30 +161,32 @@ int Serve(const DaemonSpec& spec, const Settings& settings) {
       evsignal_add(sigint, nullptr) != 0 ||
       evsignal_add(sigterm, nullptr) != 0) {
     syslog(LOG_ERR, "%s: cannot watch SIGINT and SIGTERM", spec.program);
-  } else if (!settings.socket.empty() &&
-             BuildServer(base, settings.socket.c_str(), &args) != 0) {
-    fprintf(stderr, "%s: cannot listen on %s\n", spec.program,
-            settings.socket.c_str());
-  } else if ((listening = !settings.socket.empty()) &&
-             !SetSocketAccess(spec.program, settings)) {
-    fprintf(stderr, "%s: cannot set the access of %s\n", spec.program,
-            settings.socket.c_str());
-  } else if (spec.start != nullptr &&
-             (status = spec.start(base, spec.context)) != 0) {
-    // The hook has said why.
-  } else {
-    if (settings.foreground) {
-      if (listening) {
-        printf("%s: listening on %s\n", spec.program, settings.socket.c_str());
-      } else {
-        printf("%s: running\n", spec.program);
-      }
-      fflush(stdout);
-    }
-    event_base_dispatch(base);
-    if (spec.stop != nullptr) spec.stop(spec.context);
-    status = 0;
+    goto done;
   }
+  if (!settings.socket.empty()) {
+    if (Listen(base, settings, &args) != 0) {
+      fprintf(stderr, "%s: cannot listen on %s (see the system log)\n",
+              spec.program, settings.socket.c_str());
+      goto done;
+    }
+    listening = true;
+  }
+  // A start hook that refuses has said why.
+  if (spec.start != nullptr && (status = spec.start(base, spec.context)) != 0) {
+    goto done;
+  }
+  if (settings.foreground) {
+    if (listening) {
+      printf("%s: listening on %s\n", spec.program, settings.socket.c_str());
+    } else {
+      printf("%s: running\n", spec.program);
+    }
+    fflush(stdout);
+  }
+  event_base_dispatch(base);
+  if (spec.stop != nullptr) spec.stop(spec.context);
+  status = 0;
+done:
   if (listening) StopServer(settings.socket.c_str());
   if (sigint != nullptr) event_free(sigint);
   if (sigterm != nullptr) event_free(sigterm);

@@ -13,7 +13,6 @@
 // event base and the server; on stop, the socket and the pid file go.
 #include <errno.h>
 #include <fcntl.h>
-#include <getopt.h>
 #include <limits.h>
 #include <signal.h>
 #include <stdint.h>
@@ -66,11 +65,15 @@ struct StopState {
   int signal_number;
 };
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx serve --socket PATH [--pidfile FILE [--daemon]] "
-      "[OPTIONS]\n"
-      "\n"
+struct Options {
+  std::string socket, pid_file;
+  bool detach = false;
+};
+
+quvaidx_tools::CommandLine MakeLine(Options* o) {
+  using namespace quvaidx_tools;
+  return Subcommand(
+      kName, {"--socket PATH [--pidfile FILE [--daemon]] [OPTIONS]"},
       "Runs a sample daemon on the Unix-domain socket PATH until SIGINT or\n"
       "SIGTERM, then removes the socket. Once it accepts connections it\n"
       "prints \"quvaidx serve: listening on PATH\". Like an index daemon it\n"
@@ -81,27 +84,26 @@ void PrintHelp() {
       "  ECHO       {\"success\": true, \"echo\": <the request>}\n"
       "  STATS      {\"success\": true, \"connections\": <open now>,\n"
       "              \"requests\": <received so far, this one included>}\n"
-      "  others     {\"success\": false, \"reason\": \"unknown command\"}\n"
-      "\n"
-      "Options:\n"
-      "  -s, --socket PATH   where to listen (at most %zu bytes); a stale\n"
-      "                      socket there is replaced, any other file is not\n"
-      "                      (with --daemon, a refusal is told only to the\n"
-      "                      system log)\n"
-      "  -p, --pidfile FILE  refuse to start while the process named in FILE\n"
-      "                      is alive (printing \"Daemon alive. No need to\n"
-      "                      start\"); else write this process's id into\n"
-      "                      FILE and remove FILE on exit\n"
-      "  -d, --daemon        with --pidfile: detach into the background\n"
-      "                      after the checks and print nothing more; wait\n"
-      "                      for FILE and the socket, stop it with\n"
-      "                      kill -TERM \"$(cat FILE)\"\n"
-      "  -v, --verbose       also show the library's log lines on stderr\n"
-      "  -h, --help          show this help\n"
-      "\n"
+      "  others     {\"success\": false, \"reason\": \"unknown command\"}\n",
+      {
+          Text("socket", 's', "PATH", &o->socket,
+               "where to listen (at most " + std::to_string(kMaxSocketPath) +
+                   " bytes); a stale\nsocket there is replaced, any other "
+                   "file is not\n(with --daemon, a refusal is told only to "
+                   "the\nsystem log)",
+               true),
+          Text("pidfile", 'p', "FILE", &o->pid_file,
+               "refuse to start while the process named in FILE\nis alive "
+               "(printing \"Daemon alive. No need to\nstart\"); else write "
+               "this process's id into\nFILE and remove FILE on exit"),
+          quvaidx_tools::Flag(
+              "daemon", 'd', &o->detach,
+              "with --pidfile: detach into the background\nafter the "
+              "checks and print nothing more; wait\nfor FILE and the "
+              "socket, stop it with\nkill -TERM \"$(cat FILE)\""),
+      },
       "Exit status: 0 after a stop signal (with --daemon: once detached), 2\n"
-      "when it cannot start or stops for another reason.\n",
-      kMaxSocketPath);
+      "when it cannot start or stops for another reason.\n");
 }
 
 int Handle(Json::Value& request, Json::Value& reply, EventArgs* args) {
@@ -278,45 +280,17 @@ bool TakePidFile(const std::string& pid_file, bool detach) {
 }  // namespace
 
 int RunServe(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"socket", required_argument, nullptr, 's'},
-      {"pidfile", required_argument, nullptr, 'p'},
-      {"daemon", no_argument, nullptr, 'd'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
-  std::string path, pid_file;
-  bool detach = false;
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":s:p:dvh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 's':
-        path = optarg;
-        break;
-      case 'p':
-        pid_file = optarg;
-        if (pid_file.empty()) return UsageError(kName, "--pidfile is empty");
-        break;
-      case 'd':
-        detach = true;
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
+  Options options;
+  int first = 0;
+  int status = ParseArguments(MakeLine(&options), argc, argv, &first);
+  if (status != kContinue) return status;
+  if (first < argc) {
+    return UsageError(kName,
+                      std::string("unexpected argument '") + argv[first] + "'");
   }
-  if (optind < argc) {
-    return UsageError(
-        kName, std::string("unexpected argument '") + argv[optind] + "'");
-  }
+  std::string& path = options.socket;
+  std::string& pid_file = options.pid_file;
+  bool detach = options.detach;
   if (detach && pid_file.empty()) {
     return UsageError(kName, "--daemon needs --pidfile FILE");
   }
@@ -331,7 +305,7 @@ int RunServe(int argc, char** argv) {
   WaitForBoot();
   if (pid_file.empty()) return Serve(path);
   if (!TakePidFile(pid_file, detach)) return kExitError;
-  int status = Serve(path);
+  status = Serve(path);
   DeletePidFile(pid_file.c_str());
   return status;
 }
