@@ -123,7 +123,8 @@ int FileRemoveHeadingLine(const char* path, int n) {
   if (path == nullptr) return -1;
   // The copy replaces whatever the path names: through a link, the link
   // would become a copy of its target.
-  int in = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  // O_NONBLOCK: opening a FIFO planted there must not wait for a writer.
+  int in = open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
   if (in < 0) {
     if (errno == ELOOP) {
       AppLogError(3, "%s:%d [Error] %s is a symbolic link; not trimmed",
@@ -132,7 +133,7 @@ int FileRemoveHeadingLine(const char* path, int n) {
     return -1;
   }
   struct stat st;
-  if (fstat(in, &st) != 0 || S_ISDIR(st.st_mode)) {
+  if (fstat(in, &st) != 0 || !S_ISREG(st.st_mode)) {
     close(in);
     return -1;
   }

@@ -1,5 +1,6 @@
-// A link planted at a queue's path: the writer and the trimmer refuse it,
-// and the file it points to stays as it was.
+// What may be planted at a queue's path: a link, which the writer and the
+// trimmer refuse, leaving the file it points to as it was; a FIFO or a
+// folder, which the trimmer refuses at once.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -40,6 +41,19 @@ TEST(QueueSymlinkTest, LinkAtTheQueuePathIsNotFollowed) {
       << lines[0];
   EXPECT_EQ(lines[1], "quvaidx_system:N [Error] " + queue +
                           " is a symbolic link; not trimmed");
+}
+
+// A FIFO or a folder at the queue path is no queue: trimming it fails at
+// once instead of waiting for a writer that never comes.
+TEST(QueueSymlinkTest, TrimRefusesWhatIsNoRegularFile) {
+  TempDir dir;
+  const std::string fifo = dir.File("fifo.queue");
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  ASSERT_EQ(mkdir(dir.File("dir.queue").c_str(), 0700), 0);
+  alarm(5);  // a trim that waits on the FIFO ends the test
+  EXPECT_EQ(FileRemoveHeadingLine(fifo.c_str(), 1), -1);
+  EXPECT_EQ(FileRemoveHeadingLine(dir.File("dir.queue").c_str(), 1), -1);
+  alarm(0);
 }
 
 }  // namespace
