@@ -8,6 +8,7 @@
 #include "quvaidx/lifecycle.h"
 #include "quvaidx/log.h"
 #include "quvaidx/system.h"
+#include "quvaidx/spool_consumer.h"
 #include "quvaidx/task_queue.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/mediainfo.h"

@@ -17,9 +17,9 @@ bool StillTheQueue(int fd, const char* path) {
          open_file.st_ino == at_path.st_ino;
 }
 
-int OpenLockedQueue(const char* path, int flags) {
+int OpenLockedQueue(const char* path, int flags, mode_t mode) {
   for (;;) {
-    int fd = open(path, flags | O_CLOEXEC | O_NONBLOCK);
+    int fd = open(path, flags | O_CLOEXEC | O_NONBLOCK, mode);
     if (fd < 0) return -1;
     struct stat st;
     if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
