@@ -55,14 +55,17 @@ bool Newer(const struct timespec& a, const struct timespec& b) {
 
 // True when the thumbnail `size` of `photo` exists (either name, 2 bytes or
 // more, as the library's EA-item functions count) and is newer than the
-// photo's modification time.
+// photo's modification time. When it exists, *ea_dir receives the folder it
+// is in: the photo's EA directory.
 bool UpToDate(const std::string& photo, const struct stat& photo_st,
-              const ThumbSize& size) {
+              const ThumbSize& size, std::string* ea_dir) {
   char item[PATH_MAX];
   if (GetEAFilePath(photo.c_str(), size.name, size.second_name, item,
                     sizeof(item)) != 0) {
     return false;
   }
+  const char* slash = strrchr(item, '/');
+  if (slash != nullptr) ea_dir->assign(item, static_cast<size_t>(slash - item));
   struct stat st;
   return stat(item, &st) == 0 && Newer(st.st_mtim, photo_st.st_mtim);
 }
@@ -300,12 +303,16 @@ PhotoResult MakePhotoThumbnails(const std::string& photo,
 
   int needed = 0;
   int target = 0;
+  std::string seen_ea_dir;
   for (const ThumbSize& size : kThumbSizes) {
-    if (UpToDate(photo, before, size)) continue;
+    if (UpToDate(photo, before, size, &seen_ea_dir)) continue;
     needed |= size.bit;
     target = std::max(target, size.long_side);
   }
   if (needed == 0) {
+    // A daemon killed while writing this photo may have left a temporary
+    // file although every thumbnail was in place.
+    RemoveLeftoverParts(seen_ea_dir.c_str());
     PhotoResult result;
     result.outcome = PhotoOutcome::kUpToDate;
     return result;

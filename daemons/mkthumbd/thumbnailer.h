@@ -26,9 +26,10 @@
 // made, and a photo with all four up to date is not decoded at all.
 //
 // Writes. Each thumbnail is written to "<item>.part-XXXXXX" beside its item
-// and renamed over it, so a reader never sees half a JPEG. A temporary file
-// left by a daemon killed in the middle is removed when that photo is next
-// made. The EA directory is made (MakeEADir) only when something is written.
+// and renamed over it, so a reader never sees half a JPEG. The EA directory
+// is made (MakeEADir) only when something is written.
+// Temporary files left by a daemon killed in the middle are removed when
+// that photo is next looked at.
 //
 // Bad photos. A photo that is gone, is not a regular file, cannot be read
 // by libvips (truncated or corrupt data counts: no half-grey thumbnails), or
