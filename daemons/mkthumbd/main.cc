@@ -8,13 +8,9 @@
 // SIGTERM or SIGINT ends it after the photo at hand, with that photo's
 // thumbnails complete and its entry still queued. At start it looks at the
 // queue once, for entries left from before.
-#include <errno.h>
-#include <limits.h>
 #include <signal.h>
 #include <stdio.h>
-#include <string.h>
 #include <sys/time.h>
-#include <unistd.h>
 
 #include <string>
 
@@ -39,20 +35,6 @@ struct Daemon {
   event* work = nullptr;  // the next step of the work
   bool working = false;   // `work` is scheduled
 };
-
-// Stores `value` as an absolute path: the daemon works from "/" once
-// detached. Returns "" or why the value is refused.
-std::string AbsolutePath(const char* value, std::string* out) {
-  if (*value == '\0') return "empty";
-  if (*value == '/') {
-    *out = value;
-    return "";
-  }
-  char cwd[PATH_MAX];
-  if (getcwd(cwd, sizeof(cwd)) == nullptr) return strerror(errno);
-  *out = std::string(cwd) + "/" + value;
-  return "";
-}
 
 void Schedule(Daemon* daemon, int delay_ms) {
   timeval delay = {delay_ms / 1000, (delay_ms % 1000) * 1000};
@@ -139,11 +121,9 @@ int main(int argc, char** argv) {
   spec.handler = nullptr;
   spec.context = &daemon;
   spec.options = {
-      quvaidx_tools::Custom(
-          "queue", 'q', "FILE",
-          [](const char* value) { return AbsolutePath(value, &daemon.queue); },
-          std::string("the queue to serve (default ") +
-              quvaidx_daemons::kThumbQueue + ")"),
+      quvaidx_daemons::PathOption("queue", 'q', "FILE", &daemon.queue,
+                                  std::string("the queue to serve (default ") +
+                                      quvaidx_daemons::kThumbQueue + ")"),
       quvaidx_tools::Number("throttle", 't', "MS", 0, 60000,
                             &daemon.throttle_ms,
                             "pause MS milliseconds after each photo, to\n"
