@@ -244,7 +244,7 @@ fi
 
 heading "Previews: the thumbnail daemon and the plug-in daemon at their fixed
 paths, in a private mount namespace (scripts/demo_previews.sh)"
-bash "$repo/scripts/demo_previews.sh" "${tool%/tools/quvaidx}" || true
+bash "$repo/scripts/demo_previews.sh" "${tool%/tools/quvaidx}"
 
 echo
 echo "Demo finished; removing $work."

@@ -1,10 +1,14 @@
 #!/usr/bin/env bash
 # Installs the Debian packages that building, testing, benchmarking and
-# fuzzing need, when any is missing. Needs root (or sudo) only to install.
+# fuzzing need, when any is missing. The thumbnail daemon builds on
+# libvips-dev; its tests make photos with libvips, zlib and exiftool, and
+# its benchmark runs vipsthumbnail (libvips-tools) and ImageMagick's convert. Needs root (or sudo) only to install.
 set -euo pipefail
 packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
           libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev
-          python3 strace time)
+          python3 strace time
+          libvips-dev zlib1g-dev
+          libvips-tools imagemagick libimage-exiftool-perl)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" \
