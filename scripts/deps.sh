@@ -2,7 +2,8 @@
 # Installs the Debian packages that building, testing, benchmarking and
 # fuzzing need, when any is missing. The thumbnail daemon builds on
 # libvips-dev; its tests make photos with libvips, zlib and exiftool, and
-# its benchmark runs vipsthumbnail (libvips-tools) and ImageMagick's convert. Needs root (or sudo) only to install.
+# its benchmark runs vipsthumbnail (libvips-tools) and ImageMagick's
+# convert. Needs root (or sudo) only to install.
 set -euo pipefail
 packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
           libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev
