@@ -185,6 +185,27 @@ TEST_F(ThumbDaemonTest, SigtermMidEntryEndsCleanlyAndKeepsTheEntry) {
   EXPECT_EQ(FindNames(share_, ".part-"), std::vector<std::string>{});
 }
 
+// A photo deleted after its folder was queued and listed: logged and
+// skipped, and the entry still completes (the pause after each photo holds
+// the daemon between the two photos while the second one goes).
+TEST_F(ThumbDaemonTest, PhotoDeletedWhileQueuedIsSkippedAndTheEntryCompletes) {
+  Photo("1.jpg");
+  const std::string doomed = Photo("2.jpg");
+  Photo("3.jpg");
+  ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
+  DaemonProcess daemon;
+  StartDaemon(daemon, {"--throttle", "300"});
+  ASSERT_TRUE(WaitUntil(20, [&] { return AllThumbs("1.jpg"); }));
+  ASSERT_EQ(unlink(doomed.c_str()), 0);
+  ASSERT_TRUE(WaitUntil(20, [&] { return ReadFile(queue_).empty(); }))
+      << daemon.Errors();
+  EXPECT_TRUE(AllThumbs("3.jpg"));
+  EXPECT_NE(daemon.Errors().find("skipped " + doomed + ": it is gone"),
+            std::string::npos)
+      << daemon.Errors();
+  EXPECT_TRUE(daemon.Running());
+}
+
 // WriteThumbQueue signals the daemon as soon as its pid file names a live
 // process, which is before the daemon watches SIGUSR1: a wake-up then must
 // not end it (SIGUSR1's default action).
