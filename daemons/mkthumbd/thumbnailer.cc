@@ -353,9 +353,15 @@ PhotoResult MakePhotoThumbnails(const std::string& photo,
       target = size.long_side;
     }
     if ((needed & size.bit) == 0) continue;
-    error = SaveJpeg(current.get(), std::string(ea_dir) + "/" + size.name);
-    if (!error.empty()) break;
-    result.made |= size.bit;
+    // One item that cannot be written (a folder in its place) does not keep
+    // the others from being made.
+    std::string problem =
+        SaveJpeg(current.get(), std::string(ea_dir) + "/" + size.name);
+    if (problem.empty()) {
+      result.made |= size.bit;
+    } else {
+      error = problem;
+    }
   }
   if (result.made == 0) return Skipped(error);
   result.outcome = PhotoOutcome::kMade;

@@ -224,6 +224,23 @@ TEST_F(ThumbnailerTest, BadPhotosAreSkippedWithAReason) {
   }
 }
 
+// An item that cannot be written (a folder stands in its place) is
+// reported, and the other sizes are still made.
+TEST_F(ThumbnailerTest, OneUnwritableItemDoesNotStopTheOthers) {
+  const std::string photo = Photo("p.jpg");
+  ASSERT_TRUE(
+      quvaidx::daemon_test::WriteSplitJpeg(photo, 800, 600, kRed, kBlue));
+  ASSERT_EQ(mkdir(dir_.File(".quvameta").c_str(), 0755), 0);
+  ASSERT_EQ(mkdir(dir_.File(".quvameta/p.jpg").c_str(), 0755), 0);
+  ASSERT_EQ(mkdir(Thumb("p.jpg", "B").c_str(), 0755), 0);
+  PhotoResult result = MakePhotoThumbnails(photo);
+  EXPECT_EQ(result.outcome, PhotoOutcome::kMade);
+  EXPECT_EQ(result.made, 0x8 | 0x2 | 0x1);
+  EXPECT_NE(result.reason.find("QUVAPHOTO_THUMB_B.jpg"), std::string::npos)
+      << result.reason;
+  EXPECT_EQ(ReadImage(Thumb("p.jpg", "S")).width, 120);
+}
+
 // A temporary file left by a daemon killed while writing goes when that
 // photo is made again; files of others stay.
 TEST_F(ThumbnailerTest, LeftoverTemporaryFilesAreRemoved) {
