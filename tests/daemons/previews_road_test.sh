@@ -32,10 +32,12 @@ if [ "${1:-}" != --inside ]; then
     exit 77
   fi
   namespace=()
-  if [ "$(id -u)" -eq 0 ] && unshare --mount --propagation private true \
-      2>/dev/null; then
+  # A namespace counts only if a tmpfs can be mounted in it.
+  probe='mount -t tmpfs probe /var/spool'
+  if [ "$(id -u)" -eq 0 ] && unshare --mount --propagation private \
+      sh -c "$probe" 2>/dev/null; then
     namespace=(unshare --mount --propagation private)
-  elif unshare -Urm true 2>/dev/null; then
+  elif unshare -Urm sh -c "$probe" 2>/dev/null; then
     namespace=(unshare -Urm)
   else
     echo "SKIP: cannot make a private mount namespace (needs root, or" \
