@@ -14,13 +14,8 @@
 //   - the file keeps its mode, and no temporary file is left beside it.
 // A mismatch aborts with a message.
 //
-// The function renames a temporary file over the path, so the file needs a
-// real name in a directory of its own: one private directory per process
-// under $TMPDIR (or /tmp), made with mkdtemp and removed with its file at
-// exit. A crashed run leaves that directory (one small file) behind.
-#include <dirent.h>
-#include <errno.h>
-#include <fcntl.h>
+// The function renames a temporary file over the path, so the file lives in
+// a private directory of its own (fuzz_scratch_dir.h).
 #include <stddef.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -31,6 +26,7 @@
 #include <string>
 #include <string_view>
 
+#include "fuzz_scratch_dir.h"
 #include "quvaidx/system.h"
 
 namespace {
@@ -40,88 +36,8 @@ constexpr int kMinCount = -2;
 constexpr int kMaxCount = 60000;
 constexpr mode_t kMode = 0640;
 
-[[noreturn]] void Die(const char* what) {
-  perror(what);
-  abort();
-}
-
-// The private directory and the file in it.
-class Scratch {
- public:
-  static Scratch& Get() {
-    // Never destroyed: Remove runs at exit and still needs the object.
-    static Scratch* scratch = new Scratch();
-    return *scratch;
-  }
-
-  const std::string& dir() const { return dir_; }
-  const std::string& file() const { return file_; }
-
-  // Makes the file hold data[0, size) with mode kMode.
-  void Write(const char* data, size_t size) {
-    int fd =
-        open(file_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kMode);
-    if (fd < 0) Die("open");
-    if (fchmod(fd, kMode) != 0) Die("fchmod");  // the umask may have cut it
-    size_t done = 0;
-    while (done < size) {
-      ssize_t n = write(fd, data + done, size - done);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) Die("write");
-      done += static_cast<size_t>(n);
-    }
-    if (close(fd) != 0) Die("close");
-  }
-
-  std::string Read() const {
-    int fd = open(file_.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) Die("open for reading");
-    std::string text;
-    char block[16384];
-    for (;;) {
-      ssize_t n = read(fd, block, sizeof(block));
-      if (n < 0 && errno == EINTR) continue;
-      if (n < 0) Die("read");
-      if (n == 0) break;
-      text.append(block, static_cast<size_t>(n));
-    }
-    close(fd);
-    return text;
-  }
-
-  // The names in the directory other than the file's own.
-  std::string Strays() const {
-    std::string strays;
-    DIR* dir = opendir(dir_.c_str());
-    if (dir == nullptr) Die("opendir");
-    while (struct dirent* entry = readdir(dir)) {
-      std::string name = entry->d_name;
-      if (name == "." || name == ".." || name == "queue") continue;
-      strays += name + " ";
-    }
-    closedir(dir);
-    return strays;
-  }
-
- private:
-  Scratch() {
-    const char* tmp = getenv("TMPDIR");
-    if (tmp == nullptr || tmp[0] == '\0') tmp = "/tmp";
-    dir_ = std::string(tmp) + "/quvaidx-fuzz-trim.XXXXXX";
-    if (mkdtemp(&dir_[0]) == nullptr) Die("mkdtemp");
-    file_ = dir_ + "/queue";
-    atexit(Remove);
-  }
-
-  static void Remove() {
-    Scratch& scratch = Get();
-    unlink(scratch.file_.c_str());  // may be missing; don't care
-    rmdir(scratch.dir_.c_str());
-  }
-
-  std::string dir_;
-  std::string file_;
-};
+using fuzz_scratch::Die;
+using Scratch = fuzz_scratch::ScratchDir;
 
 [[noreturn]] void Fail(const char* what, int n, std::string_view text) {
   fprintf(stderr, "fuzz_trim: %s; n %d, file (%zu bytes): \"", what, n,
@@ -172,8 +88,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   std::string file = Filler(kFillerUnit * (data[2] % kFillerUnits));
   file.append(reinterpret_cast<const char*>(data) + 3, size - 3);
   const std::string_view text(file);
-  Scratch& scratch = Scratch::Get();
-  scratch.Write(text.data(), text.size());
+  Scratch& scratch = Scratch::Get("fuzz-trim");
+  scratch.Write(text.data(), text.size(), kMode);
 
   if (FileRemoveHeadingLine(scratch.file().c_str(), n) != 0) {
     Fail("FileRemoveHeadingLine failed", n, text);

@@ -18,7 +18,8 @@
 #   BENCH_NO_STRACE=1  skip the system-call counts
 #
 # Every step runs under `timeout`; with the defaults the whole script takes
-# about three minutes on two cores. Sockets live under /tmp and are removed;
+# about four minutes on two cores (the preview benchmarks about one of
+# them). Sockets live under /tmp and are removed;
 # so are the task-queue benchmark's key file and message queues, also when it
 # is interrupted. The spool benchmark writes its queues (up to 5.5 MB each)
 # under /tmp and under the working directory, and removes them.
@@ -65,6 +66,21 @@ for b in quvaidx_framing_bench quvaidx_task_queue_bench \
   echo "######## $b"
   timeout 600 "${pin[@]}" "$bin/$b" "${args[@]}" || { echo "$b failed ($?)"; status=1; }
 done
+
+# The preview daemons (built with the daemons): thumbnails against
+# vipsthumbnail and ImageMagick, size maps against a handshake, and the
+# thumbnail daemon's peak memory over a queue of photos.
+if [ -x "$bin/quvaidx_previews_bench" ]; then
+  echo
+  echo "######## quvaidx_previews_bench"
+  timeout 900 "${pin[@]}" "$bin/quvaidx_previews_bench" \
+    --plugind "$build/daemons/plugind/quvaindexplugind" "${args[@]}" ||
+    { echo "quvaidx_previews_bench failed ($?)"; status=1; }
+  echo
+  echo "######## thumbnail daemon memory (bench/thumb_rss.sh)"
+  timeout 900 "${pin[@]}" bash "$(dirname "$0")/../bench/thumb_rss.sh" \
+    "$build" || status=1
+fi
 
 if [ "${BENCH_NO_STRACE:-0}" = 1 ]; then exit $status; fi
 if ! command -v strace >/dev/null 2>&1; then

@@ -10,7 +10,8 @@
 # through create, push, count, pop and delete (`quvaidx taskq`), and scans
 # a sample share with the index's rules (`quvaidx scan`), and asks the
 # example media-parser daemon about sample files (`quvaidx mediainfo`,
-# `quvaidx resolution`). Everything
+# `quvaidx resolution`), and shows the road of previews
+# (scripts/demo_previews.sh). Everything
 # it starts or creates is removed on exit, however the script ends, so it
 # can be run again at once.
 set -euo pipefail
@@ -240,6 +241,10 @@ else
   fi
   echo "The socket and the pid file are gone."
 fi
+
+heading "Previews: the thumbnail daemon and the plug-in daemon at their fixed
+paths, in a private mount namespace (scripts/demo_previews.sh)"
+bash "$repo/scripts/demo_previews.sh" "${tool%/tools/quvaidx}"
 
 echo
 echo "Demo finished; removing $work."

@@ -16,11 +16,15 @@
 # apt-get line to run.
 set -euo pipefail
 
+# The thumbnail daemon builds on libvips; the tests and the demo make
+# photos with the vips command, the tests also with zlib and exiftool; the
+# thumbnail benchmark runs vipsthumbnail and ImageMagick's convert.
 build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
-       help2man)
-demo=(python3)
-test=(libgtest-dev libgmock-dev python3 man-db systemd clang-format)
-bench=(libbenchmark-dev strace time)
+       help2man libvips-dev)
+demo=(python3 libvips-tools)
+test=(libgtest-dev libgmock-dev python3 man-db systemd clang-format
+      libvips-tools zlib1g-dev libimage-exiftool-perl)
+bench=(libbenchmark-dev strace time libvips-tools imagemagick)
 fuzz=(clang libclang-rt-14-dev)
 
 [ $# -ge 1 ] || set -- build

@@ -12,6 +12,8 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <utility>
+
 #include <event2/event.h>
 #include <quvaidx/ipc.h>
 #include <quvaidx/lifecycle.h>
@@ -195,6 +197,21 @@ done:
 }
 
 }  // namespace
+
+quvaidx_tools::Option PathOption(const char* name, char letter,
+                                 const char* value_name, std::string* out,
+                                 std::string help) {
+  return quvaidx_tools::Custom(
+      name, letter, value_name,
+      [out](const char* value) {
+        std::string path = value;
+        if (path.empty()) return std::string("empty");
+        if (!MakeAbsolute(&path)) return std::string(strerror(errno));
+        *out = path;
+        return std::string();
+      },
+      std::move(help));
+}
 
 std::string VersionLine(const char* program) {
   return std::string(program) + " " + QuvaidxVersion();

@@ -61,6 +61,12 @@ struct DaemonSpec {
 // usage error; after --help or --version, 0.
 int RunDaemon(const DaemonSpec& spec, int argc, char** argv);
 
+// A daemon option whose value is a path: stored in *out made absolute (from
+// the working directory at parsing), since a detached daemon works from "/".
+quvaidx_tools::Option PathOption(const char* name, char letter,
+                                 const char* value_name, std::string* out,
+                                 std::string help);
+
 // "PROGRAM VERSION" for --version: the library's version.
 std::string VersionLine(const char* program);
 

@@ -16,6 +16,7 @@
 #include "quvaidx/paths.h"
 #include "quvaidx/share_folder.h"
 #include "quvaidx/system.h"
+#include "quvaidx/spool_consumer.h"
 #include "quvaidx/task_queue.h"
 #include "quvaidx/text.h"
 #include "quvaidx/version.h"

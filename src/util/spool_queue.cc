@@ -11,6 +11,7 @@
 #include "quvaidx/system.h"
 #include "util/hooks.h"
 #include "util/log_internal.h"
+#include "util/queue_file.h"
 
 namespace {
 
@@ -24,16 +25,6 @@ bool QueueHoldsEntry(const char* queue, const char* entry, size_t length) {
   char line[kLineBufferSize];
   return QLIBCFileGetLine(queue, entry, line, sizeof(line), 0x404) > 0 &&
          strlen(line) == length;
-}
-
-// True when `fd` is still the file at `path`: a consumer may have replaced
-// the queue (trimmed it) while we waited for the lock.
-bool StillTheQueue(int fd, const char* path) {
-  struct stat open_file;
-  struct stat at_path;
-  return fstat(fd, &open_file) == 0 && stat(path, &at_path) == 0 &&
-         open_file.st_dev == at_path.st_dev &&
-         open_file.st_ino == at_path.st_ino;
 }
 
 }  // namespace
@@ -70,7 +61,7 @@ int WriteIndexQueue(const char* entry, const char* queue) {
         close(fd);
         return -1;
       }
-      if (StillTheQueue(fd, queue)) break;
+      if (quvaidx::StillTheQueue(fd, queue)) break;
       close(fd);  // replaced meanwhile: open the new one
       continue;
     }

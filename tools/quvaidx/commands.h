@@ -10,6 +10,8 @@ int RunDaemons(int argc, char** argv);
 int RunMediaInfo(int argc, char** argv);
 int RunResolution(int argc, char** argv);
 int RunSend(int argc, char** argv);
+int RunSizeMap(int argc, char** argv);
+int RunPlugins(int argc, char** argv);
 int RunScan(int argc, char** argv);
 int RunServe(int argc, char** argv);
 int RunSpool(int argc, char** argv);

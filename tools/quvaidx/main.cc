@@ -31,6 +31,10 @@ constexpr Command kCommands[] = {
      RunMediaInfo},
     {"resolution", "ask the media parser for a file's pixel size",
      RunResolution},
+    {"sizemap", "ask the plug-in daemon which thumbnails paths have",
+     RunSizeMap},
+    {"plugins", "ask the plug-in daemon which preview plug-ins run",
+     RunPlugins},
     {"help", "show the help of a command", RunHelp},
 };
 

@@ -1,17 +1,15 @@
 // quvaidx spool: adding entries to a spool queue and trimming its head.
 //
 // `add` goes through WriteIndexQueue, so an entry already queued is not
-// queued twice. `trim` does what a queue's consumer does: it takes the
-// queue's exclusive flock, removes the head with FileRemoveHeadingLine and
-// lets go. Every entry is checked before the first is written, so a bad one
-// leaves the queue as it was.
+// queued twice. `trim` goes through TrimQueueHead, the library's consumer
+// side: it takes the queue's exclusive flock, removes the head with
+// FileRemoveHeadingLine and lets go. Every entry is checked before the first is
+// written, so a bad one leaves the queue as it was.
 #include <errno.h>
-#include <fcntl.h>
 #include <getopt.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -19,6 +17,7 @@
 
 #include "cli.h"
 #include "commands.h"
+#include "quvaidx/spool_consumer.h"
 #include "quvaidx/system.h"
 
 namespace quvaidx_cli {
@@ -130,16 +129,6 @@ int Add(int count, char** args) {
   return kExitOk;
 }
 
-// True when `fd` is still the file at `path`: another consumer may have
-// replaced the queue (trimmed it) while this one waited for the lock.
-bool StillTheQueue(int fd, const char* path) {
-  struct stat open_file;
-  struct stat at_path;
-  return fstat(fd, &open_file) == 0 && stat(path, &at_path) == 0 &&
-         open_file.st_dev == at_path.st_dev &&
-         open_file.st_ino == at_path.st_ino;
-}
-
 int Trim(int count, char** args) {
   if (count < 2) return UsageError(kName, "trim needs QUEUE and N");
   if (count > 2) {
@@ -154,37 +143,18 @@ int Trim(int count, char** args) {
                                  std::to_string(INT_MAX) + ", not '" + args[1] +
                                  "'");
   }
-  int fd = -1;
-  for (;;) {
-    fd = open(queue, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-      PrintError(kName, std::string(queue) + ": " + strerror(errno));
-      return kExitError;
-    }
-    struct stat st;
-    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
-      close(fd);
-      PrintError(kName, std::string(queue) + " is not a regular file");
-      return kExitError;
-    }
-    int locked;
-    while ((locked = flock(fd, LOCK_EX)) != 0 && errno == EINTR) {
-    }
-    if (locked != 0) {
-      int err = errno;
-      close(fd);
-      PrintError(kName,
-                 std::string("cannot lock ") + queue + ": " + strerror(err));
-      return kExitError;
-    }
-    // Trimming a replaced file would throw away the other consumer's
-    // result: lock the file that is at the path now.
-    if (StillTheQueue(fd, queue)) break;
-    close(fd);
+  struct stat st;
+  if (stat(queue, &st) != 0) {
+    PrintError(kName, std::string(queue) + ": " + strerror(errno));
+    return kExitError;
   }
-  int result = FileRemoveHeadingLine(queue, lines);
-  flock(fd, LOCK_UN);
-  close(fd);
+  if (!S_ISREG(st.st_mode)) {
+    PrintError(kName, std::string(queue) + " is not a regular file");
+    return kExitError;
+  }
+  // Under the queue's lock, following a queue another consumer replaced
+  // while this one waited.
+  int result = TrimQueueHead(queue, lines);
   if (result != 0) {
     PrintError(kName, std::string("cannot trim ") + queue +
                           ": the queue is unchanged, or a temporary file "

@@ -1,0 +1,49 @@
+// A reference daemon run as a real process by a test: started in the
+// foreground with its output in files, watched, signalled, waited for. The
+// destructor kills it (SIGKILL) when the test has not ended it.
+#ifndef QUVAIDX_TESTS_DAEMONS_DAEMON_PROCESS_H_
+#define QUVAIDX_TESTS_DAEMONS_DAEMON_PROCESS_H_
+
+#include <sys/types.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+namespace quvaidx::daemon_test {
+
+class DaemonProcess {
+ public:
+  // Starts `program` with `args`; its standard output and error go to
+  // `output_dir`/<name>.out and .err, and the host stand-in reads its files
+  // from `output_dir` (QUVA_HOST_ETC). False when it could not be started.
+  bool Start(const std::string& program, const std::vector<std::string>& args,
+             const std::string& output_dir, const std::string& name);
+  ~DaemonProcess();
+
+  pid_t pid() const { return pid_; }
+  // Standard output and error so far.
+  std::string Output() const;
+  std::string Errors() const;
+
+  // Sends `signal`; false when the process is gone.
+  bool Signal(int signal);
+  // Waits until the process has ended, at most `seconds`; stores its wait
+  // status. False on time-out.
+  bool WaitExit(double seconds, int* status);
+  // True when the process has not ended.
+  bool Running();
+
+ private:
+  pid_t pid_ = -1;
+  std::string out_;
+  std::string err_;
+};
+
+// Calls `done` every 10 ms until it is true or `seconds` have passed;
+// returns its last result.
+bool WaitUntil(double seconds, const std::function<bool()>& done);
+
+}  // namespace quvaidx::daemon_test
+
+#endif  // QUVAIDX_TESTS_DAEMONS_DAEMON_PROCESS_H_
