@@ -6,7 +6,6 @@
 // FileRemoveHeadingLine and lets go. Every entry is checked before the first is
 // written, so a bad one leaves the queue as it was.
 #include <errno.h>
-#include <getopt.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
@@ -25,26 +24,23 @@ namespace {
 
 constexpr char kName[] = "spool";
 
-void PrintHelp() {
-  printf(
-      "Usage: quvaidx spool add  QUEUE ENTRY...\n"
-      "       quvaidx spool trim QUEUE N\n"
-      "\n"
+quvaidx_tools::CommandLine MakeLine() {
+  return Subcommand(
+      kName, {"add  QUEUE ENTRY...", "trim QUEUE N"},
       "Works on a spool queue: a text file of one entry per line, appended\n"
       "under an exclusive flock and consumed from its head.\n"
       "\n"
       "  add   appends each ENTRY as one line, unless a line equal to it is\n"
       "        already there; QUEUE is created when missing. An entry must\n"
-      "        not be empty, hold a line feed or exceed %d bytes; when one\n"
-      "        does, nothing is added.\n"
-      "  trim  removes the first N lines (all of them when N is beyond the\n"
-      "        end) while holding the queue's exclusive flock, as a consumer\n"
-      "        does; waits for the lock as long as another process holds it\n"
-      "\n"
-      "Options:\n"
-      "  -v, --verbose  also show the library's log lines on stderr\n"
-      "  -h, --help     show this help\n"
-      "\n"
+      "        not be empty, hold a line feed or exceed " +
+          std::to_string(kMaxQueueEntry) +
+          " bytes; when one\n"
+          "        does, nothing is added.\n"
+          "  trim  removes the first N lines (all of them when N is beyond "
+          "the\n        end) while holding the queue's exclusive flock, as a "
+          "consumer\n        does; waits for the lock as long as another "
+          "process holds it\n",
+      {},
       "An ENTRY that starts with '-' goes after \"--\".\n"
       "\n"
       "Exit status: 0 on success, 2 on a usage error, a refused entry or a\n"
@@ -52,8 +48,7 @@ void PrintHelp() {
       "\n"
       "Example:\n"
       "  quvaidx spool add /tmp/q.queue /share/Photos/2015 /share/Photos/2016\n"
-      "  quvaidx spool trim /tmp/q.queue 1\n",
-      kMaxQueueEntry);
+      "  quvaidx spool trim /tmp/q.queue 1\n");
 }
 
 // Why `entry` cannot be queued, or "" when it can.
@@ -167,29 +162,11 @@ int Trim(int count, char** args) {
 }  // namespace
 
 int RunSpool(int argc, char** argv) {
-  static const struct option kOptions[] = {
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
-  optind = 0;
-  opterr = 0;
-  int c;
-  // An entry that starts with '-' follows "--".
-  while ((c = getopt_long(argc, argv, ":vh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp();
-        return kExitOk;
-      default:
-        return OptionError(kName, c, argv);
-    }
-  }
-  int count = argc - optind;
-  char** args = argv + optind;
+  int first = 0;
+  int status = ParseArguments(MakeLine(), argc, argv, &first);
+  if (status != kContinue) return status;
+  int count = argc - first;
+  char** args = argv + first;
   if (count < 1) return UsageError(kName, "missing the operation: add or trim");
   std::string op = args[0];
   if (op == "add") return Add(count - 1, args + 1);
