@@ -23,6 +23,7 @@
 #include <string_view>
 
 #include "fuzz_host_scratch_file.h"
+#include "fuzz_report.h"
 #include "quvahost/quvahost.h"
 
 namespace {
@@ -30,17 +31,7 @@ namespace {
 constexpr size_t kMaxInput = 64 * 1024;
 
 [[noreturn]] void Fail(const char* what, std::string_view input) {
-  fprintf(stderr, "fuzz_host_pid_file: %s; file (%zu bytes): \"", what,
-          input.size());
-  for (unsigned char c : input.substr(0, 200)) {
-    if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
-      fputc(c, stderr);
-    } else {
-      fprintf(stderr, "\\x%02x", c);
-    }
-  }
-  fprintf(stderr, "%s\"\n", input.size() > 200 ? "..." : "");
-  abort();
+  FuzzFail("fuzz_host_pid_file", what, input);
 }
 
 bool IsBlankOrLineEnd(char c) {

@@ -28,24 +28,15 @@
 #include <string_view>
 #include <vector>
 
+#include "fuzz_report.h"
 #include "util/proc_parse.h"
 
 namespace {
 
 constexpr size_t kReadLimit = 4096;
 
-[[noreturn]] void Fail(const char* what, std::string_view text) {
-  fprintf(stderr, "fuzz_proc_parse: %s; text (%zu bytes): \"", what,
-          text.size());
-  for (unsigned char c : text.substr(0, 300)) {
-    if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
-      fputc(c, stderr);
-    } else {
-      fprintf(stderr, "\\x%02x", c);
-    }
-  }
-  fprintf(stderr, "%s\"\n", text.size() > 300 ? "..." : "");
-  abort();
+[[noreturn]] void Fail(const char* what, std::string_view input) {
+  FuzzFail("fuzz_proc_parse", what, input);
 }
 
 std::string Decode(const uint8_t* data, size_t size) {

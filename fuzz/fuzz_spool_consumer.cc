@@ -29,6 +29,7 @@
 #include <string_view>
 #include <vector>
 
+#include "fuzz_report.h"
 #include "fuzz_scratch_dir.h"
 #include "quvaidx/spool_consumer.h"
 #include "quvaidx/system.h"
@@ -39,18 +40,8 @@ constexpr size_t kMaxInput = 64 * 1024;
 constexpr size_t kFillerUnit = 2731;
 constexpr unsigned kFillerUnits = 24;
 
-[[noreturn]] void Fail(const char* what, std::string_view text) {
-  fprintf(stderr, "fuzz_spool_consumer: %s; file (%zu bytes): \"", what,
-          text.size());
-  for (unsigned char c : text.substr(0, 300)) {
-    if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
-      fputc(c, stderr);
-    } else {
-      fprintf(stderr, "\\x%02x", c);
-    }
-  }
-  fprintf(stderr, "%s\"\n", text.size() > 300 ? "..." : "");
-  abort();
+[[noreturn]] void Fail(const char* what, std::string_view input) {
+  FuzzFail("fuzz_spool_consumer", what, input);
 }
 
 // `bytes` bytes of lines of 1 to 97 bytes ('\n' included), the last one
