@@ -15,6 +15,8 @@
 # (`quvaidx plugins`, after writing a stand-in pid file for the index
 # daemon, which is not part of the demo), and stops both daemons.
 set -euo pipefail
+# shellcheck source=private_paths.sh
+source "$(dirname "$0")/private_paths.sh"
 
 if [ "${1:-}" != --inside ]; then
   if [ $# -ne 1 ]; then
@@ -33,14 +35,7 @@ if [ "${1:-}" != --inside ]; then
     echo "(no vips command to make sample photos: install libvips-tools)"
     exit 0
   fi
-  # A namespace counts only if a tmpfs can be mounted in it.
-  probe='mount -t tmpfs probe /var/spool'
-  if [ "$(id -u)" -eq 0 ] && unshare --mount --propagation private \
-      sh -c "$probe" 2>/dev/null; then
-    namespace=(unshare --mount --propagation private)
-  elif unshare -Urm sh -c "$probe" 2>/dev/null; then
-    namespace=(unshare -Urm)
-  else
+  if ! find_private_namespace; then
     echo "(skipped: the preview daemons use fixed paths under /var and /tmp;"
     echo " the demo needs a private mount namespace for them, which needs"
     echo " root or user namespaces)"
@@ -48,7 +43,7 @@ if [ "${1:-}" != --inside ]; then
   fi
   work=$(mktemp -d /tmp/quvaidx-demo-previews.XXXXXX)
   status=0
-  timeout 120 "${namespace[@]}" bash "$0" --inside "$work" "$build" ||
+  timeout 120 "${NAMESPACE[@]}" bash "$0" --inside "$work" "$build" ||
     status=$?
   rm -rf "$work" # the namespace's mounts are gone with it
   exit $status
@@ -72,22 +67,8 @@ show() {
   timeout 20 "$tool" "$@" || status=$?
   echo "(exit status $status)"
 }
-wait_for() {
-  local limit=$(($1 * 20))
-  shift
-  for ((i = 0; i < limit; i++)); do
-    "$@" && return 0
-    sleep 0.05
-  done
-  return 1
-}
 
-mount -t tmpfs -o mode=0755 demo-spool /var/spool
-mount -t tmpfs -o mode=0755 demo-run "$(readlink -f /var/run)"
-mkdir -p "$work/tmp/$(basename "$work")"
-mount --bind "$work" "$work/tmp/$(basename "$work")"
-mount --bind "$work/tmp" /tmp
-chmod 1777 /tmp
+mount_private_paths "$work" demo
 export QUVA_HOST_ETC=$work/host-etc
 
 heading "A private mount namespace: /var/spool, /run and /tmp are fresh here,

@@ -20,6 +20,8 @@
 # part of the road: a stand-in pid file, naming this script's shell, makes
 # IsQuvaindexAlive (and so QUVAIDX_GetAllPluginName) see it alive.
 set -euo pipefail
+# shellcheck source=../../scripts/private_paths.sh
+source "$(dirname "$0")/../../scripts/private_paths.sh"
 
 if [ "${1:-}" != --inside ]; then
   if [ $# -ne 3 ]; then
@@ -31,15 +33,7 @@ if [ "${1:-}" != --inside ]; then
     echo "SKIP: the vips command (libvips-tools) makes the photos; not found"
     exit 77
   fi
-  namespace=()
-  # A namespace counts only if a tmpfs can be mounted in it.
-  probe='mount -t tmpfs probe /var/spool'
-  if [ "$(id -u)" -eq 0 ] && unshare --mount --propagation private \
-      sh -c "$probe" 2>/dev/null; then
-    namespace=(unshare --mount --propagation private)
-  elif unshare -Urm sh -c "$probe" 2>/dev/null; then
-    namespace=(unshare -Urm)
-  else
+  if ! find_private_namespace; then
     echo "SKIP: cannot make a private mount namespace (needs root, or" \
          "user namespaces): the fixed paths cannot be used safely here"
     exit 77
@@ -52,7 +46,7 @@ if [ "${1:-}" != --inside ]; then
   before=$(stat -L -c '%n %i %Y' "${fixed[@]}" 2>/dev/null || true)
   work=$(mktemp -d /tmp/quvaidx-road.XXXXXX)
   status=0
-  timeout 120 "${namespace[@]}" bash "$0" --inside "$work" "$1" "$2" "$3" ||
+  timeout 120 "${NAMESPACE[@]}" bash "$0" --inside "$work" "$1" "$2" "$3" ||
     status=$?
   after=$(stat -L -c '%n %i %Y' "${fixed[@]}" 2>/dev/null || true)
   # The namespace's mounts are gone: only plain files remain.
@@ -85,27 +79,9 @@ cleanup() {
 }
 trap cleanup EXIT
 
-# Private /var/spool and /run; /tmp becomes $work/tmp, in which $work itself
-# stays reachable under its own name.
-mount -t tmpfs -o mode=0755 road-spool /var/spool
-mount -t tmpfs -o mode=0755 road-run "$(readlink -f /var/run)"
-mkdir -p "$work/tmp/$(basename "$work")"
-mount --bind "$work" "$work/tmp/$(basename "$work")"
-mount --bind "$work/tmp" /tmp
-chmod 1777 /tmp
+mount_private_paths "$work" road
 [ -d "$work" ] || fail "the work directory is not reachable after the mounts"
 export QUVA_HOST_ETC=$work/host-etc # no boot step file: booted
-
-# wait_for SECONDS COMMAND...: polls COMMAND every 50 ms.
-wait_for() {
-  local limit=$(($1 * 20))
-  shift
-  for ((i = 0; i < limit; i++)); do
-    "$@" && return 0
-    sleep 0.05
-  done
-  return 1
-}
 
 # The share: photos in two folders (one below the other), a PNG, files of
 # other kinds.

@@ -1,0 +1,45 @@
+# Helpers for running the daemons at their fixed paths (/var/spool,
+# /var/run, /tmp) without touching this machine's own files there: a
+# private mount namespace in which those folders are fresh. Sourced by the
+# preview demo and the preview road test.
+
+# find_private_namespace: sets NAMESPACE to the unshare command line that
+# makes a private mount namespace (as root, or in a user namespace where
+# allowed). Fails when none can be made. A namespace counts only if a tmpfs
+# can be mounted in it.
+find_private_namespace() {
+  local probe='mount -t tmpfs probe /var/spool'
+  if [ "$(id -u)" -eq 0 ] && unshare --mount --propagation private \
+      sh -c "$probe" 2>/dev/null; then
+    NAMESPACE=(unshare --mount --propagation private)
+  elif unshare -Urm sh -c "$probe" 2>/dev/null; then
+    NAMESPACE=(unshare -Urm)
+  else
+    return 1
+  fi
+}
+
+# mount_private_paths WORK LABEL: inside the namespace, fresh tmpfs over
+# /var/spool and /run (/var/run), and WORK/tmp over /tmp, in which WORK
+# itself stays reachable under its own name.
+mount_private_paths() {
+  local work=$1 label=$2
+  mount -t tmpfs -o mode=0755 "$label-spool" /var/spool
+  mount -t tmpfs -o mode=0755 "$label-run" "$(readlink -f /var/run)"
+  mkdir -p "$work/tmp/$(basename "$work")"
+  mount --bind "$work" "$work/tmp/$(basename "$work")"
+  mount --bind "$work/tmp" /tmp
+  chmod 1777 /tmp
+}
+
+# wait_for SECONDS COMMAND...: polls COMMAND every 50 ms until it succeeds;
+# fails when SECONDS have passed.
+wait_for() {
+  local limit=$(($1 * 20)) i
+  shift
+  for ((i = 0; i < limit; i++)); do
+    "$@" && return 0
+    sleep 0.05
+  done
+  return 1
+}
