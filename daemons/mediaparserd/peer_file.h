@@ -1,0 +1,99 @@
+// Opening the file a peer named, and reading it within one request's limits.
+//
+// A peer names any path it likes: a FIFO that never answers, a device, a
+// directory, a file that another process grows, shrinks or replaces while it
+// is read, a sparse file of terabytes. OpenPeerFile is the one place where
+// the daemon opens such a path, and a BoundedReader is the only way the
+// media libraries read it: at their own offsets, never past the size the
+// file had when it was opened, and never after the request's deadline or
+// byte budget ran out.
+//
+// Single-threaded: one request at a time owns a PeerFile and its reader.
+#ifndef MEDIAPARSERD_PEER_FILE_H_
+#define MEDIAPARSERD_PEER_FILE_H_
+
+#include <stdint.h>
+#include <sys/stat.h>
+#include <time.h>
+
+#include <string>
+
+namespace mediaparserd {
+
+// An open regular file; closes its descriptor when destroyed.
+class PeerFile {
+ public:
+  PeerFile() = default;
+  ~PeerFile();
+  PeerFile(const PeerFile&) = delete;
+  PeerFile& operator=(const PeerFile&) = delete;
+
+  int fd() const { return fd_; }
+  const struct stat& status() const { return status_; }
+
+ private:
+  friend bool OpenPeerFile(const std::string&, PeerFile*, std::string*);
+  int fd_ = -1;  // open for reading; -1 before OpenPeerFile succeeded
+  struct stat status_ = {};  // of fd_, taken when it was opened
+};
+
+// Opens the file a peer named at `path` for reading, without ever opening
+// anything else for reading: the path is opened with O_PATH (which reads
+// nothing and cannot block), checked with fstat, and only a regular file is
+// then opened for reading through that descriptor (/proc/self/fd/N), so
+// what is read is the file that was checked even if the name is changed in
+// between. Symbolic links in the path are followed.
+// Returns true with *file open (a file that was open before is closed);
+// false with *reason set to one readable line: "path is not absolute",
+// "path too long", "path holds a zero byte", the system's text for the
+// error ("No such file or directory", "Permission denied"), or "not a
+// regular file".
+bool OpenPeerFile(const std::string& path, PeerFile* file, std::string* reason);
+
+// The limits of one request.
+struct ReadLimits {
+  int64_t time_ms = 5000;             // from the reader's creation
+  int64_t bytes = 128 * 1024 * 1024;  // read by all libraries together
+};
+
+// Reads one open file for the media libraries, each at its own offset.
+class BoundedReader {
+ public:
+  enum class Stop {
+    kNone,    // nothing stopped the reads so far
+    kTime,    // the deadline passed
+    kBudget,  // the byte budget was used up
+    kError,   // the system refused a read (error() tells why)
+  };
+
+  // `size` is the file's size at opening: a file that grows is read up to
+  // that size, one that shrinks reads short. The deadline starts now.
+  BoundedReader(int fd, int64_t size, const ReadLimits& limits);
+
+  // Reads up to `count` bytes at `offset` into `buffer`. Returns the bytes
+  // read, 0 at or past the end, or -1 once the deadline or the budget has
+  // run out or a read failed; after -1, every further read gives -1.
+  int64_t ReadAt(int64_t offset, void* buffer, int64_t count);
+
+  // True once the deadline has passed (then stop() is kTime). Cheap enough
+  // for the libraries' interrupt callbacks.
+  bool Expired();
+
+  int64_t size() const { return size_; }
+  Stop stop() const { return stop_; }
+  int error() const { return error_; }
+  int64_t bytes_read() const { return bytes_read_; }
+
+ private:
+  int fd_;
+  int64_t size_;
+  struct timespec deadline_;  // CLOCK_MONOTONIC
+  int64_t budget_;            // bytes that may still be read
+  int64_t bytes_read_ = 0;
+  Stop stop_ = Stop::kNone;
+  int error_ = 0;  // errno of the failed read
+};
+
+}  // namespace mediaparserd
+
+#endif  // MEDIAPARSERD_PEER_FILE_H_
