@@ -2,11 +2,13 @@
 
 #include <ctype.h>
 #include <stdio.h>
+#include <string.h>
 
 extern "C" {
 #include <libavcodec/avcodec.h>
 #include <libavformat/avformat.h>
 #include <libavutil/display.h>
+#include <libavutil/mathematics.h>
 }
 
 namespace mediaparserd {
@@ -92,19 +94,53 @@ class CustomIo {
   AVIOContext* io_ = nullptr;
 };
 
+// The audio object type an AAC stream's AudioSpecificConfig starts with
+// (ISO/IEC 14496-3), 0 without one.
+int ConfiguredAacType(const AVCodecParameters* par) {
+  if (par->extradata == nullptr || par->extradata_size < 2) return 0;
+  int type = par->extradata[0] >> 3;
+  if (type == 31) {
+    type = 32 + (((par->extradata[0] & 7) << 3) | (par->extradata[1] >> 5));
+  }
+  return type;
+}
+
+// The profile and level an H.264 or HEVC stream's configuration record
+// (avcC, hvcC) states, numbered as libavcodec's decoders report them.
+// False when there is no such record.
+bool ConfiguredProfile(const AVCodecParameters* par, int* profile, int* level) {
+  const uint8_t* config = par->extradata;
+  int size = par->extradata_size;
+  if (config == nullptr || size < 4 || config[0] != 1) return false;
+  if (par->codec_id == AV_CODEC_ID_H264) {
+    int constraints = config[2];  // constraint_set0_flag is the top bit
+    *profile = config[1];
+    if (*profile == FF_PROFILE_H264_BASELINE && (constraints & 0x40)) {
+      *profile |= FF_PROFILE_H264_CONSTRAINED;
+    }
+    if ((*profile == FF_PROFILE_H264_HIGH_10 ||
+         *profile == FF_PROFILE_H264_HIGH_422 ||
+         *profile == FF_PROFILE_H264_HIGH_444_PREDICTIVE) &&
+        (constraints & 0x10)) {
+      *profile |= FF_PROFILE_H264_INTRA;
+    }
+    *level = config[3];
+    return *profile > 0;
+  }
+  if (par->codec_id == AV_CODEC_ID_HEVC && size >= 23) {
+    *profile = config[1] & 0x1F;
+    *level = config[12];
+    return *profile > 0;
+  }
+  return false;
+}
+
 // The MPEG-4 audio object type of an AAC stream. Explicitly signalled SBR
 // in the stream's configuration (object type 5 or 29) makes it HE-AAC even
 // before the decoder met SBR data; otherwise the decoder's profile, whose
 // numbers are the object type less one, names it. HE-AAC v2 is HE-AAC.
 int64_t AacObjectType(const AVCodecParameters* par) {
-  int configured = 0;
-  if (par->extradata != nullptr && par->extradata_size >= 2) {
-    configured = par->extradata[0] >> 3;
-    if (configured == 31) {
-      configured =
-          32 + (((par->extradata[0] & 7) << 3) | (par->extradata[1] >> 5));
-    }
-  }
+  int configured = ConfiguredAacType(par);
   if (configured == 5 || configured == 29) return 5;
   switch (par->profile) {
     case FF_PROFILE_AAC_MAIN:
@@ -147,6 +183,12 @@ StreamFacts FactsOf(AVFormatContext* context, AVStream* stream) {
   facts.codec = avcodec_get_name(par->codec_id);
   facts.profile = par->profile;
   facts.level = par->level;
+  int profile, level;
+  if (par->profile == FF_PROFILE_UNKNOWN &&
+      ConfiguredProfile(par, &profile, &level)) {
+    facts.profile = profile;
+    facts.level = level;
+  }
   if (par->codec_id == AV_CODEC_ID_AAC) {
     facts.aac_object_type = AacObjectType(par);
   }
@@ -173,12 +215,83 @@ StreamFacts FactsOf(AVFormatContext* context, AVStream* stream) {
   return facts;
 }
 
-void Collect(AVFormatContext* context, ContainerFacts* facts) {
-  facts->format = context->iformat->name;
+// The duration the container states, in AV_TIME_BASE units: its own, or
+// its longest stream's; 0 when unknown.
+int64_t StatedDuration(const AVFormatContext* context) {
   if (context->duration != AV_NOPTS_VALUE && context->duration > 0) {
-    facts->duration = static_cast<double>(context->duration) / AV_TIME_BASE;
+    return context->duration;
+  }
+  int64_t longest = 0;
+  for (unsigned i = 0; i < context->nb_streams; ++i) {
+    const AVStream* stream = context->streams[i];
+    if (stream->duration == AV_NOPTS_VALUE || stream->duration <= 0 ||
+        stream->time_base.num <= 0 || stream->time_base.den <= 0) {
+      continue;
+    }
+    longest = FFMAX(longest, av_rescale_q(stream->duration, stream->time_base,
+                                          AV_TIME_BASE_Q));
+  }
+  return longest;
+}
+
+// Containers whose header states everything the record needs, so that
+// avformat_find_stream_info, which decodes frames (a good part of a
+// millisecond for H.264, more for large pictures), can be skipped.
+bool HeaderTellsAll(const AVFormatContext* context) {
+  static const char* const kFormats[] = {"mov,mp4,m4a,3gp,3g2,mj2",
+                                         "matroska,webm", "wav", "ogg", "flac"};
+  bool known = false;
+  for (const char* format : kFormats) {
+    known = known || strcmp(context->iformat->name, format) == 0;
+  }
+  if (!known || StatedDuration(context) <= 0) return false;
+  bool media = false;
+  for (unsigned i = 0; i < context->nb_streams; ++i) {
+    const AVStream* stream = context->streams[i];
+    const AVCodecParameters* par = stream->codecpar;
+    if (stream->disposition & AV_DISPOSITION_ATTACHED_PIC) continue;
+    if (par->codec_type == AVMEDIA_TYPE_AUDIO) {
+      if (par->codec_id == AV_CODEC_ID_NONE || par->sample_rate <= 0 ||
+          par->ch_layout.nb_channels <= 0) {
+        return false;
+      }
+      if (par->codec_id == AV_CODEC_ID_AAC) {
+        // Below 24 kHz plain AAC may carry SBR that only decoding finds.
+        int type = ConfiguredAacType(par);
+        if (type == 0 || (type == 2 && par->sample_rate <= 24000)) {
+          return false;
+        }
+      }
+      media = true;
+    } else if (par->codec_type == AVMEDIA_TYPE_VIDEO) {
+      int profile, level;
+      if (!ConfiguredProfile(par, &profile, &level) || par->width <= 0 ||
+          par->height <= 0 || stream->avg_frame_rate.num <= 0 ||
+          stream->avg_frame_rate.den <= 0) {
+        return false;
+      }
+      media = true;
+    }
+  }
+  return media;
+}
+
+void Collect(AVFormatContext* context, int64_t file_size,
+             ContainerFacts* facts) {
+  facts->format = context->iformat->name;
+  int64_t duration = StatedDuration(context);
+  if (duration > 0) {
+    facts->duration = static_cast<double>(duration) / AV_TIME_BASE;
   }
   facts->bit_rate = context->bit_rate;
+  // As libavformat's analysis works it out: the whole file over its time.
+  if (facts->bit_rate <= 0 && duration > 0 && file_size > 0) {
+    double rate = static_cast<double>(file_size) * 8.0 * AV_TIME_BASE /
+                  static_cast<double>(duration);
+    if (rate <= static_cast<double>(INT64_MAX)) {
+      facts->bit_rate = static_cast<int64_t>(rate);
+    }
+  }
   AddTags(context->metadata, facts);
   bool stream_tags = false;
   for (unsigned i = 0; i < context->nb_streams; ++i) {
@@ -233,16 +346,16 @@ ProbeResult ProbeContainer(BoundedReader* reader, const ProbeLimits& limits,
     *detail = std::string(format->name) + ": " + ErrorText(error);
     return ProbeResult::kDamaged;
   }
-  error = avformat_find_stream_info(context, nullptr);
+  // A failed analysis still leaves what the header told: its result does
+  // not matter, only whether the reader stopped.
+  if (!HeaderTellsAll(context)) avformat_find_stream_info(context, nullptr);
   ProbeResult result = ProbeResult::kOk;
   if (reader->stop() != BoundedReader::Stop::kNone) {
     result = ProbeResult::kStopped;
   } else {
-    // A failed analysis still leaves what the header told.
     *facts = ContainerFacts();
-    Collect(context, facts);
+    Collect(context, reader->size(), facts);
   }
-  (void)error;
   avformat_close_input(&context);
   return result;
 }

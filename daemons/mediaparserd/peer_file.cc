@@ -98,10 +98,7 @@ bool BoundedReader::Expired() {
   return false;
 }
 
-int64_t BoundedReader::ReadAt(int64_t offset, void* buffer, int64_t count) {
-  if (stop_ != Stop::kNone || Expired()) return -1;
-  if (offset < 0 || count <= 0 || offset >= size_) return 0;
-  if (count > size_ - offset) count = size_ - offset;
+int64_t BoundedReader::ReadFile(int64_t offset, void* buffer, int64_t count) {
   if (count > budget_) {
     stop_ = Stop::kBudget;
     return -1;
@@ -121,6 +118,50 @@ int64_t BoundedReader::ReadAt(int64_t offset, void* buffer, int64_t count) {
   }
   budget_ -= done;
   bytes_read_ += done;
+  return done;
+}
+
+const BoundedReader::Block* BoundedReader::LoadBlock(int64_t index) {
+  Block* oldest = &blocks_[0];
+  for (Block& block : blocks_) {
+    if (block.index == index) {
+      block.used = ++clock_;
+      return &block;
+    }
+    if (block.used < oldest->used) oldest = &block;
+  }
+  if (oldest->data == nullptr) {
+    oldest->data = std::make_unique<char[]>(kBlockSize);
+  }
+  int64_t start = index * kBlockSize;
+  int64_t want = size_ - start < kBlockSize ? size_ - start : kBlockSize;
+  oldest->index = -1;
+  int64_t n = ReadFile(start, oldest->data.get(), want);
+  if (n < 0) return nullptr;
+  oldest->index = index;
+  oldest->length = n;
+  oldest->used = ++clock_;
+  return oldest;
+}
+
+int64_t BoundedReader::ReadAt(int64_t offset, void* buffer, int64_t count) {
+  if (stop_ != Stop::kNone || Expired()) return -1;
+  if (offset < 0 || count <= 0 || offset >= size_) return 0;
+  if (count > size_ - offset) count = size_ - offset;
+  if (count >= kBlockSize) return ReadFile(offset, buffer, count);
+  int64_t done = 0;
+  while (done < count) {
+    int64_t at = offset + done;
+    const Block* block = LoadBlock(at / kBlockSize);
+    if (block == nullptr) return -1;
+    int64_t within = at - block->index * kBlockSize;
+    if (within >= block->length) break;  // the file shrank
+    int64_t n = block->length - within < count - done ? block->length - within
+                                                      : count - done;
+    memcpy(static_cast<char*>(buffer) + done, block->data.get() + within,
+           static_cast<size_t>(n));
+    done += n;
+  }
   return done;
 }
 

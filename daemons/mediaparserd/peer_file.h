@@ -16,6 +16,7 @@
 #include <sys/stat.h>
 #include <time.h>
 
+#include <memory>
 #include <string>
 
 namespace mediaparserd {
@@ -57,6 +58,9 @@ struct ReadLimits {
 };
 
 // Reads one open file for the media libraries, each at its own offset.
+// Small reads are served from a few cached 64 KiB blocks: the libraries
+// read headers and tags in pieces of a few bytes, and every system call is
+// dear (in a virtual machine several microseconds).
 class BoundedReader {
  public:
   enum class Stop {
@@ -82,9 +86,24 @@ class BoundedReader {
   int64_t size() const { return size_; }
   Stop stop() const { return stop_; }
   int error() const { return error_; }
-  int64_t bytes_read() const { return bytes_read_; }
+  int64_t bytes_read() const { return bytes_read_; }  // from the file
 
  private:
+  static constexpr int64_t kBlockSize = 64 << 10;
+  static constexpr int kBlocks = 4;
+  struct Block {
+    int64_t index = -1;  // offset / kBlockSize; -1: empty
+    int64_t length = 0;  // bytes held (short at the end of the file)
+    uint64_t used = 0;   // when last used, for replacing the oldest
+    std::unique_ptr<char[]> data;
+  };
+
+  // Reads count bytes at offset from the file into buffer, within the
+  // budget; the bytes read or -1 (stop_ set).
+  int64_t ReadFile(int64_t offset, void* buffer, int64_t count);
+  // The cached block `index`, read in if needed; null after a stop.
+  const Block* LoadBlock(int64_t index);
+
   int fd_;
   int64_t size_;
   struct timespec deadline_;  // CLOCK_MONOTONIC
@@ -92,6 +111,8 @@ class BoundedReader {
   int64_t bytes_read_ = 0;
   Stop stop_ = Stop::kNone;
   int error_ = 0;  // errno of the failed read
+  Block blocks_[kBlocks];
+  uint64_t clock_ = 0;  // counts block uses
 };
 
 }  // namespace mediaparserd
