@@ -74,8 +74,19 @@ bool OpenPeerFile(const std::string& path, PeerFile* file,
   return true;
 }
 
-BoundedReader::BoundedReader(int fd, int64_t size, const ReadLimits& limits)
-    : fd_(fd), size_(size < 0 ? 0 : size), budget_(limits.bytes) {
+char* BlockMemory::block(int i) {
+  if (blocks_[i] == nullptr) blocks_[i].reset(new char[kBlockSize]);
+  return blocks_[i].get();
+}
+
+BoundedReader::BoundedReader(int fd, int64_t size, const ReadLimits& limits,
+                             BlockMemory* memory)
+    : fd_(fd),
+      size_(size < 0 ? 0 : size),
+      budget_(limits.bytes),
+      own_memory_(memory == nullptr ? std::make_unique<BlockMemory>()
+                                    : nullptr),
+      memory_(memory == nullptr ? own_memory_.get() : memory) {
   clock_gettime(CLOCK_MONOTONIC, &deadline_);
   int64_t ms = limits.time_ms < 0 ? 0 : limits.time_ms;
   deadline_.tv_sec += static_cast<time_t>(ms / 1000);
@@ -131,12 +142,12 @@ const BoundedReader::Block* BoundedReader::LoadBlock(int64_t index) {
     if (block.used < oldest->used) oldest = &block;
   }
   if (oldest->data == nullptr) {
-    oldest->data = std::make_unique<char[]>(kBlockSize);
+    oldest->data = memory_->block(static_cast<int>(oldest - blocks_));
   }
   int64_t start = index * kBlockSize;
   int64_t want = size_ - start < kBlockSize ? size_ - start : kBlockSize;
   oldest->index = -1;
-  int64_t n = ReadFile(start, oldest->data.get(), want);
+  int64_t n = ReadFile(start, oldest->data, want);
   if (n < 0) return nullptr;
   oldest->index = index;
   oldest->length = n;
@@ -158,7 +169,7 @@ int64_t BoundedReader::ReadAt(int64_t offset, void* buffer, int64_t count) {
     if (within >= block->length) break;  // the file shrank
     int64_t n = block->length - within < count - done ? block->length - within
                                                       : count - done;
-    memcpy(static_cast<char*>(buffer) + done, block->data.get() + within,
+    memcpy(static_cast<char*>(buffer) + done, block->data + within,
            static_cast<size_t>(n));
     done += n;
   }

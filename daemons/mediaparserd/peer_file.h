@@ -57,6 +57,20 @@ struct ReadLimits {
   int64_t bytes = 128 * 1024 * 1024;  // read by all libraries together
 };
 
+// Memory for the blocks a BoundedReader caches, kept from one request to
+// the next so that a request neither allocates nor faults it in anew.
+class BlockMemory {
+ public:
+  static constexpr int64_t kBlockSize = 64 << 10;
+  static constexpr int kBlocks = 4;
+
+  // Block `i` (0 <= i < kBlocks), allocated on first use, not zeroed.
+  char* block(int i);
+
+ private:
+  std::unique_ptr<char[]> blocks_[kBlocks];
+};
+
 // Reads one open file for the media libraries, each at its own offset.
 // Small reads are served from a few cached 64 KiB blocks: the libraries
 // read headers and tags in pieces of a few bytes, and every system call is
@@ -72,7 +86,10 @@ class BoundedReader {
 
   // `size` is the file's size at opening: a file that grows is read up to
   // that size, one that shrinks reads short. The deadline starts now.
-  BoundedReader(int fd, int64_t size, const ReadLimits& limits);
+  // `memory` holds the cached blocks (its own when null); it must outlive
+  // the reader and serve one reader at a time.
+  BoundedReader(int fd, int64_t size, const ReadLimits& limits,
+                BlockMemory* memory = nullptr);
 
   // Reads up to `count` bytes at `offset` into `buffer`. Returns the bytes
   // read, 0 at or past the end, or -1 once the deadline or the budget has
@@ -89,13 +106,13 @@ class BoundedReader {
   int64_t bytes_read() const { return bytes_read_; }  // from the file
 
  private:
-  static constexpr int64_t kBlockSize = 64 << 10;
-  static constexpr int kBlocks = 4;
+  static constexpr int64_t kBlockSize = BlockMemory::kBlockSize;
+  static constexpr int kBlocks = BlockMemory::kBlocks;
   struct Block {
-    int64_t index = -1;  // offset / kBlockSize; -1: empty
-    int64_t length = 0;  // bytes held (short at the end of the file)
-    uint64_t used = 0;   // when last used, for replacing the oldest
-    std::unique_ptr<char[]> data;
+    int64_t index = -1;    // offset / kBlockSize; -1: empty
+    int64_t length = 0;    // bytes held (short at the end of the file)
+    uint64_t used = 0;     // when last used, for replacing the oldest
+    char* data = nullptr;  // in memory_, once used
   };
 
   // Reads count bytes at offset from the file into buffer, within the
@@ -110,7 +127,9 @@ class BoundedReader {
   int64_t budget_;            // bytes that may still be read
   int64_t bytes_read_ = 0;
   Stop stop_ = Stop::kNone;
-  int error_ = 0;  // errno of the failed read
+  int error_ = 0;                            // errno of the failed read
+  std::unique_ptr<BlockMemory> own_memory_;  // when none was given
+  BlockMemory* memory_;
   Block blocks_[kBlocks];
   uint64_t clock_ = 0;  // counts block uses
 };

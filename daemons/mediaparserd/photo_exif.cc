@@ -9,6 +9,7 @@
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wdeprecated-declarations"
 #include <exiv2/exiv2.hpp>
+#include <exiv2/webpimage.hpp>
 
 namespace mediaparserd {
 namespace {
@@ -124,20 +125,31 @@ void SetUpExiv2() {
   (void)done;
 }
 
-// exiv2 reads some formats that are not images (XMP sidecars, EPS, its own
-// .exv), and, where enabled, ISO media files.
+// The still-image formats exiv2 reads. It reads others too, depending on
+// how it was built: XMP sidecars, EPS, its own .exv, ISO media files and,
+// with video support, QuickTime, RIFF (AVI and WAV), Matroska and ASF, all
+// of which are libavformat's to read.
 bool IsPhotoType(int type) {
+  namespace T = Exiv2::ImageType;
   switch (type) {
-    case Exiv2::ImageType::none:
-    case Exiv2::ImageType::xmp:
-    case Exiv2::ImageType::exv:
-    case Exiv2::ImageType::eps:
-#ifdef EXV_ENABLE_BMFF
-    case Exiv2::ImageType::bmff:
-#endif
-      return false;
-    default:
+    case T::jpeg:
+    case T::tiff:  // with DNG, NEF and the other TIFF-based raw formats
+    case T::cr2:
+    case T::crw:
+    case T::mrw:
+    case T::orf:
+    case T::raf:
+    case T::rw2:
+    case T::png:
+    case T::gif:
+    case T::bmp:
+    case T::psd:
+    case T::jp2:
+    case T::pgf:
+    case T::webp:
       return true;
+    default:
+      return false;
   }
 }
 

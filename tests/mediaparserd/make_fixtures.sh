@@ -22,6 +22,7 @@ stamp=$(cat "$0" "$here/fixture_tags.py" | cksum)-$(ffmpeg -version | head -n 1 
 if [ -f "$dir/stamp" ] && [ "$(cat "$dir/stamp")" = "$stamp" ]; then exit 0; fi
 
 mkdir -p "$dir"
+dir=$(cd "$dir" && pwd)
 work=$(mktemp -d "$dir/.work.XXXXXX")
 trap 'rm -rf "$work"' EXIT
 cd "$work"
