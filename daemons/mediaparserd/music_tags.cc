@@ -2,6 +2,7 @@
 
 #include <ctype.h>
 #include <limits.h>
+#include <string.h>
 
 #include <string>
 
@@ -115,7 +116,19 @@ void SetUpTagLib() {
   (void)done;
 }
 
-TagText MakeText(const TagLib::String& text, TagLib::String::Type stored) {
+// The encoding a frame declares, as a number: TagLib keeps the frame's
+// encoding byte in its enum type unchecked, so a damaged frame holds values
+// outside it, which may not be read through the enum type.
+int Declared(TagLib::String::Type encoding) {
+  static_assert(sizeof(encoding) == sizeof(int), "an int-sized enum");
+  int number;
+  memcpy(&number, &encoding, sizeof(number));
+  return number;
+}
+
+// The text in the encoding its frame declares. TagLib decodes any
+// declaration but Latin-1 and UTF-8 as UTF-16, damaged ones included.
+TagText MakeText(const TagLib::String& text, int stored) {
   switch (stored) {
     case TagLib::String::Latin1:
       return {Encoding::kBytes, text.to8Bit(false)};
@@ -154,7 +167,7 @@ TagText FrameText(const TagLib::ID3v2::Tag& tag, const char* id) {
       dynamic_cast<const TagLib::ID3v2::TextIdentificationFrame*>(
           FirstFrame(tag, id));
   if (frame == nullptr) return {};
-  return MakeText(frame->toString(), frame->textEncoding());
+  return MakeText(frame->toString(), Declared(frame->textEncoding()));
 }
 
 // The comment without a description if there is one (others hold player
@@ -176,7 +189,7 @@ TagText CommentText(const TagLib::ID3v2::Tag& tag) {
     }
   }
   if (chosen != nullptr)
-    return MakeText(chosen->text(), chosen->textEncoding());
+    return MakeText(chosen->text(), Declared(chosen->textEncoding()));
   // Some writers (ffmpeg among them) keep the comment in a user-defined
   // text frame described "comment".
   it = map.find("TXXX");
@@ -186,7 +199,7 @@ TagText CommentText(const TagLib::ID3v2::Tag& tag) {
         dynamic_cast<const TagLib::ID3v2::UserTextIdentificationFrame*>(frame);
     if (text != nullptr && text->fieldList().size() >= 2 &&
         text->description().upper() == "COMMENT") {
-      return MakeText(text->fieldList()[1], text->textEncoding());
+      return MakeText(text->fieldList()[1], Declared(text->textEncoding()));
     }
   }
   return {};
@@ -204,7 +217,7 @@ MusicTags FromID3v2(const TagLib::ID3v2::Tag& tag) {
   if (const auto* genre =
           dynamic_cast<const TagLib::ID3v2::TextIdentificationFrame*>(
               FirstFrame(tag, "TCON"))) {
-    tags.genre = MakeText(tag.genre(), genre->textEncoding());
+    tags.genre = MakeText(tag.genre(), Declared(genre->textEncoding()));
   }
   tags.track = tag.track();
   tags.year = tag.year();

@@ -88,8 +88,15 @@ void PutText(char* field, size_t capacity, std::string_view text) {
       }
     }
   }
-  memcpy(field, text.data(), length);
+  if (length > 0) memcpy(field, text.data(), length);
   field[length] = '\0';
+}
+
+// A name the libraries give (codec, container, file system UUID): ASCII in
+// practice; anything that is not UTF-8 is left out rather than passed on.
+void PutName(char* field, size_t capacity, std::string_view name) {
+  name = name.substr(0, name.find('\0'));
+  PutText(field, capacity, IsValidUTF8(name) ? name : std::string_view());
 }
 
 // Writes UTF-16LE code units (up to the first zero unit, at most
@@ -263,7 +270,7 @@ void FillStreams(MediaKind kind, const ContainerFacts& container,
                                       : audio->aac_object_type);
       PutText(r->szAudioCodec, kMediaTagSize, QUVAAacCodecNameGet(type));
     } else {
-      PutText(r->szAudioCodec, kMediaTagSize, audio->codec);
+      PutName(r->szAudioCodec, kMediaTagSize, audio->codec);
     }
   }
   if (const StreamFacts* video =
@@ -272,7 +279,7 @@ void FillStreams(MediaKind kind, const ContainerFacts& container,
     r->resolutionY = Count(video->height);
     r->video_bitrate = Rate(video->bit_rate);
     PutFrameRate(*video, r);
-    PutText(r->szVideoCodec, kMediaTagSize, video->codec);
+    PutName(r->szVideoCodec, kMediaTagSize, video->codec);
     r->videoProfile = Signed(video->profile);
     r->videoLevel = Signed(video->level);
   }
@@ -405,8 +412,8 @@ void FillRecord(MediaKind kind, const FileFacts& file,
   r->fileSize = file.size;
   FormatTime(file.mtime, r->szDate, sizeof(r->szDate));
   FormatTime(file.mtime, r->szMDate, sizeof(r->szMDate));
-  PutText(r->szFsUUID, sizeof(r->szFsUUID), file.fs_uuid);
-  PutText(r->szContainerType, sizeof(r->szContainerType),
+  PutName(r->szFsUUID, sizeof(r->szFsUUID), file.fs_uuid);
+  PutName(r->szContainerType, sizeof(r->szContainerType),
           ContainerTypeName(container.format));
   if (kind == MediaKind::kPhoto) {
     FillPhoto(container, photo, r);

@@ -306,6 +306,44 @@ TEST_F(MediaParserTest, LegacyTagsFallBackWithoutTheirCodePage) {
   EXPECT_EQ(r.track, 7);
 }
 
+// An ID3v2.3 text frame: `id`, its encoding byte, `text`.
+std::string Id3v2Frame(const char* id, char encoding, const std::string& text) {
+  std::string body = std::string(1, encoding) + text;
+  std::string frame = id;
+  for (int shift : {24, 16, 8, 0}) {
+    frame += static_cast<char>(body.size() >> shift);
+  }
+  return frame + std::string(2, '\0') + body;
+}
+
+// An ID3v2.3 tag around `frames`.
+std::string Id3v2Tag(const std::string& frames) {
+  std::string tag = "ID3\x03" + std::string(2, '\0');
+  for (int shift : {21, 14, 7, 0}) {
+    tag += static_cast<char>((frames.size() >> shift) & 0x7F);
+  }
+  return tag + frames;
+}
+
+// Frames whose declared encoding is none of the four give a clean text or
+// none, and the rest of the tag still counts.
+TEST_F(MediaParserTest, FrameWithAnUnknownEncodingIsReadSafely) {
+  HostCodePage host("UTF-8");
+  TempDir dir;
+  std::string song = ReadFile(Fixture("song_id3v1_cp1251.mp3"));
+  for (char encoding : {'\x04', '\x65', '\xFF'}) {
+    std::string path = dir.File("odd.mp3");
+    WriteFile(path, Id3v2Tag(Id3v2Frame("TIT2", encoding,
+                                        std::string("AB\0CD\xFF\xFE", 7)) +
+                             Id3v2Frame("TPE1", '\0', "Kino")) +
+                        song);
+    ASSERT_TRUE(Parse(path)) << reason_;
+    EXPECT_TRUE(IsValidUTF8(media_.record.szTitle));
+    EXPECT_STREQ(media_.record.szArtist, "Kino");
+    EXPECT_EQ(media_.record.year, 1999);  // from the ID3v1 tag
+  }
+}
+
 // What a file is depends on its content: a renamed MP3 is an MP3, a text
 // named like a photo is nothing.
 TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {

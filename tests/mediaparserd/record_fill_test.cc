@@ -139,6 +139,22 @@ TEST(RecordFillTest, OutOfRangeNumbersAreBoundedToTheirFields) {
   EXPECT_EQ(Fill(MediaKind::kVideo, container).duration, 0.0f);
 }
 
+TEST(RecordFillTest, NamesThatAreNotUTF8AreLeftOut) {
+  HostCodePage host("UTF-8");
+  ContainerFacts container;
+  container.format = "mp\xFF";
+  container.streams = {Stream(Type::kAudio, "fl\xE9" "c"),
+                       Stream(Type::kVideo, "")};
+  FileFacts file = File();
+  file.fs_uuid = "1234-\xC0\x80";
+  __tag_QUVA_MEDIA_INFO r =
+      Fill(MediaKind::kVideo, container, nullptr, nullptr, file);
+  EXPECT_STREQ(r.szContainerType, "");
+  EXPECT_STREQ(r.szAudioCodec, "");
+  EXPECT_STREQ(r.szVideoCodec, "");
+  EXPECT_STREQ(r.szFsUUID, "");
+}
+
 TEST(RecordFillTest, MusicWithoutStreamsHasNoTechnicalFields) {
   HostCodePage host("windows-1252");
   ContainerFacts container;
