@@ -18,7 +18,8 @@
 #   BENCH_NO_STRACE=1  skip the system-call counts
 #
 # Every step runs under `timeout`; with the defaults the whole script takes
-# about three minutes on two cores. Sockets live under /tmp and are removed;
+# about five minutes on two cores (the media-parser comparison, run by
+# bench/mediaparser_bench.sh, about two of them). Sockets live under /tmp and are removed;
 # so are the task-queue benchmark's key file and message queues, also when it
 # is interrupted. The spool benchmark writes its queues (up to 5.5 MB each)
 # under /tmp and under the working directory, and removes them.
@@ -143,4 +144,8 @@ done
 
 echo
 timeout 600 bash "$(dirname "$0")/../bench/scan_bench.sh" "$build" || status=1
+
+echo
+echo "######## media-parser daemon: floor, ffprobe, MiniDLNA, memory"
+timeout 1200 bash "$(dirname "$0")/../bench/mediaparser_bench.sh" "$build" || status=1
 exit $status

@@ -4,7 +4,8 @@
 set -euo pipefail
 packages=(cmake make g++ clang libclang-rt-14-dev pkg-config libjsoncpp-dev
           libevent-dev libicu-dev libgtest-dev libgmock-dev libbenchmark-dev
-          python3 strace time)
+          python3 strace time
+          libavformat-dev libavcodec-dev libavutil-dev libtag1-dev libexiv2-dev libblkid-dev ffmpeg libimage-exiftool-perl minidlna)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" \
