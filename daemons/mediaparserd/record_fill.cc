@@ -121,11 +121,41 @@ void PutUTF16(char* field, int32_t* flag, std::string_view units) {
   *flag = 1;
 }
 
+// Whether `byte` starts a two-byte character in the double-byte code page
+// `page` of the host's numbering (11 Shift-JIS, 12 GBK, 13 Big5, 14
+// Korean); false for the single-byte ones.
+bool IsLeadByte(int page, unsigned char byte) {
+  if (page == 11) return (byte >= 0x81 && byte <= 0x9F) || byte >= 0xE0;
+  return page >= 12 && page <= 14 && byte >= 0x81 && byte <= 0xFE;
+}
+
+// Writes 8-bit text of unknown code page into field[capacity]. Text that is
+// too long is cut where a character of the host's code page ends: a cut
+// inside a double-byte character would make the whole text fail to
+// convert, and the field fall back to a name.
+void PutLegacy(char* field, size_t capacity, std::string_view text) {
+  text = text.substr(0, text.find('\0'));
+  if (text.size() > capacity - 1 && !IsValidUTF8(text)) {
+    int page = QUVAIndexCodePageGet();
+    size_t end = 0;
+    while (end < text.size()) {
+      size_t width =
+          IsLeadByte(page, static_cast<unsigned char>(text[end])) ? 2 : 1;
+      if (end + width > capacity - 1) break;
+      end += width;
+    }
+    text = text.substr(0, end);
+  }
+  PutText(field, capacity, text);
+}
+
 // Delivers a tag text into a zeroed tag field as the file stores it (see the
 // header); `flag` is the field's UTF-16 flag.
 void PutTag(char* field, int32_t* flag, const TagText& text) {
   if (text.encoding == TagText::Encoding::kUTF16) {
     PutUTF16(field, flag, text.bytes);
+  } else if (text.encoding == TagText::Encoding::kBytes) {
+    PutLegacy(field, kMediaTagSize, text.bytes);
   } else {
     PutText(field, kMediaTagSize, text.bytes);
   }

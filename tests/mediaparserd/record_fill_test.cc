@@ -143,7 +143,9 @@ TEST(RecordFillTest, NamesThatAreNotUTF8AreLeftOut) {
   HostCodePage host("UTF-8");
   ContainerFacts container;
   container.format = "mp\xFF";
-  container.streams = {Stream(Type::kAudio, "fl\xE9" "c"),
+  container.streams = {Stream(Type::kAudio,
+                              "fl\xE9"
+                              "c"),
                        Stream(Type::kVideo, "")};
   FileFacts file = File();
   file.fs_uuid = "1234-\xC0\x80";
@@ -264,6 +266,21 @@ TEST(RecordFillTest, RawTagBytesAreReadInTheHostCodePage) {
     EXPECT_STREQ(r.szAlbumArtist, c.album_artist) << c.code_page;
     EXPECT_EQ(r.blTitleUTF16, 0);
   }
+}
+
+// A legacy text too long for its field is cut where a character of the
+// host's code page ends; cut inside one, the whole text would not convert.
+TEST(RecordFillTest, LongLegacyTextIsCutBetweenDoubleByteCharacters) {
+  HostCodePage host("windows-936");
+  std::string gbk = "x";
+  for (int i = 0; i < 150; ++i) gbk += "\xC4\xE3";  // 你
+  MusicTags tags;
+  tags.comment = Bytes(gbk);
+  __tag_QUVA_MEDIA_INFO r = Fill(MediaKind::kMusic, ContainerFacts(), &tags);
+  std::string comment = r.szComment;
+  ASSERT_GE(comment.size(), 1u + 3 * 80);  // the host's output limit cuts
+  EXPECT_EQ(comment.substr(0, 7), "x你你");
+  EXPECT_TRUE(IsValidUTF8(comment));
 }
 
 TEST(RecordFillTest, LongTextsAreCutAtACharacterBoundary) {
