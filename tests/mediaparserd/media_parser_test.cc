@@ -18,6 +18,7 @@
 #include <gtest/gtest.h>
 
 #include "media_test_util.h"
+#include "photo_exif.h"
 #include "record_fill.h"
 #include "support/unprivileged.h"
 
@@ -360,6 +361,25 @@ TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
   ASSERT_TRUE(Parse(dir.File("photo.mp4"))) << reason_;
   EXPECT_EQ(media_.kind, MediaKind::kPhoto);
   EXPECT_STREQ(media_.record.szMake, "Canon");
+}
+
+// exiv2 as Debian builds it also reads QuickTime, RIFF, Matroska and ASF:
+// those must go to libavformat without a detour through its video readers.
+TEST_F(MediaParserTest, OnlyStillImagesLookLikePhotos) {
+  struct Case {
+    const char* file;
+    bool photo;
+  } cases[] = {{"photo_exif.jpg", true},   {"photo.png", true},
+               {"video_rot90.mp4", false}, {"video.mkv", false},
+               {"song.wav", false},        {"song_lc.m4a", false},
+               {"song.ogg", false},        {"song_id3v24.mp3", false}};
+  for (const Case& c : cases) {
+    std::string head = ReadFile(Fixture(c.file)).substr(0, 4096);
+    EXPECT_EQ(LooksLikePhoto(reinterpret_cast<const uint8_t*>(head.data()),
+                             static_cast<int64_t>(head.size())),
+              c.photo)
+        << c.file;
+  }
 }
 
 // Every file that is not readable media is refused with a reason a person
