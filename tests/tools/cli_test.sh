@@ -522,6 +522,7 @@ make_media_samples() {
   cp "$fx/video_rot90.mp4" clip.mp4
   cp "$fx/photo_exif.jpg" photo.jpg
   cp "$fx/photo.png" tiny.png
+  cp "$fx/song.wav" song.wav
   cp song.mp3 renamed.mp4
   printf 'hello' >fake.png
   truncate -s 5G zeros.mp4 # sparse: no disk
@@ -572,6 +573,8 @@ case_mediainfo() {
   has out "resolutionX:     640"
   has out "szExposure:      1/125"
   ! grep -q "^szTitle:" "$WORK/out" || fail "an empty field was listed"
+  run mediainfo --socket "$sock" --raw song.wav; ok # integers stay whole
+  has out "audio_bitrate:   1411200"
   run mediainfo --socket "$sock" --all song.mp3 # empty fields as well
   ok
   has out "szDesc:          "
