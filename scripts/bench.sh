@@ -18,8 +18,9 @@
 #   BENCH_NO_STRACE=1  skip the system-call counts
 #
 # Every step runs under `timeout`; with the defaults the whole script takes
-# about four minutes on two cores (the preview benchmarks about one of
-# them). Sockets live under /tmp and are removed;
+# about six minutes on two cores (the preview benchmarks about one of them,
+# the media-parser comparison, run by bench/mediaparser_bench.sh, about
+# two). Sockets live under /tmp and are removed;
 # so are the task-queue benchmark's key file and message queues, also when it
 # is interrupted. The spool benchmark writes its queues (up to 5.5 MB each)
 # under /tmp and under the working directory, and removes them.
@@ -159,4 +160,8 @@ done
 
 echo
 timeout 600 bash "$(dirname "$0")/../bench/scan_bench.sh" "$build" || status=1
+
+echo
+echo "######## media-parser daemon: floor, ffprobe, MiniDLNA, memory"
+timeout 1200 bash "$(dirname "$0")/../bench/mediaparser_bench.sh" "$build" || status=1
 exit $status

@@ -9,9 +9,9 @@
 # checks that it removed its socket and pid file; then takes a task queue
 # through create, push, count, pop and delete (`quvaidx taskq`), and scans
 # a sample share with the index's rules (`quvaidx scan`), and asks the
-# example media-parser daemon about sample files (`quvaidx mediainfo`,
-# `quvaidx resolution`), and shows the road of previews
-# (scripts/demo_previews.sh). Everything
+# media-parser daemon about a real song, photo and video and a legacy tag
+# (`quvaidx mediainfo`, `quvaidx resolution`), and shows the road of
+# previews (scripts/demo_previews.sh). Everything
 # it starts or creates is removed on exit, however the script ends, so it
 # can be run again at once.
 set -euo pipefail
@@ -195,23 +195,33 @@ heading "A missing folder is an error: exit status 2"
 show scan "$work/no-such-share" 2>&1
 
 heading "The media-parser daemon (daemons/mediaparserd), on a socket
-and a pid file of its own, asked about a PNG, a JPEG and an MP3"
-mediaparserd=${tool%/tools/quvaidx}/daemons/mediaparserd/quvamediaparserd
+and a pid file of its own, asked about a song, a photo and a video"
+build_dir=${tool%/tools/quvaidx}
+mediaparserd=$build_dir/daemons/mediaparserd/quvamediaparserd
 if [ ! -x "$mediaparserd" ]; then
   echo "(not built: configure with -DQUVAIDX_BUILD_DAEMONS=ON)"
 else
+  # Real media made with ffmpeg and exiftool by the tests' fixture script
+  # (a few seconds the first time, then kept in the build tree).
+  fixtures=$build_dir/tests/mediaparserd/fixtures
+  if [ ! -f "$fixtures/stamp" ]; then
+    fixtures=$build_dir/media-fixtures
+    echo "(making the sample media once: ffmpeg, exiftool)"
+    bash "$repo/tests/mediaparserd/make_fixtures.sh" "$fixtures"
+  fi
   media=$work/media
   mkdir -p "$media"
-  # A real 16x9 grey PNG, a JPEG header stating 1920x1080, an MP3 with an
-  # ID3 header: the daemon reads sizes from headers, not from names.
-  printf '\211PNG\r\n\032\n\0\0\0\rIHDR\0\0\0\020\0\0\0\011\010\0\0\0\0\036A\363\356\0\0\0\017IDATx\332ch@\003\014\203D\0\0\205\324H\001\265\010\335\324\0\0\0\0IEND\256B`\202' \
-    >"$media/cover.png"
-  printf '\377\330\377\340\0\020JFIF\0\001\001\0\0\001\0\001\0\0\377\300\0\013\010\004\070\007\200\001\001\021\0\377\331' \
-    >"$media/holiday.jpg"
-  printf 'ID3\003\0\0\0\0\0\0\377\373\220\144' >"$media/track01.mp3"
+  cp "$fixtures/song_id3v24.mp3" "$media/Track 01.mp3"
+  cp "$fixtures/photo_exif.jpg" "$media/holiday.jpg"
+  cp "$fixtures/video_rot90.mp4" "$media/clip.mp4"
+  cp "$fixtures/song_id3v1_cp1251.mp3" "$media/old-tag.mp3"
+  printf 'not a picture' >"$media/fake.png"
+  # The host's settings: this appliance's code page is windows-1251.
+  mkdir -p "$work/host-etc"
+  printf '[system]\ncode_page = windows-1251\n' >"$work/host-etc/host.conf"
   mp_sock=$work/mediaparserd.sock
-  echo "\$ quvamediaparserd --foreground --socket $mp_sock --pidfile $work/mediaparserd.pid &"
-  "$mediaparserd" --foreground --socket "$mp_sock" \
+  echo "\$ QUVA_HOST_ETC=$work/host-etc quvamediaparserd --foreground --socket $mp_sock --pidfile $work/mediaparserd.pid &"
+  QUVA_HOST_ETC=$work/host-etc "$mediaparserd" --foreground --socket "$mp_sock" \
     --pidfile "$work/mediaparserd.pid" \
     >"$work/mediaparserd.out" 2>&1 &
   mp_pid=$!
@@ -220,15 +230,20 @@ else
     sleep 0.02
   done
   cat "$work/mediaparserd.out"
-  show mediainfo --socket "$mp_sock" "$media/cover.png" "$media/holiday.jpg" \
-    "$media/track01.mp3"
+  show mediainfo --socket "$mp_sock" "$media/Track 01.mp3" "$media/holiday.jpg" \
+    "$media/clip.mp4"
   show resolution --socket "$mp_sock" "$media/holiday.jpg"
-  echo "\$ quvaidx mediainfo --json --socket $mp_sock $media/cover.png | grep -E 'table|resolution|fileSize'"
-  "$tool" mediainfo --json --socket "$mp_sock" "$media/cover.png" |
-    grep -E 'table|resolution|fileSize'
+  echo "\$ quvaidx mediainfo --json --socket $mp_sock $media/clip.mp4 | grep -E 'media_type|szVideoCodec|resolution'"
+  "$tool" mediainfo --json --socket "$mp_sock" "$media/clip.mp4" |
+    grep -E 'media_type|szVideoCodec|resolution'
 
-  heading "A missing file: the daemon says why, exit status 1"
-  show mediainfo --socket "$mp_sock" "$media/missing.jpg" 2>&1
+  heading "A legacy tag: an ID3v1 title in windows-1251 bytes, which a
+Latin-1 reader shows as \"$(printf '\317\360\350\342\345\362' | iconv -f latin1 -t utf-8 2>/dev/null || echo '?')\"; the host's code page decides"
+  show mediainfo --socket "$mp_sock" "$media/old-tag.mp3"
+
+  heading "Content, not names: a text called fake.png and a missing file are
+refused with a reason, exit status 1"
+  show mediainfo --socket "$mp_sock" "$media/fake.png" "$media/missing.jpg" 2>&1
 
   heading "Stop it with SIGTERM: it removes its socket and pid file"
   echo "\$ kill -TERM $mp_pid"

@@ -16,16 +16,21 @@
 # apt-get line to run.
 set -euo pipefail
 
-# The thumbnail daemon builds on libvips; the tests and the demo make
-# photos with the vips command, the tests also with zlib and exiftool; the
-# thumbnail benchmark runs vipsthumbnail and ImageMagick's convert.
+# The media parser builds on FFmpeg's libraries, TagLib, exiv2 and libblkid,
+# the thumbnail daemon on libvips. Media and photos for the demo, the tests
+# and the fuzzers' seeds are made on the spot with ffmpeg, exiftool and the
+# vips command (the tests also use zlib, and ffprobe and exiftool as
+# oracles); the benchmarks compare with ffprobe, MiniDLNA, vipsthumbnail and
+# ImageMagick's convert.
 build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
-       help2man libvips-dev)
-demo=(python3 libvips-tools)
-test=(libgtest-dev libgmock-dev python3 man-db systemd clang-format
-      libvips-tools zlib1g-dev libimage-exiftool-perl)
-bench=(libbenchmark-dev strace time libvips-tools imagemagick)
-fuzz=(clang libclang-rt-14-dev)
+       help2man libavformat-dev libavcodec-dev libavutil-dev libtag1-dev
+       libexiv2-dev libblkid-dev libvips-dev)
+media=(python3 ffmpeg libimage-exiftool-perl libvips-tools)
+demo=("${media[@]}")
+test=("${media[@]}" libgtest-dev libgmock-dev man-db systemd clang-format
+      zlib1g-dev)
+bench=("${media[@]}" libbenchmark-dev strace time minidlna imagemagick)
+fuzz=("${media[@]}" clang libclang-rt-14-dev)
 
 [ $# -ge 1 ] || set -- build
 packages=("${build[@]}")

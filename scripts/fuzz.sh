@@ -8,6 +8,8 @@
 # BUILD_DIR/fuzz-corpus/<target>, seeded from fuzz/corpus/<target> when that
 # exists; crash, leak and timeout inputs land in
 # BUILD_DIR/fuzz-artifacts/<target>/ and full logs in BUILD_DIR/fuzz-logs/.
+# fuzz_mediaparser_file is seeded with the media fixtures of the tests,
+# made into BUILD_DIR/media-fixtures by tests/mediaparserd/make_fixtures.sh.
 # Reproduce a finding with: BUILD_DIR/fuzz/<target> <artifact file>.
 # A run takes about the number of targets times SECONDS, plus start-up.
 # Exits non-zero when any target is missing or reports a finding.
@@ -25,7 +27,8 @@ seconds=${2:-20}
 root=$(cd "$(dirname "$0")/.." && pwd)
 build_dir=$(cd "$build_dir" && pwd)
 targets=(fuzz_event_server fuzz_recv_packet fuzz_host_ini fuzz_host_pid_file fuzz_file_rules fuzz_mediainfo fuzz_text fuzz_trim
-         fuzz_proc_parse fuzz_spool_consumer)
+         fuzz_proc_parse fuzz_spool_consumer fuzz_mediaparser_glue
+         fuzz_mediaparser_file)
 
 # Findings must stop the run with a stack trace; libFuzzer already checks for
 # leaks after inputs whose allocations do not balance.
@@ -45,14 +48,25 @@ for target in "${targets[@]}"; do
     continue
   fi
   mkdir -p "$corpus" "$artifacts" "$(dirname "$log")"
+  max_len=65536
+  [ "$target" = fuzz_mediaparser_file ] && max_len=262144 # whole media files
   args=(-max_total_time="$seconds" -rss_limit_mb=2048 -timeout=10
-        -max_len=65536 -print_final_stats=1 -artifact_prefix="$artifacts")
+        -max_len="$max_len" -print_final_stats=1 -artifact_prefix="$artifacts")
   if [ -f "$root/fuzz/$target.dict" ]; then
     args+=(-dict="$root/fuzz/$target.dict")
   fi
   dirs=("$corpus")
   if [ -d "$root/fuzz/corpus/$target" ]; then
     dirs+=("$root/fuzz/corpus/$target")
+  fi
+  if [ "$target" = fuzz_mediaparser_file ]; then
+    if ! bash "$root/tests/mediaparserd/make_fixtures.sh" \
+        "$build_dir/media-fixtures" >"$log" 2>&1; then
+      echo "$target: no seed files (see $log)" >&2
+      failed+=("$target")
+      continue
+    fi
+    dirs+=("$build_dir/media-fixtures")
   fi
   # The outer time limit only guards against a fuzzer that stops answering.
   status=0

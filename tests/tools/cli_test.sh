@@ -538,63 +538,94 @@ case_stats() {
 
 # Sample headers: PNG 3x2, JPEG (APP0, SOF0 640x480), GIF 320x240, MP3 (ID3),
 # and a JPEG whose APP0 length runs past the end of the file.
+# The media fixtures of tests/mediaparserd ($MEDIA_FIXTURES), under the names
+# the tests use, and files that are no media.
 make_media_samples() {
-  printf '\211PNG\015\012\032\012\000\000\000\015IHDR\000\000\000\003\000\000\000\002\010\002\000\000\000\022\026\361M\000\000\000\000IEND\256B`\202' >tiny.png
-  printf '\377\330\377\340\000\020JFIF\000\001\001\000\000\001\000\001\000\000\377\300\000\013\010\001\340\002\200\001\001\021\000\377\331' >photo.jpg
-  printf 'GIF89a\100\001\360\000\000\000\000;' >anim.gif
-  printf 'ID3\003\000\000\000\000\000\000\377\373\220\144' >song.mp3
-  printf '\377\330\377\340\377\360JFIF' >broken.JPG
+  local fx=${MEDIA_FIXTURES:-}
+  [ -f "$fx/stamp" ] || fail "MEDIA_FIXTURES does not name the media fixtures"
+  cp "$fx/song_id3v24.mp3" song.mp3
+  cp "$fx/song_id3v1_cp1251.mp3" legacy.mp3
+  cp "$fx/video_rot90.mp4" clip.mp4
+  cp "$fx/photo_exif.jpg" photo.jpg
+  cp "$fx/photo.png" tiny.png
+  cp "$fx/song.wav" song.wav
+  cp song.mp3 renamed.mp4
+  printf 'hello' >fake.png
+  truncate -s 5G zeros.mp4 # sparse: no disk
+  mkfifo fifo.mp3
+  mkdir album.png
 }
 
 # The tool's mediainfo and resolution commands against the media parser
-# daemon, $MEDIAPARSERD.
+# daemon, $MEDIAPARSERD, with the host's code page at windows-1251.
 case_mediainfo() {
   local sock=$WORK/mp.sock
   [ -x "${MEDIAPARSERD:-}" ] || fail "MEDIAPARSERD does not name the daemon"
   cd "$WORK"
   make_media_samples
+  mkdir -p "$QUVA_HOST_ETC"
+  printf '[system]\ncode_page = windows-1251\n' >"$QUVA_HOST_ETC/host.conf"
   run mediainfo --socket "$WORK/none.sock" --attempts 1 tiny.png
   expect_error "quvaidx mediainfo: no reply from the media parser on $WORK/none.sock after 1 attempt"
   run resolution --socket "$WORK/none.sock" --attempts 1 tiny.png
   expect_error "quvaidx resolution: no reply from the media parser"
   start mp "quvamediaparserd: listening on $sock" "$MEDIAPARSERD" \
     --foreground --socket "$sock" --pidfile "$WORK/mp.pid"
+  # The readable view: labelled lines of what each file holds.
+  run mediainfo --socket "$sock" song.mp3 clip.mp4 photo.jpg legacy.mp3; ok
+  for line in "song.mp3" "  Title        Überschrift ✓" "  Track        3" \
+      "  Duration     0:01" "  Audio        MP3 32 kb/s 22.05 kHz mono" \
+      "  Covers       1" "  Video        H.264 High 320x240 25 fps" \
+      "  Rotation     90° clockwise" "  Camera       Canon EOS 5D Mark IV" \
+      "  Exposure     1/125 s, f/2.8, ISO 400" "  Picture      640x480" \
+      "  Title        Привет" "  Artist       Кино"; do
+    has out "$line"
+  done
+  # The daemon reads the content; the name only names the media table.
+  run mediainfo --socket "$sock" renamed.mp4; ok
+  has out "  Type         music (the name says video)"
   # Relative names are sent as absolute paths.
-  run mediainfo --socket "$sock" --json tiny.png photo.jpg anim.gif song.mp3 \
-    broken.JPG
-  ok
-  json '[[r["file"], r["table"], m["szPath"], m["szName"], m["resolutionX"],
-    m["resolutionY"], m["fileSize"], m["szContainerType"], len(m)] for r in d
-    for m in [r["media"]]] == [[n, t, os.path.abspath(n), n, int(w), int(h),
-    os.path.getsize(n), c, 47] for n, t, w, h, c in map(str.split, A[1:])]
-    and d[0]["media"]["szMDate"] == A[0]' "$(date -r tiny.png '+%F %T')" \
-    "tiny.png photo 3 2 image2" "photo.jpg photo 640 480 image2" \
-    "anim.gif photo 320 240 gif" "song.mp3 music 0 0 mp3" \
-    "broken.JPG photo 0 0 image2"
-  run mediainfo --socket "$sock" photo.jpg; ok
+  run mediainfo --socket "$sock" --json song.mp3 photo.jpg clip.mp4; ok
+  json '[[r["file"], r["table"], r["media_type"], m["szPath"], m["szName"],
+    m["fileSize"], m["szContainerType"], len(m)] for r in d
+    for m in [r["media"]]] == [[n, t, t, os.path.abspath(n), n,
+    os.path.getsize(n), c, 47] for n, t, c in map(str.split, A[1:])]
+    and d[0]["media"]["szMDate"] == A[0]' "$(date -r song.mp3 '+%F %T')" \
+    "song.mp3 music mp3" "photo.jpg photo image2" \
+    "clip.mp4 video mov,mp4,m4a,3gp,3g2,mj2"
+  # The raw view of the record's fields.
+  run mediainfo --socket "$sock" --raw photo.jpg; ok
   has out "szPath:          $WORK/photo.jpg"
   has out "resolutionX:     640"
+  has out "szExposure:      1/125"
   ! grep -q "^szTitle:" "$WORK/out" || fail "an empty field was listed"
+  run mediainfo --socket "$sock" --raw song.wav; ok # integers stay whole
+  has out "audio_bitrate:   1411200"
   run mediainfo --socket "$sock" --all song.mp3 # empty fields as well
   ok
-  has out "szTitle:         "
+  has out "szDesc:          "
+  has out "audio_bitrate:   32000"
   [ "$(grep -c : "$WORK/out")" -eq 48 ] || fail "not 48 lines"
   run resolution --socket "$sock" photo.jpg; ok "640x480"
-  run resolution --socket "$sock" --json anim.gif; ok
+  run resolution --socket "$sock" --json clip.mp4; ok
   json 'd["width"] == 320 and d["height"] == 240'
-  # Missing files; a FIFO must not block the daemon, a folder is no media.
+  # Missing files, special files and no media are refused with a reason,
+  # and the daemon goes on answering.
   run mediainfo --socket "$sock" none.jpg
   expect_error "quvaidx mediainfo: none.jpg: No such file or directory" 1
-  run resolution --socket "$sock" none.png
-  expect_error "quvaidx resolution: none.png: No such file or directory" 1
-  mkfifo fifo.mp3
-  mkdir album.png
-  run mediainfo --socket "$sock" fifo.mp3 album.png tiny.png; expect 1
+  run resolution --socket "$sock" fake.png
+  expect_error "quvaidx resolution: fake.png: not a media file" 1
+  run mediainfo --socket "$sock" fifo.mp3 album.png fake.png zeros.mp4 tiny.png
+  expect 1
   has err "quvaidx mediainfo: fifo.mp3: not a regular file"
   has err "quvaidx mediainfo: album.png: not a regular file"
-  has out "resolutionX:     3"
-  run send --socket "$sock" -c '{"command":"GET_MEDIA_INFO","path":"tiny.png"}'
+  has err "quvaidx mediainfo: fake.png: not a media file"
+  has err "quvaidx mediainfo: zeros.mp4: not a media file"
+  has out "  Picture      200x100"
+  run send --socket "$sock" -c '{"command":"GET_MEDIA_INFO","path":"song.mp3"}'
   expect 1 '{"reason":"path is not absolute","success":false}'
+  run send --socket "$sock" -c "{\"command\":\"GET_VIDEO_METADATA\",\"path\":\"$WORK/song.mp3\"}"
+  expect 1 '{"reason":"not a video","success":false}'
 }
 
 "case_$CASE"

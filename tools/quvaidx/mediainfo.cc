@@ -9,7 +9,8 @@
 // MediaInfoJson2Object, and "width" and "height" are read as 32-bit
 // integers (0 when missing or out of range). Only the number of connection
 // attempts differs: the library's calls wait up to half an hour for a
-// daemon, the tool --attempts (default 3) seconds.
+// daemon, the tool --attempts (default 3) seconds. For a video, the readable
+// view also asks GET_VIDEO_METADATA, for its rotation and pixel aspect.
 #include <errno.h>
 #include <getopt.h>
 #include <limits.h>
@@ -23,6 +24,7 @@
 
 #include "cli.h"
 #include "commands.h"
+#include "media_view.h"
 #include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/media_type.h"
@@ -89,16 +91,17 @@ constexpr const char* kFields[] = {
 struct Options {
   std::string socket;  // the media parser's socket
   int attempts = kDefaultAttempts;
-  bool json = false;  // print JSON instead of "name: value" lines
-  bool all = false;   // list fields that are 0 or empty too
+  bool json = false;  // print JSON instead of the readable view
+  bool raw = false;   // print "name: value" lines of the record's fields
+  bool all = false;   // raw, and list fields that are 0 or empty too
 };
 
 void PrintHelp(const char* name) {
   bool info = strcmp(name, "mediainfo") == 0;
   printf(info ? "Usage: quvaidx mediainfo [OPTIONS] FILE...\n\n"
                 "Asks the media-parser daemon for the media record of each\n"
-                "FILE and prints its fields that are set, one \"name: value\"\n"
-                "line each, after the media table the index files it in.\n"
+                "FILE and shows what it holds: title, artist, duration,\n"
+                "codecs, camera and the like, one labelled line each.\n"
               : "Usage: quvaidx resolution [OPTIONS] FILE\n\n"
                 "Asks the media-parser daemon for the pixel size of FILE and\n"
                 "prints it as WIDTHxHEIGHT (0x0 when the daemon does not know\n"
@@ -120,8 +123,13 @@ void PrintHelp(const char* name) {
       "refused one (its reason is printed), 2 on a usage error or when no\n"
       "reply could be obtained.\n",
       info ? ": an array of {\"file\", \"table\", \"media\"}" : "",
-      info ? "      --all           also list fields that are 0 or empty\n"
-           : "",
+      info
+          ? "  -r, --raw           list the record's fields that are set, one\n"
+            "                      \"name: value\" line each, after the media\n"
+            "                      table of the file's extension\n"
+            "      --all           as --raw, with the fields that are 0 or\n"
+            "                      empty\n"
+          : "",
       DaemonInfo().get("mediad", "sock").c_str(), kDefaultAttempts);
 }
 
@@ -232,7 +240,7 @@ void PrintRecord(const std::string& file, const Json::Value& media, bool all) {
     std::string text;
     if (value.isString()) {
       text = value.asString();
-    } else if (value.isDouble()) {
+    } else if (value.type() == Json::realValue) {
       char buffer[64];
       snprintf(buffer, sizeof(buffer), "%g", value.asDouble());
       text = buffer;
@@ -252,6 +260,7 @@ int ParseOptions(int argc, char** argv, Options* options) {
   static const struct option kOptions[] = {
       {"json", no_argument, nullptr, 'j'},
       {"all", no_argument, nullptr, 'A'},
+      {"raw", no_argument, nullptr, 'r'},
       {"socket", required_argument, nullptr, 's'},
       {"attempts", required_argument, nullptr, 'a'},
       {"verbose", no_argument, nullptr, 'v'},
@@ -263,14 +272,18 @@ int ParseOptions(int argc, char** argv, Options* options) {
   optind = 0;
   opterr = 0;
   int c;
-  while ((c = getopt_long(argc, argv, ":js:a:vh", kOptions, nullptr)) != -1) {
+  while ((c = getopt_long(argc, argv, ":jrs:a:vh", kOptions, nullptr)) != -1) {
     switch (c) {
       case 'j':
         options->json = true;
         break;
       case 'A':
         if (strcmp(name, "mediainfo") != 0) return OptionError(name, '?', argv);
-        options->all = true;
+        options->all = options->raw = true;
+        break;
+      case 'r':
+        if (strcmp(name, "mediainfo") != 0) return OptionError(name, '?', argv);
+        options->raw = true;
         break;
       case 's':
         options->socket = optarg;
@@ -317,15 +330,35 @@ int RunMediaInfo(int argc, char** argv) {
     Json::Value media;
     MediaInfoObject2Json(record, media);
     std::string file = argv[i];
+    const Json::Value& kind = reply["media_type"];
     if (options.json) {
       Json::Value& entry = records.append(Json::Value(Json::objectValue));
       entry["file"] = file;
       entry["table"] = TableOf(file);
+      if (kind.isString()) entry["media_type"] = kind;
       entry["media"].swap(media);
       continue;
     }
     if (i > optind) printf("\n");
-    PrintRecord(file, media, options.all);
+    if (options.raw) {
+      PrintRecord(file, media, options.all);
+      continue;
+    }
+    MediaViewExtras extras;
+    extras.kind = kind.isString() ? kind.asString() : "";
+    extras.table = TableOf(file);
+    if (extras.kind == "video") {
+      Json::Value answer;
+      if (Ask(argv[0], options, "GET_VIDEO_METADATA", file, &answer) ==
+          kExitOk) {
+        VideoMetadataJson2Object(answer["metadata"], extras.video);
+        extras.has_video_metadata = true;
+      }
+    }
+    printf("%s\n", file.c_str());
+    for (const std::string& line : MediaViewLines(record, extras)) {
+      printf("  %s\n", line.c_str());
+    }
   }
   if (options.json) PrintJson(records, false);
   fflush(stdout);

@@ -1,0 +1,519 @@
+// The media parser on real files: the fixtures of make_fixtures.sh against
+// the oracles (ffprobe for the technical fields, exiftool for EXIF), legacy
+// tags under the host's code pages, and hostile files.
+#include "media_parser.h"
+
+#include <fcntl.h>
+#include <math.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <string>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+#include "media_test_util.h"
+#include "photo_exif.h"
+#include "record_fill.h"
+#include "support/unprivileged.h"
+
+namespace mediaparserd {
+namespace {
+
+using quvaidx::test::FdLeakCheck;
+using quvaidx::test::ReadFile;
+using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+using test::CommandJson;
+using test::CommandOutput;
+using test::Fixture;
+using test::HostCodePage;
+using test::IsValidUTF8;
+using test::Quoted;
+
+class MediaParserTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() { InitMediaLibraries(kDefaultMaxAlloc); }
+
+  // Parses `path`; on failure the reason is in reason_.
+  bool Parse(const std::string& path, const ParserOptions& options = {}) {
+    MediaParser parser(options);
+    reason_.clear();
+    return parser.Parse(path, &media_, &reason_);
+  }
+
+  // Parses a fixture that must be read.
+  const __tag_QUVA_MEDIA_INFO& MustParse(const std::string& path) {
+    EXPECT_TRUE(Parse(path)) << path << ": " << reason_;
+    return media_.record;
+  }
+
+  ParsedMedia media_;
+  std::string reason_;
+};
+
+// ffprobe's integer fields arrive as numbers or as decimal texts.
+int64_t Number(const Json::Value& value) {
+  if (value.isIntegral()) return value.asInt64();
+  if (value.isString()) return strtoll(value.asCString(), nullptr, 10);
+  return 0;
+}
+
+// "25/1" as its terms.
+std::pair<int64_t, int64_t> Ratio(const Json::Value& value, char separator) {
+  std::string text = value.asString();
+  size_t at = text.find(separator);
+  if (at == std::string::npos) return {0, 0};
+  return {strtoll(text.c_str(), nullptr, 10),
+          strtoll(text.c_str() + at + 1, nullptr, 10)};
+}
+
+// The first stream of a kind in ffprobe's answer that is not a cover.
+Json::Value ProbeStream(const Json::Value& probe, const char* kind) {
+  for (const Json::Value& stream : probe["streams"]) {
+    if (stream["codec_type"].asString() == kind &&
+        Number(stream["disposition"]["attached_pic"]) == 0) {
+      return stream;
+    }
+  }
+  return Json::Value();
+}
+
+// ffprobe's profile names of the H.264 fixtures.
+int64_t H264Profile(const std::string& name) {
+  if (name == "High") return 100;
+  if (name == "Main") return 77;
+  if (name == "Constrained Baseline") return 578;
+  return -1;
+}
+
+// Every technical field against `ffprobe -of json`, and the tags that
+// libavformat reads correctly (UTF-8 and UTF-16 ones) against its tags.
+TEST_F(MediaParserTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
+  HostCodePage host("UTF-8");
+  const char* fixtures[] = {"song_id3v24.mp3", "song_id3v23_utf16.mp3",
+                            "song.flac",       "song.ogg",
+                            "song_lc.m4a",     "song_he.m4a",
+                            "song.wav",        "video_rot90.mp4",
+                            "video.mkv",       "photo.png"};
+  for (const char* name : fixtures) {
+    SCOPED_TRACE(name);
+    std::string path = Fixture(name);
+    const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+    Json::Value probe = CommandJson(
+        "ffprobe -v error -show_format -show_streams -of json " + Quoted(path));
+    ASSERT_TRUE(probe.isObject());
+    const Json::Value& format = probe["format"];
+    EXPECT_EQ(r.szContainerType,
+              ContainerTypeName(format["format_name"].asString()));
+    EXPECT_EQ(r.fileSize, static_cast<uint64_t>(Number(format["size"])));
+    EXPECT_TRUE(IsValidUTF8(r.szFsUUID));
+    int covers = 0;
+    for (const Json::Value& stream : probe["streams"]) {
+      covers += Number(stream["disposition"]["attached_pic"]) != 0;
+    }
+    Json::Value audio = ProbeStream(probe, "audio");
+    Json::Value video = ProbeStream(probe, "video");
+    if (media_.kind == MediaKind::kPhoto) {
+      EXPECT_EQ(r.resolutionX, Number(video["width"]));
+      EXPECT_EQ(r.resolutionY, Number(video["height"]));
+      continue;
+    }
+    EXPECT_NEAR(r.duration, atof(format["duration"].asCString()), 1e-3);
+    EXPECT_EQ(r.frame_bitrate, Number(format["bit_rate"]));
+    EXPECT_EQ(r.coverCount, covers);
+    EXPECT_EQ(media_.kind,
+              video.isNull() ? MediaKind::kMusic : MediaKind::kVideo);
+    if (!audio.isNull()) {
+      EXPECT_EQ(r.frequency, Number(audio["sample_rate"]));
+      EXPECT_EQ(r.channel, Number(audio["channels"]));
+      int64_t rate = Number(audio["bit_rate"]);
+      if (rate == 0 && video.isNull()) rate = Number(format["bit_rate"]);
+      EXPECT_EQ(r.audio_bitrate, rate);
+      std::string codec = audio["codec_name"].asString();
+      if (codec == "aac") {
+        // The HE-AAC fixture signals SBR explicitly but carries no SBR data,
+        // so ffprobe's decoder reports LC; its doubled sample rate shows the
+        // signalling.
+        codec = audio["profile"].asString() == "HE-AAC" ||
+                        std::string(name) == "song_he.m4a"
+                    ? "aac_he"
+                    : "aac_lc";
+      }
+      EXPECT_EQ(r.szAudioCodec, codec);
+    }
+    if (!video.isNull()) {
+      EXPECT_EQ(r.resolutionX, Number(video["width"]));
+      EXPECT_EQ(r.resolutionY, Number(video["height"]));
+      EXPECT_EQ(r.szVideoCodec, video["codec_name"].asString());
+      EXPECT_EQ(r.videoProfile, H264Profile(video["profile"].asString()));
+      EXPECT_EQ(r.videoLevel, Number(video["level"]));
+      EXPECT_EQ(r.video_bitrate, Number(video["bit_rate"]));
+      auto [num, den] = Ratio(video["avg_frame_rate"], '/');
+      EXPECT_EQ(r.frame_rate_num, num);
+      EXPECT_EQ(r.frame_rate_den, den);
+      int rotation = 0;
+      for (const Json::Value& side : video["side_data_list"]) {
+        if (side.isMember("rotation")) {
+          rotation = ((-side["rotation"].asInt()) % 360 + 360) % 360;
+        }
+      }
+      EXPECT_EQ(media_.video.rotation, rotation);
+      auto [sar_w, sar_h] = Ratio(video["sample_aspect_ratio"], ':');
+      if (sar_w <= 0 || sar_h <= 0) sar_w = sar_h = 1;
+      EXPECT_EQ(media_.video.parWidth, sar_w);
+      EXPECT_EQ(media_.video.parHeight, sar_h);
+    }
+    // Tags: the container's, or (Ogg) the audio stream's.
+    Json::Value tags = format["tags"];
+    if (tags.isNull()) tags = audio["tags"];
+    auto tag = [&tags](const char* key) {
+      for (const std::string& member : tags.getMemberNames()) {
+        if (strcasecmp(member.c_str(), key) == 0)
+          return tags[member].asString();
+      }
+      return std::string();
+    };
+    EXPECT_EQ(r.szTitle, tag("title"));
+    EXPECT_EQ(r.szArtist, tag("artist"));
+    EXPECT_EQ(r.szAlbum, tag("album"));
+    EXPECT_EQ(r.szAlbumArtist, tag("album_artist").empty()
+                                   ? tag("albumartist")
+                                   : tag("album_artist"));
+    EXPECT_EQ(r.szGenre, tag("genre"));
+    EXPECT_EQ(r.szComposer, tag("composer"));
+    EXPECT_EQ(r.szComment, tag("comment"));
+    EXPECT_EQ(r.track, atoi(tag("track").c_str()));
+    EXPECT_EQ(r.disc, atoi(tag("disc").c_str()));
+    EXPECT_EQ(r.year, atoi(tag("date").c_str()));
+  }
+}
+
+TEST_F(MediaParserTest, PhotoFieldsAgreeWithExiftool) {
+  std::string path = Fixture("photo_exif.jpg");
+  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+  Json::Value exif = CommandJson("exiftool -j " + Quoted(path))[0];
+  ASSERT_TRUE(exif.isObject());
+  EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+  EXPECT_EQ(r.szMake, exif["Make"].asString());
+  EXPECT_EQ(r.szModel, exif["Model"].asString());
+  EXPECT_EQ(r.szExposure, exif["ExposureTime"].asString());
+  EXPECT_DOUBLE_EQ(atof(r.szAperture), exif["FNumber"].asDouble());
+  EXPECT_EQ(r.iso, exif["ISO"].asInt());
+  std::string taken = exif["DateTimeOriginal"].asString();
+  taken[4] = taken[7] = '-';
+  EXPECT_EQ(r.szTakenTime, taken);
+  EXPECT_EQ(r.resolutionX, exif["ImageWidth"].asInt());
+  EXPECT_EQ(r.resolutionY, exif["ImageHeight"].asInt());
+  EXPECT_STREQ(r.szContainerType, "image2");
+  EXPECT_EQ(media_.orientation, 6);     // "Rotate 90 CW"
+  EXPECT_EQ(media_.video.rotation, 0);  // only videos are turned
+}
+
+TEST_F(MediaParserTest, FileFieldsComeFromTheFileAndItsFileSystem) {
+  std::string path = Fixture("song.ogg");
+  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+  struct stat status;
+  ASSERT_EQ(stat(path.c_str(), &status), 0);
+  EXPECT_EQ(r.szPath, path);
+  EXPECT_STREQ(r.szName, "song.ogg");
+  char date[32];
+  strftime(date, sizeof(date), "%Y-%m-%d %H:%M:%S",
+           localtime(&status.st_mtime));
+  EXPECT_STREQ(r.szDate, date);
+  EXPECT_STREQ(r.szMDate, date);
+  // The oracle: blkid probing the device node behind the file's st_dev
+  // (nothing where the device cannot be read, as in some containers).
+  std::string node = CommandOutput("sed -n 's/^DEVNAME=//p' /sys/dev/block/" +
+                                   std::to_string(major(status.st_dev)) + ":" +
+                                   std::to_string(minor(status.st_dev)) +
+                                   "/uevent 2>/dev/null");
+  std::string uuid;
+  if (!node.empty()) {
+    node.pop_back();
+    uuid = CommandOutput("blkid -p -s UUID -o value " + Quoted("/dev/" + node) +
+                         " 2>/dev/null");
+    if (!uuid.empty()) uuid.pop_back();
+  }
+  EXPECT_EQ(r.szFsUUID, uuid);
+}
+
+TEST_F(MediaParserTest, FileSystemWithoutADeviceHasNoUuid) {
+  if (access("/dev/shm", W_OK) != 0) GTEST_SKIP() << "no /dev/shm";
+  char dir[] = "/dev/shm/quvaidx-test-XXXXXX";
+  ASSERT_NE(mkdtemp(dir), nullptr);
+  std::string copy = std::string(dir) + "/song.ogg";
+  WriteFile(copy, ReadFile(Fixture("song.ogg")));
+  bool parsed = Parse(copy);
+  unlink(copy.c_str());
+  rmdir(dir);
+  ASSERT_TRUE(parsed) << reason_;
+  EXPECT_STREQ(media_.record.szFsUUID, "");
+}
+
+struct LegacyCase {
+  const char* file;
+  const char* code_page;
+  const char* title;
+  const char* artist;
+  const char* album;
+  const char* comment;
+};
+
+// The texts of ID3v1 tags and of ID3v2 frames declared Latin-1 are decoded
+// in the host's code page, not read as Latin-1.
+TEST_F(MediaParserTest, LegacyTagsAreReadInTheHostCodePage) {
+  const LegacyCase cases[] = {
+      {"song_id3v1_cp1251.mp3", "windows-1251", "Привет", "Кино",
+       "Группа крови", "Комментарий"},
+      {"song_id3v23_cp1251.mp3", "windows-1251", "Привет", "Кино",
+       "Группа крови", "Комментарий"},
+      {"song_gbk.mp3", "windows-936", "你好", "王菲", "天空", "评论"},
+      // ID3v1 cuts the comment to 28 bytes; the ID3v2 frame wins anyway.
+      {"song_id3v23_utf16.mp3", "windows-1251", "Привет, мир", "Zoë",
+       "The Album", "A comment"},
+  };
+  for (const LegacyCase& c : cases) {
+    SCOPED_TRACE(c.file);
+    HostCodePage host(c.code_page);
+    const __tag_QUVA_MEDIA_INFO& r = MustParse(Fixture(c.file));
+    EXPECT_STREQ(r.szTitle, c.title);
+    EXPECT_STREQ(r.szArtist, c.artist);
+    EXPECT_STREQ(r.szAlbum, c.album);
+    EXPECT_STREQ(r.szComment, c.comment);
+  }
+}
+
+// With the code page at UTF-8, legacy bytes cannot be decoded: the title
+// becomes the file's name, the album its folder's, the rest empty; never
+// invalid UTF-8.
+TEST_F(MediaParserTest, LegacyTagsFallBackWithoutTheirCodePage) {
+  HostCodePage host("UTF-8");
+  std::string path = Fixture("song_id3v1_cp1251.mp3");
+  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+  std::string folder = path.substr(0, path.rfind('/'));
+  folder = folder.substr(folder.rfind('/') + 1);
+  EXPECT_STREQ(r.szTitle, "song_id3v1_cp1251");
+  EXPECT_EQ(r.szAlbum, folder);
+  EXPECT_STREQ(r.szArtist, "");
+  EXPECT_STREQ(r.szComment, "");
+  EXPECT_STREQ(r.szGenre, "Rock");  // ID3v1 genre 17, by its name
+  EXPECT_EQ(r.year, 1999);
+  EXPECT_EQ(r.track, 7);
+}
+
+// An ID3v2.3 text frame: `id`, its encoding byte, `text`.
+std::string Id3v2Frame(const char* id, char encoding, const std::string& text) {
+  std::string body = std::string(1, encoding) + text;
+  std::string frame = id;
+  for (int shift : {24, 16, 8, 0}) {
+    frame += static_cast<char>(body.size() >> shift);
+  }
+  return frame + std::string(2, '\0') + body;
+}
+
+// An ID3v2.3 tag around `frames`.
+std::string Id3v2Tag(const std::string& frames) {
+  std::string tag = "ID3\x03" + std::string(2, '\0');
+  for (int shift : {21, 14, 7, 0}) {
+    tag += static_cast<char>((frames.size() >> shift) & 0x7F);
+  }
+  return tag + frames;
+}
+
+// Frames whose declared encoding is none of the four give a clean text or
+// none, and the rest of the tag still counts.
+TEST_F(MediaParserTest, FrameWithAnUnknownEncodingIsReadSafely) {
+  HostCodePage host("UTF-8");
+  TempDir dir;
+  std::string song = ReadFile(Fixture("song_id3v1_cp1251.mp3"));
+  for (char encoding : {'\x04', '\x65', '\xFF'}) {
+    std::string path = dir.File("odd.mp3");
+    WriteFile(path, Id3v2Tag(Id3v2Frame("TIT2", encoding,
+                                        std::string("AB\0CD\xFF\xFE", 7)) +
+                             Id3v2Frame("TPE1", '\0', "Kino")) +
+                        song);
+    ASSERT_TRUE(Parse(path)) << reason_;
+    EXPECT_TRUE(IsValidUTF8(media_.record.szTitle));
+    EXPECT_STREQ(media_.record.szArtist, "Kino");
+    EXPECT_EQ(media_.record.year, 1999);  // from the ID3v1 tag
+  }
+}
+
+// What a file is depends on its content: a renamed MP3 is an MP3, a text
+// named like a photo is nothing.
+TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
+  TempDir dir;
+  WriteFile(dir.File("song.mp4"), ReadFile(Fixture("song_id3v24.mp3")));
+  WriteFile(dir.File("clip.mp3"), ReadFile(Fixture("video.mkv")));
+  WriteFile(dir.File("photo.mp4"), ReadFile(Fixture("photo_exif.jpg")));
+  ASSERT_TRUE(Parse(dir.File("song.mp4"))) << reason_;
+  EXPECT_STREQ(media_.record.szContainerType, "mp3");
+  EXPECT_EQ(media_.kind, MediaKind::kMusic);
+  ASSERT_TRUE(Parse(dir.File("clip.mp3"))) << reason_;
+  EXPECT_EQ(media_.kind, MediaKind::kVideo);
+  EXPECT_STREQ(media_.record.szContainerType, "matroska,webm");
+  ASSERT_TRUE(Parse(dir.File("photo.mp4"))) << reason_;
+  EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+  EXPECT_STREQ(media_.record.szMake, "Canon");
+}
+
+// exiv2 as Debian builds it also reads QuickTime, RIFF, Matroska and ASF:
+// those must go to libavformat without a detour through its video readers.
+TEST_F(MediaParserTest, OnlyStillImagesLookLikePhotos) {
+  struct Case {
+    const char* file;
+    bool photo;
+  } cases[] = {{"photo_exif.jpg", true},   {"photo.png", true},
+               {"video_rot90.mp4", false}, {"video.mkv", false},
+               {"song.wav", false},        {"song_lc.m4a", false},
+               {"song.ogg", false},        {"song_id3v24.mp3", false}};
+  for (const Case& c : cases) {
+    std::string head = ReadFile(Fixture(c.file)).substr(0, 4096);
+    EXPECT_EQ(LooksLikePhoto(reinterpret_cast<const uint8_t*>(head.data()),
+                             static_cast<int64_t>(head.size())),
+              c.photo)
+        << c.file;
+  }
+}
+
+// Every file that is not readable media is refused with a reason a person
+// can read, never answered with a zeroed record.
+TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
+  TempDir dir;
+  FdLeakCheck fds;
+  WriteFile(dir.File("fake.png"), "hello");
+  WriteFile(dir.File("zeros.mp3"), std::string(1 << 20, '\0'));
+  WriteFile(dir.File("empty.jpg"), "");
+  std::string mp4 = ReadFile(Fixture("video_rot90.mp4"));
+  WriteFile(dir.File("cut.mp4"), mp4.substr(0, 200));  // inside its header
+  size_t mdat = mp4.find("mdat") - 4;  // the fixture's moov comes before it
+  WriteFile(dir.File("nomoov.mp4"), mp4.substr(0, 40) + mp4.substr(mdat));
+  std::string jpeg = ReadFile(Fixture("photo_exif.jpg"));
+  WriteFile(dir.File("cut.jpg"), jpeg.substr(0, 40));
+  ASSERT_EQ(mkfifo(dir.File("fifo.mp3").c_str(), 0600), 0);
+  ASSERT_EQ(mkdir(dir.File("album.png").c_str(), 0700), 0);
+  ASSERT_EQ(symlink("/dev/zero", dir.File("zero.mp3").c_str()), 0);
+  struct Case {
+    std::string path;
+    const char* reason;  // the start of the reason
+  } cases[] = {
+      {dir.File("fake.png"), "not a media file"},
+      {dir.File("zeros.mp3"), "not a media file"},
+      {dir.File("empty.jpg"), "empty file"},
+      {dir.File("cut.mp4"), "no audio or video stream"},
+      {dir.File("nomoov.mp4"), "damaged media file (mov,mp4,m4a,3gp,3g2,mj2: "},
+      {dir.File("cut.jpg"), "damaged image ("},
+      {dir.File("fifo.mp3"), "not a regular file"},
+      {dir.File("album.png"), "not a regular file"},
+      {dir.File("zero.mp3"), "not a regular file"},
+      {dir.File("none.mp3"), "No such file or directory"},
+      {"relative/song.mp3", "path is not absolute"},
+      {std::string("/tmp/a\0b.mp3", 12), "path holds a zero byte"},
+      {"/" + std::string(5000, 'a'), "path too long"},
+  };
+  for (const Case& c : cases) {
+    EXPECT_FALSE(Parse(c.path)) << c.path;
+    EXPECT_EQ(reason_.rfind(c.reason, 0), 0u) << c.path << ": " << reason_;
+  }
+  EXPECT_TRUE(fds.NoLeak());
+}
+
+// A file cut after its header still tells what the header tells.
+TEST_F(MediaParserTest, TruncatedFilesTellWhatTheirHeadersTell) {
+  TempDir dir;
+  HostCodePage host("UTF-8");
+  for (const char* name : {"video_rot90.mp4", "song.flac", "song_id3v24.mp3"}) {
+    std::string whole = ReadFile(Fixture(name));
+    std::string path = dir.File(name);
+    WriteFile(path, whole.substr(0, whole.size() / 2));
+    ASSERT_TRUE(Parse(path)) << name << ": " << reason_;
+    EXPECT_GT(media_.record.duration, 0.5f) << name;
+    EXPECT_STRNE(media_.record.szTitle, "") << name;
+  }
+}
+
+TEST_F(MediaParserTest, UnreadableFileIsRefused) {
+  TempDir dir;
+  std::string path = dir.File("secret.mp3");
+  WriteFile(path, ReadFile(Fixture("song_id3v24.mp3")));
+  ASSERT_EQ(chmod(path.c_str(), 0600), 0);
+  ASSERT_EQ(chmod(dir.path().c_str(), 0755), 0);
+  int result = quvaidx::test::RunUnprivileged([&] {
+    MediaParser parser{ParserOptions()};
+    ParsedMedia media;
+    std::string reason;
+    return !parser.Parse(path, &media, &reason) && reason == "Permission denied"
+               ? 0
+               : 1;
+  });
+  EXPECT_EQ(result, 0);
+}
+
+// Sparse files of 4 GiB and more cost no disk: a real song followed by
+// zeros is still the song; zeros alone are nothing.
+TEST_F(MediaParserTest, FilesOfFourGibibytesAndMoreAreAnswered) {
+  TempDir dir;
+  std::string song = dir.File("long.mp3");
+  WriteFile(song, ReadFile(Fixture("song_id3v1_cp1251.mp3")));
+  ASSERT_EQ(truncate(song.c_str(), (off_t{5} << 30) + 7), 0);
+  std::string zeros = dir.File("zeros.mp4");
+  WriteFile(zeros, "");
+  ASSERT_EQ(truncate(zeros.c_str(), off_t{4} << 30), 0);
+  HostCodePage host("windows-1251");
+  ASSERT_TRUE(Parse(song)) << reason_;
+  EXPECT_EQ(media_.record.fileSize, (uint64_t{5} << 30) + 7);
+  EXPECT_EQ(media_.kind, MediaKind::kMusic);
+  EXPECT_FALSE(Parse(zeros));
+  EXPECT_EQ(reason_, "not a media file");
+}
+
+TEST_F(MediaParserTest, LimitsStopTheReadingWithAReason) {
+  ParserOptions no_time;
+  no_time.read.time_ms = 0;
+  EXPECT_FALSE(Parse(Fixture("video.mkv"), no_time));
+  EXPECT_EQ(reason_, "gave up after 0 ms (time limit)");
+  ParserOptions few_bytes;
+  few_bytes.read.bytes = 8 << 10;
+  EXPECT_FALSE(Parse(Fixture("song.wav"), few_bytes));
+  EXPECT_EQ(reason_, "gave up after reading 0 MiB (read limit)");
+  few_bytes.read.bytes = 1 << 20;
+  EXPECT_TRUE(Parse(Fixture("song.wav"), few_bytes)) << reason_;
+}
+
+// A file rewritten, cut and grown by another process while it is read gets
+// an answer every time, and the parser lives on.
+TEST_F(MediaParserTest, FileChangingWhileReadIsAnswered) {
+  TempDir dir;
+  std::string path = dir.File("moving.mp4");
+  std::string video = ReadFile(Fixture("video_rot90.mp4"));
+  WriteFile(path, video);
+  std::atomic<bool> done{false};
+  std::thread writer([&] {
+    int fd = open(path.c_str(), O_WRONLY);
+    for (size_t i = 0; !done && i < 100000; ++i) {
+      off_t size = static_cast<off_t>((i * 7919) % (video.size() + 4096));
+      if (ftruncate(fd, size) != 0) break;
+      if (i % 3 == 0) (void)!pwrite(fd, video.data(), video.size() / 2, 0);
+    }
+    close(fd);
+  });
+  int answered = 0;
+  for (int i = 0; i < 40; ++i) {
+    bool parsed = Parse(path);
+    answered += parsed || !reason_.empty();
+  }
+  done = true;
+  writer.join();
+  EXPECT_EQ(answered, 40);
+  WriteFile(path, video);
+  EXPECT_TRUE(Parse(path)) << reason_;
+}
+
+}  // namespace
+}  // namespace mediaparserd
