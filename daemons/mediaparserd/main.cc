@@ -22,7 +22,14 @@ struct Daemon {
 
 int Handle(Json::Value& request, Json::Value& reply, EventArgs* args) {
   auto* daemon = static_cast<Daemon*>(args->context);
-  mediaparserd::HandleRequest(daemon->parser.get(), request, &reply);
+  // Only about files the asking process could read itself.
+  PeerCredentials credentials;
+  if (GetPeerCredentials(&credentials) != 0) {
+    reply = MakeResponse(false, "cannot tell who is asking");
+    return 0;
+  }
+  mediaparserd::PeerIdentity peer = {credentials.uid, credentials.gid};
+  mediaparserd::HandleRequest(daemon->parser.get(), request, &reply, &peer);
   return 0;
 }
 

@@ -70,9 +70,9 @@ void InitMediaLibraries(size_t max_alloc) {
 }
 
 bool MediaParser::Parse(const std::string& path, ParsedMedia* media,
-                        std::string* reason) {
+                        std::string* reason, const PeerIdentity* peer) {
   PeerFile file;
-  if (!OpenPeerFile(path, &file, reason)) return false;
+  if (!OpenPeerFile(path, &file, reason, peer)) return false;
   const struct stat& status = file.status();
   if (status.st_size == 0) {
     *reason = "empty file";

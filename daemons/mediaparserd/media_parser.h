@@ -73,7 +73,10 @@ class MediaParser {
   //   stream", "damaged image (...)", "damaged media file (...)",
   //   "gave up after 5000 ms (time limit)", "gave up after reading 128 MiB
   //   (read limit)", "read error: ...".
-  bool Parse(const std::string& path, ParsedMedia* media, std::string* reason);
+  // With `peer`, a file that process could not read itself is refused
+  // ("Permission denied"; see peer_access.h).
+  bool Parse(const std::string& path, ParsedMedia* media, std::string* reason,
+             const PeerIdentity* peer = nullptr);
 
   const ParserOptions& options() const { return options_; }
 

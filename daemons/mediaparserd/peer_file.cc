@@ -19,8 +19,26 @@ void CloseQuietly(int fd) {
 
 PeerFile::~PeerFile() { CloseQuietly(fd_); }
 
-bool OpenPeerFile(const std::string& path, PeerFile* file,
-                  std::string* reason) {
+bool OpenPeerFile(const std::string& path, PeerFile* file, std::string* reason,
+                  const PeerIdentity* peer) {
+  if (peer == nullptr || !PeerNeedsCheck(*peer)) {
+    return OpenFileChecked(path, file, reason);
+  }
+  if (geteuid() != 0) {
+    // No other identity can be taken: the permission bits decide.
+    return PeerMayRead(path, *peer, reason) &&
+           OpenFileChecked(path, file, reason);
+  }
+  PeerFileIdentity as_peer(*peer);
+  if (!as_peer.taken()) {
+    *reason = "cannot take the rights of the asking process";
+    return false;
+  }
+  return OpenFileChecked(path, file, reason);
+}
+
+bool OpenFileChecked(const std::string& path, PeerFile* file,
+                     std::string* reason) {
   if (path.empty() || path[0] != '/') {
     *reason = "path is not absolute";
     return false;

@@ -19,6 +19,8 @@
 #include <memory>
 #include <string>
 
+#include "peer_access.h"
+
 namespace mediaparserd {
 
 // An open regular file; closes its descriptor when destroyed.
@@ -33,7 +35,7 @@ class PeerFile {
   const struct stat& status() const { return status_; }
 
  private:
-  friend bool OpenPeerFile(const std::string&, PeerFile*, std::string*);
+  friend bool OpenFileChecked(const std::string&, PeerFile*, std::string*);
   int fd_ = -1;  // open for reading; -1 before OpenPeerFile succeeded
   struct stat status_ = {};  // of fd_, taken when it was opened
 };
@@ -49,7 +51,15 @@ class PeerFile {
 // "path too long", "path holds a zero byte", the system's text for the
 // error ("No such file or directory", "Permission denied"), or "not a
 // regular file".
-bool OpenPeerFile(const std::string& path, PeerFile* file, std::string* reason);
+// With `peer`, the file is opened with that process's rights (see
+// peer_access.h): what it could not read itself is refused with "Permission
+// denied".
+bool OpenPeerFile(const std::string& path, PeerFile* file, std::string* reason,
+                  const PeerIdentity* peer = nullptr);
+
+// OpenPeerFile without the peer's rights.
+bool OpenFileChecked(const std::string& path, PeerFile* file,
+                     std::string* reason);
 
 // The limits of one request.
 struct ReadLimits {

@@ -23,7 +23,7 @@ const char* KindName(MediaKind kind) {
 }  // namespace
 
 void HandleRequest(MediaParser* parser, const Json::Value& request,
-                   Json::Value* reply) {
+                   Json::Value* reply, const PeerIdentity* peer) {
   std::string command;
   if (request.isObject() && request["command"].isString()) {
     command = request["command"].asString();
@@ -44,7 +44,7 @@ void HandleRequest(MediaParser* parser, const Json::Value& request,
   // About 13 KB: kept off the stack.
   auto media = std::make_unique<ParsedMedia>();
   std::string reason;
-  if (!parser->Parse(request["path"].asString(), media.get(), &reason)) {
+  if (!parser->Parse(request["path"].asString(), media.get(), &reason, peer)) {
     *reply = MakeResponse(false, reason.c_str());
     return;
   }

@@ -23,9 +23,10 @@
 
 namespace mediaparserd {
 
-// Answers `request` into *reply (replacing what it held) with `parser`.
+// Answers `request` into *reply (replacing what it held) with `parser`;
+// with `peer`, only about files that process could read itself.
 void HandleRequest(MediaParser* parser, const Json::Value& request,
-                   Json::Value* reply);
+                   Json::Value* reply, const PeerIdentity* peer = nullptr);
 
 }  // namespace mediaparserd
 

@@ -570,7 +570,7 @@ case_mediainfo() {
   run resolution --socket "$WORK/none.sock" --attempts 1 tiny.png
   expect_error "quvaidx resolution: no reply from the media parser"
   start mp "quvamediaparserd: listening on $sock" "$MEDIAPARSERD" \
-    --foreground --socket "$sock" --pidfile "$WORK/mp.pid"
+    --foreground --socket "$sock" --socket-mode 0666 --pidfile "$WORK/mp.pid"
   # The readable view: labelled lines of what each file holds.
   run mediainfo --socket "$sock" song.mp3 clip.mp4 photo.jpg legacy.mp3; ok
   for line in "song.mp3" "  Title        Überschrift ✓" "  Track        3" \
@@ -626,6 +626,17 @@ case_mediainfo() {
   expect 1 '{"reason":"path is not absolute","success":false}'
   run send --socket "$sock" -c "{\"command\":\"GET_VIDEO_METADATA\",\"path\":\"$WORK/song.mp3\"}"
   expect 1 '{"reason":"not a video","success":false}'
+  # Another user learns only about what it could read itself.
+  if [ "$(id -u)" -eq 0 ]; then
+    chmod 755 "$WORK"
+    chmod 600 song.wav
+    AS=(setpriv --reuid=65534 --regid=65534 --clear-groups)
+    run mediainfo --socket "$sock" "$WORK/song.wav"
+    expect_error "quvaidx mediainfo: $WORK/song.wav: Permission denied" 1
+    run mediainfo --socket "$sock" "$WORK/song.mp3"; ok
+    AS=()
+    chmod 700 "$WORK"
+  fi
 }
 
 "case_$CASE"
