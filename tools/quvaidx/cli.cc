@@ -1,7 +1,6 @@
 #include "cli.h"
 
 #include <errno.h>
-#include <getopt.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <syslog.h>
@@ -125,18 +124,6 @@ int ParseArguments(const quvaidx_tools::CommandLine& line, int argc,
   return quvaidx_tools::ParseCommandLine(line, argc, argv, first_operand);
 }
 
-int OptionError(const char* command, int result, char** argv) {
-  // getopt_long has already advanced optind past the offending argument.
-  std::string text = optind > 0 ? argv[optind - 1] : "";
-  bool is_long = text.compare(0, 2, "--") == 0;
-  if (!is_long && optopt > 0 && optopt < 128)
-    text = std::string("-") + static_cast<char>(optopt);
-  if (result == ':') {
-    return UsageError(command, "option '" + text + "' needs a value");
-  }
-  return UsageError(command, "unrecognised option '" + text + "'");
-}
-
 bool CheckSocketPath(const char* command, const std::string& path) {
   if (path.empty()) {
     UsageError(command, "--socket PATH is required");
@@ -157,39 +144,6 @@ void InitLogging() { openlog(kLogIdent, 0, LOG_USER); }
 void EnableVerboseLogging() {
   openlog(kLogIdent, LOG_PERROR, LOG_USER);
   ChageLogLevel(7);
-}
-
-int ParseFlags(int argc, char** argv, const char* command,
-               std::initializer_list<Flag> flags, void (*print_help)()) {
-  std::vector<struct option> options;
-  std::string letters = ":vh";
-  for (const Flag& flag : flags) {
-    options.push_back({flag.name, no_argument, nullptr, flag.letter});
-    letters += flag.letter;
-  }
-  options.push_back({"verbose", no_argument, nullptr, 'v'});
-  options.push_back({"help", no_argument, nullptr, 'h'});
-  options.push_back({nullptr, 0, nullptr, 0});
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, letters.c_str(), options.data(),
-                          nullptr)) != -1) {
-    if (c == 'v') {
-      EnableVerboseLogging();
-    } else if (c == 'h') {
-      print_help();
-      return kExitOk;
-    } else {
-      const Flag* match = nullptr;
-      for (const Flag& flag : flags) {
-        if (flag.letter == c) match = &flag;
-      }
-      if (match == nullptr) return OptionError(command, c, argv);
-      *match->value = true;
-    }
-  }
-  return kContinue;
 }
 
 }  // namespace quvaidx_cli

@@ -3,7 +3,6 @@
 #ifndef QUVAIDX_TOOLS_CLI_H_
 #define QUVAIDX_TOOLS_CLI_H_
 
-#include <initializer_list>
 #include <string>
 #include <vector>
 
@@ -45,25 +44,6 @@ quvaidx_tools::CommandLine Subcommand(
 // with the operands from argv[*first_operand], or the status to exit with.
 int ParseArguments(const quvaidx_tools::CommandLine& line, int argc,
                    char** argv, int* first_operand);
-
-// Reports the getopt_long result `result` ('?' or ':') for the option just
-// read from argv as a usage error; returns kExitError. Call with opterr 0
-// and an option string that starts with ':'.
-int OptionError(const char* command, int result, char** argv);
-
-// A boolean flag of a subcommand: --name or -letter sets *value.
-struct Flag {
-  const char* name;
-  char letter;
-  bool* value;
-};
-
-// Parses `flags` plus --verbose/-v and --help/-h (getopt rules; optind is
-// left at the first operand). Returns kContinue, or the exit status to
-// return at once: kExitOk after printing the help, kExitError on an unknown
-// option.
-int ParseFlags(int argc, char** argv, const char* command,
-               std::initializer_list<Flag> flags, void (*print_help)());
 
 // Checks that `path` can name a Unix-domain socket: not empty and at most
 // the library's limit in bytes. Prints one error line and returns false

@@ -12,7 +12,6 @@
 // daemon, the tool --attempts (default 3) seconds. For a video, the readable
 // view also asks GET_VIDEO_METADATA, for its rotation and pixel aspect.
 #include <errno.h>
-#include <getopt.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
@@ -29,6 +28,7 @@
 #include "quvaidx/ipc.h"
 #include "quvaidx/media_type.h"
 #include "quvaidx/mediainfo.h"
+#include "quvaidx/paths.h"
 
 namespace quvaidx_cli {
 namespace {
@@ -95,43 +95,6 @@ struct Options {
   bool raw = false;   // print "name: value" lines of the record's fields
   bool all = false;   // raw, and list fields that are 0 or empty too
 };
-
-void PrintHelp(const char* name) {
-  bool info = strcmp(name, "mediainfo") == 0;
-  printf(info ? "Usage: quvaidx mediainfo [OPTIONS] FILE...\n\n"
-                "Asks the media-parser daemon for the media record of each\n"
-                "FILE and shows what it holds: title, artist, duration,\n"
-                "codecs, camera and the like, one labelled line each.\n"
-              : "Usage: quvaidx resolution [OPTIONS] FILE\n\n"
-                "Asks the media-parser daemon for the pixel size of FILE and\n"
-                "prints it as WIDTHxHEIGHT (0x0 when the daemon does not know\n"
-                "it).\n");
-  printf(
-      "A relative FILE is sent as an absolute path, since the daemon has a\n"
-      "working directory of its own.\n"
-      "\n"
-      "Options:\n"
-      "  -j, --json          print JSON%s\n"
-      "%s"
-      "  -s, --socket PATH   the daemon's socket (default %s)\n"
-      "  -a, --attempts N    connection attempts, one second apart "
-      "(default %d)\n"
-      "  -v, --verbose       also show the library's log lines on stderr\n"
-      "  -h, --help          show this help\n"
-      "\n"
-      "Exit status: 0 when the daemon answered for every FILE, 1 when it\n"
-      "refused one (its reason is printed), 2 on a usage error or when no\n"
-      "reply could be obtained.\n",
-      info ? ": an array of {\"file\", \"table\", \"media\"}" : "",
-      info
-          ? "  -r, --raw           list the record's fields that are set, one\n"
-            "                      \"name: value\" line each, after the media\n"
-            "                      table of the file's extension\n"
-            "      --all           as --raw, with the fields that are 0 or\n"
-            "                      empty\n"
-          : "",
-      DaemonInfo().get("mediad", "sock").c_str(), kDefaultAttempts);
-}
 
 // As the library reads "success": a boolean true or a nonzero number.
 bool Succeeded(const Json::Value& reply) {
@@ -254,70 +217,73 @@ void PrintRecord(const std::string& file, const Json::Value& media, bool all) {
   }
 }
 
-// Parses the options shared by both commands; the FILE arguments start at
-// optind afterwards. Returns -1 to go on, else the exit status.
-int ParseOptions(int argc, char** argv, Options* options) {
-  static const struct option kOptions[] = {
-      {"json", no_argument, nullptr, 'j'},
-      {"all", no_argument, nullptr, 'A'},
-      {"raw", no_argument, nullptr, 'r'},
-      {"socket", required_argument, nullptr, 's'},
-      {"attempts", required_argument, nullptr, 'a'},
-      {"verbose", no_argument, nullptr, 'v'},
-      {"help", no_argument, nullptr, 'h'},
-      {nullptr, 0, nullptr, 0},
-  };
-  const char* name = argv[0];
-  options->socket = DaemonInfo().get("mediad", "sock");
-  optind = 0;
-  opterr = 0;
-  int c;
-  while ((c = getopt_long(argc, argv, ":jrs:a:vh", kOptions, nullptr)) != -1) {
-    switch (c) {
-      case 'j':
-        options->json = true;
-        break;
-      case 'A':
-        if (strcmp(name, "mediainfo") != 0) return OptionError(name, '?', argv);
-        options->all = options->raw = true;
-        break;
-      case 'r':
-        if (strcmp(name, "mediainfo") != 0) return OptionError(name, '?', argv);
-        options->raw = true;
-        break;
-      case 's':
-        options->socket = optarg;
-        break;
-      case 'a':
-        if (!ParseInt(optarg, 1, kMaxAttempts, &options->attempts)) {
-          return UsageError(name, "--attempts needs a whole number from 1 to " +
-                                      std::to_string(kMaxAttempts) + ", not '" +
-                                      optarg + "'");
-        }
-        break;
-      case 'v':
-        EnableVerboseLogging();
-        break;
-      case 'h':
-        PrintHelp(name);
-        return kExitOk;
-      default:
-        return OptionError(name, c, argv);
-    }
+// The command line of `name` ("mediainfo" or "resolution"), whose options
+// set *options.
+quvaidx_tools::CommandLine MakeLine(const char* name, Options* options) {
+  using namespace quvaidx_tools;
+  const bool info = strcmp(name, "mediainfo") == 0;
+  std::vector<Option> flags = {
+      Flag("json", 'j', &options->json,
+           info ? "print JSON: an array of {\"file\", \"table\", \"media\"}"
+                : "print JSON")};
+  if (info) {
+    flags.push_back(Flag("raw", 'r', &options->raw,
+                         "list the record's fields that are set, one\n\"name: "
+                         "value\" line each, after the media\ntable of the "
+                         "file's extension"));
+    flags.push_back(Custom(
+        "all", 0, nullptr,
+        [options](const char*) {
+          options->all = options->raw = true;
+          return std::string();
+        },
+        "as --raw, with the fields that are 0 or\nempty"));
   }
-  if (optind >= argc) return UsageError(name, "missing FILE");
-  return CheckSocketPath(name, options->socket) ? -1 : kExitError;
+  flags.push_back(Text("socket", 's', "PATH", &options->socket,
+                       std::string("the daemon's socket (default ") +
+                           QUVAIDX_MEDIAD_SOCKET + ")"));
+  flags.push_back(Number("attempts", 'a', "N", 1, kMaxAttempts,
+                         &options->attempts,
+                         "connection attempts, one second apart\n(default " +
+                             std::to_string(kDefaultAttempts) + ")"));
+  return Subcommand(
+      name, {info ? "[OPTIONS] FILE..." : "[OPTIONS] FILE"},
+      std::string(info ? "Asks the media-parser daemon for the media record "
+                         "of each\nFILE and shows what it holds: title, "
+                         "artist, duration,\ncodecs, camera and the like, one "
+                         "labelled line each.\n"
+                       : "Asks the media-parser daemon for the pixel size of "
+                         "FILE and\nprints it as WIDTHxHEIGHT (0x0 when the "
+                         "daemon does not know\nit).\n") +
+          "A relative FILE is sent as an absolute path, since the daemon has "
+          "a\nworking directory of its own.\n",
+      flags,
+      "Exit status: 0 when the daemon answered for every FILE, 1 when it\n"
+      "refused one (its reason is printed), 2 on a usage error or when no\n"
+      "reply could be obtained.\n");
+}
+
+// Parses the options shared by both commands; the FILE arguments start at
+// *first afterwards. Returns kContinue to go on, else the exit status.
+int ParseOptions(int argc, char** argv, Options* options, int* first) {
+  const char* name = argv[0];
+  options->socket = QUVAIDX_MEDIAD_SOCKET;
+  int status = ParseArguments(MakeLine(name, options), argc, argv, first);
+  if (status != kContinue) return status;
+  if (*first >= argc) return UsageError(name, "missing FILE");
+  return CheckSocketPath(name, options->socket) ? kContinue : kExitError;
 }
 
 }  // namespace
 
 int RunMediaInfo(int argc, char** argv) {
   Options options;
-  int status = ParseOptions(argc, argv, &options);
-  if (status >= 0) return status;
+  int first = 0;  // the first FILE
+  int status = ParseOptions(argc, argv, &options, &first);
+  if (status != kContinue) return status;
   status = kExitOk;
   Json::Value records(Json::arrayValue);
-  for (int i = optind; i < argc; ++i) {
+  for (int i = first; i < argc; ++i) {
     Json::Value reply;
     int result = Ask(argv[0], options, "GET_MEDIA_INFO", argv[i], &reply);
     if (result == kExitError) return kExitError;  // the next would wait too
@@ -339,7 +305,7 @@ int RunMediaInfo(int argc, char** argv) {
       entry["media"].swap(media);
       continue;
     }
-    if (i > optind) printf("\n");
+    if (i > first) printf("\n");
     if (options.raw) {
       PrintRecord(file, media, options.all);
       continue;
@@ -367,15 +333,16 @@ int RunMediaInfo(int argc, char** argv) {
 
 int RunResolution(int argc, char** argv) {
   Options options;
-  int status = ParseOptions(argc, argv, &options);
-  if (status >= 0) return status;
-  if (argc - optind > 1) {
+  int first = 0;  // the FILE
+  int status = ParseOptions(argc, argv, &options, &first);
+  if (status != kContinue) return status;
+  if (argc - first > 1) {
     return UsageError(argv[0], std::string("expects one FILE; unexpected "
                                            "argument '") +
-                                   argv[optind + 1] + "'");
+                                   argv[first + 1] + "'");
   }
   Json::Value reply;
-  status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", argv[optind], &reply);
+  status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", argv[first], &reply);
   if (status != kExitOk) return status;
   int32_t width = ReadInt32(reply, "width");
   int32_t height = ReadInt32(reply, "height");
