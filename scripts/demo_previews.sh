@@ -68,7 +68,7 @@ show() {
   echo "(exit status $status)"
 }
 
-mount_private_paths "$work" demo
+mount_private_paths demo "$work" "$build" "$0"
 export QUVA_HOST_ETC=$work/host-etc
 
 heading "A private mount namespace: /var/spool, /run and /tmp are fresh here,

@@ -19,17 +19,32 @@ find_private_namespace() {
   fi
 }
 
-# mount_private_paths WORK LABEL: inside the namespace, fresh tmpfs over
-# /var/spool and /run (/var/run), and WORK/tmp over /tmp, in which WORK
-# itself stays reachable under its own name.
+# mount_private_paths LABEL PATH...: inside the namespace, fresh tmpfs over
+# /var/spool, /run (/var/run) and /tmp. Each PATH (the work directory, the
+# programs to run) stays reachable under its own name: a PATH under /tmp
+# keeps its top folder, bound from the machine's /tmp into the fresh one.
 mount_private_paths() {
-  local work=$1 label=$2
+  local label=$1 old path top
+  shift
   mount -t tmpfs -o mode=0755 "$label-spool" /var/spool
   mount -t tmpfs -o mode=0755 "$label-run" "$(readlink -f /var/run)"
-  mkdir -p "$work/tmp/$(basename "$work")"
-  mount --bind "$work" "$work/tmp/$(basename "$work")"
-  mount --bind "$work/tmp" /tmp
-  chmod 1777 /tmp
+  old=$(mktemp -d /run/machine-tmp.XXXXXX)
+  mount --bind /tmp "$old"
+  mount -t tmpfs -o mode=1777 "$label-tmp" /tmp
+  for path in "$@"; do
+    case $path in
+      /tmp/?*)
+        top=${path#/tmp/}
+        top=${top%%/*}
+        if [ ! -e "/tmp/$top" ]; then
+          mkdir "/tmp/$top"
+          mount --bind "$old/$top" "/tmp/$top"
+        fi
+        ;;
+    esac
+  done
+  umount -l "$old"
+  rmdir "$old"
 }
 
 # wait_for SECONDS COMMAND...: polls COMMAND every 50 ms until it succeeds;

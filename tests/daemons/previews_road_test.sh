@@ -79,7 +79,7 @@ cleanup() {
 }
 trap cleanup EXIT
 
-mount_private_paths "$work" road
+mount_private_paths road "$work" "$TOOL" "$MKTHUMBD" "$PLUGIND" "$0"
 [ -d "$work" ] || fail "the work directory is not reachable after the mounts"
 export QUVA_HOST_ETC=$work/host-etc # no boot step file: booted
 

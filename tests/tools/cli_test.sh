@@ -37,8 +37,32 @@ fail() {
 # run ARGS...: runs the tool; sets RC, OUT and ERR.
 run() {
   RC=0
-  timeout 5 "${AS[@]}" "$TOOL" "$@" >"$WORK/out" 2>"$WORK/err" || RC=$?
+  timeout 5 "${AS[@]}" "${AS_TOOL:-$TOOL}" "$@" >"$WORK/out" 2>"$WORK/err" ||
+    RC=$?
   OUT=$(<"$WORK/out") ERR=$(<"$WORK/err")
+}
+# as_nobody: later runs are made as user nobody (the caller is root), until
+# as_self. The build tree may lie where nobody cannot go: the tool and the
+# project's libraries are then copied into $WORK, which nobody may enter.
+as_nobody() {
+  local lib
+  chmod 755 "$WORK"
+  AS=(setpriv --reuid=65534 --regid=65534 --clear-groups)
+  AS_TOOL=""
+  "${AS[@]}" "$TOOL" --version >/dev/null 2>&1 && return 0
+  mkdir -p "$WORK/nobody"
+  cp "$TOOL" "$WORK/nobody/"
+  for lib in $(ldd "$TOOL" | awk '/libquva/ { print $3 }'); do
+    cp "$lib" "$WORK/nobody/"
+  done
+  chmod -R a+rX "$WORK/nobody"
+  AS=(env "LD_LIBRARY_PATH=$WORK/nobody" "${AS[@]}")
+  AS_TOOL=$WORK/nobody/$(basename "$TOOL")
+}
+as_self() {
+  AS=()
+  AS_TOOL=""
+  chmod 700 "$WORK"
 }
 
 # expect RC [STDOUT]: the exit status, and stdout when given.
@@ -416,11 +440,9 @@ quvaidx scan: cannot scan $WORK/tree/notes.txt: not a folder" ] || fail "stderr"
   mkdir -p "$WORK/tree/locked/inner"
   touch "$WORK/tree/locked/inner/x.mp3" "$WORK/tree/locked/y.jpg"
   chmod 000 "$WORK/tree/locked"
-  chmod 755 "$WORK"
-  [ "$(id -u)" -ne 0 ] || AS=(setpriv --reuid=65534 --regid=65534 --clear-groups)
+  [ "$(id -u)" -ne 0 ] || as_nobody
   run scan --json "$WORK/tree"
-  AS=()
-  chmod 700 "$WORK"
+  as_self
   chmod 755 "$WORK/tree/locked"
   expect 1
   [ "$ERR" = "quvaidx scan: cannot read $root/locked: Permission denied" ] ||
@@ -628,14 +650,12 @@ case_mediainfo() {
   expect 1 '{"reason":"not a video","success":false}'
   # Another user learns only about what it could read itself.
   if [ "$(id -u)" -eq 0 ]; then
-    chmod 755 "$WORK"
     chmod 600 song.wav
-    AS=(setpriv --reuid=65534 --regid=65534 --clear-groups)
+    as_nobody
     run mediainfo --socket "$sock" "$WORK/song.wav"
     expect_error "quvaidx mediainfo: $WORK/song.wav: Permission denied" 1
     run mediainfo --socket "$sock" "$WORK/song.mp3"; ok
-    AS=()
-    chmod 700 "$WORK"
+    as_self
   fi
 }
 
