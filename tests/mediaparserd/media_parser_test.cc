@@ -430,11 +430,13 @@ TEST_F(MediaParserTest, TruncatedFilesTellWhatTheirHeadersTell) {
   }
 }
 
+// A daemon that is not root cannot open what its user may not read. Mode 0
+// keeps even the owner out, so the check holds whoever runs the tests.
 TEST_F(MediaParserTest, UnreadableFileIsRefused) {
   TempDir dir;
   std::string path = dir.File("secret.mp3");
   WriteFile(path, ReadFile(Fixture("song_id3v24.mp3")));
-  ASSERT_EQ(chmod(path.c_str(), 0600), 0);
+  ASSERT_EQ(chmod(path.c_str(), 0), 0);
   ASSERT_EQ(chmod(dir.path().c_str(), 0755), 0);
   int result = quvaidx::test::RunUnprivileged([&] {
     MediaParser parser{ParserOptions()};
