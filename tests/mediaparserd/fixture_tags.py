@@ -88,6 +88,11 @@ def he_aac_config(lc_config):
     return w.data()
 
 
+# The boxes on the way to the esds box, by the bytes before their children.
+BOX_HEADERS = {b"moov": 8, b"trak": 8, b"mdia": 8, b"minf": 8, b"stbl": 8,
+               b"stsd": 16, b"mp4a": 36}
+
+
 def he_aac(src, dst):
     data = bytearray(open(src, "rb").read())
     path = []  # (offset of size field) of every enclosing box
@@ -98,25 +103,15 @@ def he_aac(src, dst):
             size, kind = struct.unpack(">I4s", data[pos:pos + 8])
             if kind == b"moov" and data.find(b"mdat") > pos:
                 raise SystemExit("he-aac: moov must follow mdat")
-            if kind in (b"moov", b"trak", b"mdia", b"minf", b"stbl"):
-                path.append(pos)
-                if walk(pos + 8, pos + size):
-                    return True
-                path.pop()
-            elif kind == b"stsd":
-                path.append(pos)
-                if walk(pos + 16, pos + size):
-                    return True
-                path.pop()
-            elif kind == b"mp4a":
-                path.append(pos)
-                if walk(pos + 36, pos + size):
-                    return True
-                path.pop()
-            elif kind == b"esds":
+            if kind == b"esds":
                 path.append(pos)
                 patch_esds(pos)
                 return True
+            if kind in BOX_HEADERS:
+                path.append(pos)
+                if walk(pos + BOX_HEADERS[kind], pos + size):
+                    return True
+                path.pop()
             pos += size
         return False
 

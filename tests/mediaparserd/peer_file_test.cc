@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-
 #include <string>
 
 #include <gtest/gtest.h>
@@ -81,7 +80,9 @@ TEST_F(BoundedReaderTest, FileThatShrinksReadsShortAndGrowthIsNotSeen) {
   EXPECT_EQ(reader.stop(), BoundedReader::Stop::kNone);
 }
 
-TEST_F(BoundedReaderTest, BudgetCountsFileBytesAndStopsForGood) {
+// The budget counts the bytes read from the file, not those served from
+// the cache; once the budget or the time is spent, no read is served.
+TEST_F(BoundedReaderTest, BudgetAndDeadlineStopEveryReadForGood) {
   ReadLimits limits;
   limits.bytes = 100 * 1024;
   BoundedReader reader(file_.fd(), file_.status().st_size, limits);
@@ -91,15 +92,11 @@ TEST_F(BoundedReaderTest, BudgetCountsFileBytesAndStopsForGood) {
   EXPECT_EQ(Read(&reader, 70 * 1024, 10), "<stopped>");
   EXPECT_EQ(reader.stop(), BoundedReader::Stop::kBudget);
   EXPECT_EQ(Read(&reader, 0, 10), "<stopped>");  // even cached bytes
-}
-
-TEST_F(BoundedReaderTest, PassedDeadlineStopsEveryRead) {
-  ReadLimits limits;
   limits.time_ms = 0;
-  BoundedReader reader(file_.fd(), file_.status().st_size, limits);
-  EXPECT_TRUE(reader.Expired());
-  EXPECT_EQ(Read(&reader, 0, 10), "<stopped>");
-  EXPECT_EQ(reader.stop(), BoundedReader::Stop::kTime);
+  BoundedReader late(file_.fd(), file_.status().st_size, limits);
+  EXPECT_TRUE(late.Expired());
+  EXPECT_EQ(Read(&late, 0, 10), "<stopped>");
+  EXPECT_EQ(late.stop(), BoundedReader::Stop::kTime);
 }
 
 // The opened file is the one checked: a regular file, open for reading

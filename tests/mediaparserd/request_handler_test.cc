@@ -69,39 +69,18 @@ TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
             MakeResponse(true, nullptr));
 }
 
+// The whole record, all 47 fields, and its kind; with the code page at
+// UTF-8 the legacy tag bytes cannot be decoded, and still the packet a
+// client receives holds only valid UTF-8.
 TEST_F(RequestHandlerTest, MediaInfoCarriesTheWholeRecordAndItsKind) {
-  HostCodePage host("UTF-8");  // legacy bytes cannot be decoded
-  struct Case {
-    const char* file;
-    const char* kind;
-  } cases[] = {{"song_id3v1_cp1251.mp3", "music"},
-               {"video.mkv", "video"},
-               {"photo_exif.jpg", "photo"}};
-  for (const Case& c : cases) {
-    Json::Value reply = Ask("GET_MEDIA_INFO", Fixture(c.file));
-    ASSERT_TRUE(reply["success"].asBool()) << c.file << ": " << reply;
-    EXPECT_EQ(reply["media_type"].asString(), c.kind);
-    EXPECT_EQ(reply["media"].size(), 47u);
-    EXPECT_EQ(reply["media"]["szPath"].asString(), Fixture(c.file));
-    // The packet a client receives holds only valid UTF-8.
-    EXPECT_TRUE(IsValidUTF8(Json::FastWriter().write(reply))) << c.file;
-  }
-}
-
-TEST_F(RequestHandlerTest, ResolutionIsThePixelSizeOfPhotosAndVideos) {
-  struct Case {
-    const char* file;
-    int width, height;
-  } cases[] = {{"photo_exif.jpg", 640, 480},
-               {"photo.png", 200, 100},
-               {"video_rot90.mp4", 320, 240},
-               {"song.flac", 0, 0}};
-  for (const Case& c : cases) {
-    Json::Value reply = Ask("GET_MEDIA_RESOLUTION", Fixture(c.file));
-    EXPECT_TRUE(reply["success"].asBool()) << c.file << ": " << reply;
-    EXPECT_EQ(reply["width"].asInt(), c.width) << c.file;
-    EXPECT_EQ(reply["height"].asInt(), c.height) << c.file;
-  }
+  HostCodePage host("UTF-8");
+  std::string path = Fixture("song_id3v1_cp1251.mp3");
+  Json::Value reply = Ask("GET_MEDIA_INFO", path);
+  ASSERT_TRUE(reply["success"].asBool()) << reply;
+  EXPECT_EQ(reply["media_type"].asString(), "music");
+  EXPECT_EQ(reply["media"].size(), 47u);
+  EXPECT_EQ(reply["media"]["szPath"].asString(), path);
+  EXPECT_TRUE(IsValidUTF8(Json::FastWriter().write(reply)));
 }
 
 TEST_F(RequestHandlerTest, VideoMetadataIsAnsweredForVideosOnly) {

@@ -72,6 +72,13 @@ TEST(OptionsTest, ValuesReachTheirTargetsInAnySpellingAndOrder) {
   // getopt moves the operands a, b and (after "--") -c behind the options.
   EXPECT_EQ(p.first_operand, 8);
   EXPECT_EQ(p.err, "");
+  // A dispatcher stops at its first operand: the rest is its command's.
+  line.stop_at_first_operand = true;
+  t.flag = false;
+  p = Parse(line, {"-f", "send", "--bogus"});
+  ASSERT_EQ(p.status, kContinue);
+  EXPECT_EQ(p.first_operand, 2);
+  EXPECT_TRUE(t.flag);
 }
 
 TEST(OptionsTest, RefusedValuesNameTheOptionAndLeaveTheTarget) {
@@ -136,16 +143,6 @@ TEST(OptionsTest, HelpAndVersionComeFromTheDescription) {
   // Without a version text there is no --version.
   line.version.clear();
   EXPECT_EQ(Parse(line, {"--version"}).status, kExitError);
-}
-
-TEST(OptionsTest, DispatcherStopsAtTheFirstOperand) {
-  Targets t;
-  CommandLine line = MakeLine(&t);
-  line.stop_at_first_operand = true;
-  Parsed p = Parse(line, {"-f", "send", "--bogus"});
-  ASSERT_EQ(p.status, kContinue);
-  EXPECT_EQ(p.first_operand, 2);
-  EXPECT_TRUE(t.flag);
 }
 
 }  // namespace
