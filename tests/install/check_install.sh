@@ -78,7 +78,10 @@ for name in "${daemons[@]}"; do
     fail "$unit does not start $prefix/sbin/$name"
 done
 if command -v systemd-analyze >/dev/null; then
-  MANPATH=$prefix/share/man: systemd-analyze verify \
+  # The units name their man pages, which a build without docs lacks.
+  man_check=()
+  [ -d "$prefix/share/man" ] || man_check=(--man=no)
+  MANPATH=$prefix/share/man: systemd-analyze verify "${man_check[@]}" \
     "$prefix"/lib/systemd/system/*.service || fail "a unit does not verify"
 fi
 
