@@ -139,34 +139,35 @@ class EventServerTest : public ::testing::Test {
     RunUntil([] { return false; }, ms);
   }
 
-  // Runs the loop and collects what arrives on fd until `n` bytes are
-  // there, the peer closed, or `seconds` passed. Returns at most n bytes;
-  // the rest stays for the next call.
-  std::string Receive(int fd, size_t n, bool* closed = nullptr,
-                      int seconds = 1) {
-    std::string& pending = pending_[fd];
-    const auto end = Clock::now() + std::chrono::seconds(seconds);
-    while (pending.size() < n && Clock::now() < end) {
-      event_base_loop(base_, EVLOOP_NONBLOCK);
-      char buf[65536];
+  // True when the server has closed fd; what it sent first is kept for
+  // Receive.
+  bool ServerClosed(int fd) {
+    char buf[65536];
+    for (;;) {
       ssize_t got = recv(fd, buf, sizeof(buf), MSG_DONTWAIT);
-      if (got > 0) {
-        pending.append(buf, static_cast<size_t>(got));
-      } else if (got == 0) {
-        if (closed != nullptr) *closed = true;
-        break;
-      } else {
-        usleep(200);
-      }
+      if (got == 0 || (got < 0 && errno == ECONNRESET)) return true;
+      if (got < 0) return false;
+      pending_[fd].append(buf, static_cast<size_t>(got));
     }
+  }
+
+  // Runs the loop until `n` bytes arrived on fd, the server closed it, or
+  // `ms` milliseconds passed. Returns at most n bytes; the rest stays for
+  // the next call.
+  std::string Receive(int fd, size_t n, bool* closed = nullptr, int ms = 1000) {
+    std::string& pending = pending_[fd];
+    bool ended = false;
+    RunUntil([&] { return (ended = ServerClosed(fd)) || pending.size() >= n; },
+             ms);
+    if (closed != nullptr) *closed = ended;
     std::string out = pending.substr(0, n);
     pending.erase(0, out.size());
     return out;
   }
 
   // Receives one reply packet and returns its body.
-  std::string ReceiveBody(int fd, int seconds = 1) {
-    std::string header = Receive(fd, 4, nullptr, seconds);
+  std::string ReceiveBody(int fd, int ms = 1000) {
+    std::string header = Receive(fd, 4, nullptr, ms);
     if (header.size() < 4) return "";
     return Receive(fd, (static_cast<unsigned char>(header[2]) << 8) |
                            static_cast<unsigned char>(header[3]));
@@ -176,17 +177,6 @@ class EventServerTest : public ::testing::Test {
   bool ClosedSilently(int fd) {
     bool closed = false;
     return Receive(fd, 1, &closed).empty() && closed;
-  }
-
-  // True when the server has closed fd (keeping what it sent first).
-  bool ServerClosed(int fd) {
-    char buf[65536];
-    for (;;) {
-      ssize_t got = recv(fd, buf, sizeof(buf), MSG_DONTWAIT);
-      if (got == 0 || (got < 0 && errno == ECONNRESET)) return true;
-      if (got < 0) return false;
-      pending_[fd].append(buf, static_cast<size_t>(got));
-    }
   }
 
   quvaidx::test::FdLeakCheck leaks_;
@@ -451,7 +441,7 @@ TEST_F(EventServerTest, RunningOutOfDescriptorsLocksNoClientOut) {
   EXPECT_EQ(log.Count(accept_failed + "pausing for 100 ms"), 1);
   restore();
   Send(fd, Request("HANDSHAKE"));
-  EXPECT_EQ(ReceiveBody(fd, 3), kSuccess);
+  EXPECT_EQ(ReceiveBody(fd, 3000), kSuccess);
   for (int i = 0; i < 40; ++i) Send(Connect(), std::string("\x15\xbe", 2));
   RunFor(150);  // all accepted, and stalled for longer than a pause
   ASSERT_EQ(GetCurrentConnCount(), 41);
@@ -568,7 +558,8 @@ TEST_F(EventServerTest, HalfClosedClientGetsEveryReply) {
   ASSERT_EQ(shutdown(fd, SHUT_WR), 0);
   bool closed = false;
   const std::string reply = std::string("\x15\xbe\x00\x11", 4) + kSuccess;
-  std::string received = Receive(fd, reply.size() * kRequests + 1, &closed, 10);
+  std::string received =
+      Receive(fd, reply.size() * kRequests + 1, &closed, 10000);
   EXPECT_TRUE(closed);
   EXPECT_EQ(requests_.size(), static_cast<size_t>(kRequests));
   ASSERT_EQ(received.size(), reply.size() * kRequests);
