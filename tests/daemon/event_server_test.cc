@@ -454,10 +454,9 @@ TEST_F(EventServerTest, RunningOutOfDescriptorsLocksNoClientOut) {
   EXPECT_EQ(GetCurrentConnCount(), 41 + 1 - 16);
 }
 
-// Replies to a client that is gone raise no SIGPIPE; replies to a client
-// that does not read are bounded, and all sent once it reads.
-TEST_F(EventServerTest, SlowOrGoneClientsDoNotHurtTheDaemon) {
-  signal(SIGPIPE, SIG_DFL);
+// Replies to a client that does not read are bounded, and all sent once it
+// reads.
+TEST_F(EventServerTest, RepliesToASlowClientAreBounded) {
   const std::string blob(10000, 'r');
   handler_ = [&](Json::Value&, Json::Value& reply) {
     reply["blob"] = blob;
@@ -467,18 +466,6 @@ TEST_F(EventServerTest, SlowOrGoneClientsDoNotHurtTheDaemon) {
   const int kRequests = 400;  // 4 MB of replies
   std::string requests;
   for (int i = 0; i < kRequests; ++i) requests += Request("R");
-  int gone = Connect();
-  Send(gone, requests.substr(0, requests.size() / 4));
-  RunFor(10);  // replies pile up unread
-  close(gone);
-  clients_.clear();
-  RunFor(20);  // writing to the closed client raises SIGPIPE, if not ignored
-  EXPECT_EQ(GetCurrentConnCount(), 0);
-  struct sigaction action;
-  sigaction(SIGPIPE, nullptr, &action);
-  EXPECT_EQ(action.sa_handler, SIG_IGN);
-
-  requests_.clear();
   int fd = Connect();
   Send(fd, requests);
   RunFor(50);
@@ -571,8 +558,10 @@ TEST_F(EventServerTest, HalfClosedClientGetsEveryReply) {
 
 // A connection finishing (a refused request after replies that did not all
 // fit the socket) whose client goes away is closed on the write error, not
-// left to the idle deadline.
+// left to the idle deadline; writing to the vanished client raises no
+// SIGPIPE, which would end the daemon.
 TEST_F(EventServerTest, ErrorOnAFinishingConnectionClosesIt) {
+  signal(SIGPIPE, SIG_DFL);
   handler_ = [](Json::Value& request, Json::Value& reply) {
     reply["blob"] = std::string(8000, 'b');
     return request["command"] == "QUIT" ? -1 : 0;
@@ -587,6 +576,9 @@ TEST_F(EventServerTest, ErrorOnAFinishingConnectionClosesIt) {
   close(fd);
   clients_.clear();
   EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 2000));
+  struct sigaction action;
+  sigaction(SIGPIPE, nullptr, &action);
+  EXPECT_EQ(action.sa_handler, SIG_IGN);
 }
 
 // However many clients leave their replies unread, the unsent replies of
