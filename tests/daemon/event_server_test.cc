@@ -1,5 +1,9 @@
-// The event server in-process: framing, handler results, the socket file,
-// running out of descriptors, slow and vanished clients.
+// The event server in-process: a real event base and real client sockets on
+// the same thread, the loop driven step by step.
+//
+// Map: the fixture; requests, replies and handlers; the socket file;
+// running out of descriptors; peers that vanish, stall, half-close or hoard
+// their replies.
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
@@ -11,7 +15,10 @@
 #include <sys/un.h>
 #include <unistd.h>
 
-#include <iterator>
+#include <algorithm>
+#include <chrono>
+#include <functional>
+#include <map>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -19,7 +26,7 @@
 #include <event2/event.h>
 #include <gtest/gtest.h>
 
-#include "daemon/server_fixture.h"
+#include "daemon/server_connections.h"
 #include "quvaidx/ipc.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
@@ -27,29 +34,188 @@
 
 namespace {
 
-using quvaidx::test::Echo;
-using quvaidx::test::EventServerTest;
 using quvaidx::test::LogCapture;
-using quvaidx::test::Packet;
-using quvaidx::test::Request;
-using quvaidx::test::Succeed;
+using quvaidx::test::TempDir;
+using Clock = std::chrono::steady_clock;
 
-// A request in pieces reaches the handler once, after its last byte.
-TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPiecesAreJoined) {
-  handler_ = Succeed;
+const std::string kSuccess = "{\"success\":true}\n";
+
+std::string Packet(const std::string& body) {
+  const size_t n = body.size();
+  return std::string("\x15\xbe", 2) + static_cast<char>(n >> 8) +
+         static_cast<char>(n & 0xff) + body;
+}
+
+std::string Request(const std::string& command) {
+  return Packet("{\"command\":\"" + command + "\"}\n");
+}
+
+long long MsSince(Clock::time_point start) {
+  return std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() -
+                                                               start)
+      .count();
+}
+
+// A listening socket at `path` that never accepts: a live daemon.
+int Listen(const std::string& path) {
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  path.copy(address.sun_path, sizeof(address.sun_path) - 1);
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) !=
+          0 ||
+      listen(fd, 4) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+int Succeed(Json::Value&, Json::Value& reply) {
+  reply = MakeResponse(true, nullptr);
+  return 0;
+}
+
+// The server on a fresh event base; every request is recorded in requests_
+// and answered by handler_ (none: an untouched reply).
+class EventServerTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    base_ = event_base_new();
+    ASSERT_NE(base_, nullptr);
+    args_ = {"testd", this,
+             [](Json::Value& request, Json::Value& reply, EventArgs* args) {
+               auto* self = static_cast<EventServerTest*>(args->context);
+               self->requests_.push_back(request);
+               return self->handler_ ? self->handler_(request, reply) : 0;
+             }};
+  }
+
+  void TearDown() override {
+    for (int fd : clients_) close(fd);
+    clients_.clear();
+    RunFor(5);  // let the server see the closes
+    EXPECT_EQ(GetCurrentConnCount(), 0);
+    StopServer(path_.c_str());
+    SetServerLimits(nullptr);
+    event_base_free(base_);
+    EXPECT_TRUE(leaks_.NoLeak());
+  }
+
+  void Start(const ServerLimits* limits = nullptr) {
+    SetServerLimits(limits);
+    ASSERT_EQ(BuildServer(base_, path_.c_str(), &args_), 0);
+  }
+
+  // Connects without running the loop, so nothing is accepted yet.
+  int RawConnect() {
+    clients_.push_back(ConnectPeer(path_.c_str(), false, 1));
+    return clients_.back();
+  }
+
+  int Connect() {
+    int fd = RawConnect();
+    RunFor(2);  // accept
+    return fd;
+  }
+
+  void Send(int fd, const std::string& bytes) {
+    ASSERT_EQ(write(fd, bytes.data(), bytes.size()),
+              static_cast<ssize_t>(bytes.size()));
+  }
+
+  // Runs the loop without blocking until `done` holds or `ms` milliseconds
+  // passed, at least once; returns whether it held.
+  bool RunUntil(const std::function<bool()>& done, int ms) {
+    const auto end = Clock::now() + std::chrono::milliseconds(ms);
+    do {
+      event_base_loop(base_, EVLOOP_NONBLOCK);
+      usleep(200);
+    } while (!done() && Clock::now() < end);
+    return done();
+  }
+
+  void RunFor(int ms) {
+    RunUntil([] { return false; }, ms);
+  }
+
+  // True when the server has closed fd; what it sent first is kept for
+  // Receive.
+  bool ServerClosed(int fd) {
+    char buf[65536];
+    for (;;) {
+      ssize_t got = recv(fd, buf, sizeof(buf), MSG_DONTWAIT);
+      if (got == 0 || (got < 0 && errno == ECONNRESET)) return true;
+      if (got < 0) return false;
+      pending_[fd].append(buf, static_cast<size_t>(got));
+    }
+  }
+
+  // Runs the loop until `n` bytes arrived on fd, the server closed it, or
+  // `ms` milliseconds passed. Returns at most n bytes; the rest stays for
+  // the next call.
+  std::string Receive(int fd, size_t n, bool* closed = nullptr, int ms = 1000) {
+    std::string& pending = pending_[fd];
+    bool ended = false;
+    RunUntil([&] { return (ended = ServerClosed(fd)) || pending.size() >= n; },
+             ms);
+    if (closed != nullptr) *closed = ended;
+    std::string out = pending.substr(0, n);
+    pending.erase(0, out.size());
+    return out;
+  }
+
+  // Receives one reply packet and returns its body.
+  std::string ReceiveBody(int fd, int ms = 1000) {
+    std::string header = Receive(fd, 4, nullptr, ms);
+    if (header.size() < 4) return "";
+    return Receive(fd, (static_cast<unsigned char>(header[2]) << 8) |
+                           static_cast<unsigned char>(header[3]));
+  }
+
+  // True when the server closed fd without sending anything more.
+  bool ClosedSilently(int fd) {
+    bool closed = false;
+    return Receive(fd, 1, &closed).empty() && closed;
+  }
+
+  quvaidx::test::FdLeakCheck leaks_;
+  TempDir dir_;
+  std::string path_ = dir_.File("testd.sock");
+  struct event_base* base_ = nullptr;
+  EventArgs args_{};
+  std::function<int(Json::Value&, Json::Value&)> handler_;
+  std::vector<Json::Value> requests_;
+  std::vector<int> clients_;
+  std::map<int, std::string> pending_;
+};
+
+// A request in pieces reaches the handler once, after its last byte; the
+// handler learns who is asking (nobody, outside its calls); a reply it does
+// not touch goes out as {}.
+TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPeerIsKnown) {
+  PeerCredentials seen = {-1, 0, 0};
+  handler_ = [&](Json::Value& request, Json::Value& reply) {
+    EXPECT_EQ(GetPeerCredentials(&seen), 0);
+    return Succeed(request, reply);
+  };
   Start();
   int fd = Connect();
-  std::string packet = Request("HANDSHAKE");
+  const std::string packet = Request("HANDSHAKE");
   for (size_t i = 0; i + 1 < packet.size(); ++i) {
     Send(fd, packet.substr(i, 1));
     RunFor(1);
   }
   EXPECT_TRUE(requests_.empty());
   Send(fd, packet.substr(packet.size() - 1));
-  EXPECT_EQ(Receive(fd, 21),
-            std::string("\x15\xbe\x00\x11{\"success\":true}\n", 21));
+  EXPECT_EQ(Receive(fd, 21), std::string("\x15\xbe\x00\x11", 4) + kSuccess);
   ASSERT_EQ(requests_.size(), 1u);
   EXPECT_EQ(requests_[0]["command"].asString(), "HANDSHAKE");
+  EXPECT_TRUE(seen.pid == getpid() && seen.uid == getuid() &&
+              seen.gid == getgid());
+  PeerCredentials untouched = {-7, 0, 0};
+  EXPECT_EQ(GetPeerCredentials(&untouched), -1);
+  EXPECT_EQ(untouched.pid, -7);
   handler_ = nullptr;
   Send(fd, Request("UNTOUCHED"));
   EXPECT_EQ(ReceiveBody(fd), "{}\n");
@@ -59,7 +225,10 @@ TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPiecesAreJoined) {
 // for another byte. A non-zero handler result closes the connection without
 // a reply, after the earlier replies; other connections go on.
 TEST_F(EventServerTest, PipelinedRequestsAndRefusal) {
-  handler_ = Echo;
+  handler_ = [](Json::Value& request, Json::Value& reply) {
+    reply["echo"] = request["command"];
+    return request["command"] == "QUIT" ? -1 : 0;
+  };
   Start();
   int fd = Connect();
   int other = Connect();
@@ -79,53 +248,25 @@ TEST_F(EventServerTest, PipelinedRequestsAndRefusal) {
 TEST_F(EventServerTest, RejectedBodyReachesTheHandlerEmpty) {
   handler_ = Succeed;
   Start();
-  struct Case {
-    std::string body;
-    const char* request;  // as the handler saw it, compact
-  } cases[] = {
+  const std::pair<std::string, std::string> cases[] = {
+      // body, and the request as the handler saw it
       {"{\"command\":\"ECHO\",\"x\":1", "{}"},  // truncated
-      {"{\"command\":\"ECHO\",\"x\":", "{}"},
       {"[\"ECHO\"", "{}"},
       {"plain words", "{}"},
-      {std::string(5000, '['), "{}"},  // nested too deeply
+      {std::string(5000, '['), "{}"},  // nested too deeply: the reader throws
       {"", "{}"},
       {"{\"command\":\"ECHO\"} and more", "{\"command\":\"ECHO\"}"},
-      {"{\"command\":\"ECHO\"}\n", "{\"command\":\"ECHO\"}"},
       {"7", "7"},
   };
   int fd = Connect();
-  for (const Case& c : cases) Send(fd, Packet(c.body));
-  for (size_t i = 0; i < std::size(cases); ++i) {
-    EXPECT_EQ(ReceiveBody(fd), "{\"success\":true}\n");
+  for (const auto& [body, seen] : cases) {
+    requests_.clear();
+    Send(fd, Packet(body));
+    EXPECT_EQ(ReceiveBody(fd), kSuccess);
+    ASSERT_EQ(requests_.size(), 1u);
+    EXPECT_EQ(Json::FastWriter().write(requests_[0]), seen + "\n")
+        << body.substr(0, 40);
   }
-  ASSERT_EQ(requests_.size(), std::size(cases));
-  Json::FastWriter writer;
-  for (size_t i = 0; i < std::size(cases); ++i) {
-    EXPECT_EQ(writer.write(requests_[i]), std::string(cases[i].request) + "\n")
-        << cases[i].body.substr(0, 40);
-  }
-}
-
-// During a handler call the peer's credentials are known; outside, not.
-TEST_F(EventServerTest, HandlerLearnsWhoIsAsking) {
-  PeerCredentials seen = {-1, 0, 0};
-  int result = 1;
-  handler_ = [&](Json::Value&, Json::Value& reply) {
-    result = GetPeerCredentials(&seen);
-    reply["success"] = result == 0;
-    return 0;
-  };
-  Start();
-  int fd = Connect();
-  Send(fd, Request("WHO"));
-  EXPECT_EQ(ReceiveBody(fd), "{\"success\":true}\n");
-  EXPECT_EQ(result, 0);
-  EXPECT_EQ(seen.pid, getpid());
-  EXPECT_EQ(seen.uid, getuid());
-  EXPECT_EQ(seen.gid, getgid());
-  PeerCredentials untouched = {-7, 0, 0};
-  EXPECT_EQ(GetPeerCredentials(&untouched), -1);
-  EXPECT_EQ(untouched.pid, -7);
 }
 
 // A throwing handler is logged and its connection closed; a reply too large
@@ -147,7 +288,7 @@ TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
     return 0;
   };
   int big = Connect();
-  Send(big, Request("BIG"));  // a reply too large is replaced
+  Send(big, Request("BIG"));
   EXPECT_EQ(ReceiveBody(big),
             "{\"reason\":\"reply too large\",\"success\":false}\n");
   int fd = Connect();
@@ -156,21 +297,6 @@ TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
   EXPECT_EQ(requests_.size(), 2u);
   EXPECT_EQ(GetCurrentConnCount(), 1);
   EXPECT_EQ(log.lines().size(), 3u);
-}
-
-// A listening socket at `path` that never accepts: a live daemon.
-int Listen(const std::string& path) {
-  struct sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  path.copy(address.sun_path, sizeof(address.sun_path) - 1);
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) !=
-          0 ||
-      listen(fd, 4) != 0) {
-    close(fd);
-    return -1;
-  }
-  return fd;
 }
 
 // Only a stale socket is replaced. Anything else at the path stays as it
@@ -207,12 +333,7 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
     EXPECT_EQ(after.st_mode & S_IFMT, c.type);
     if (c.result == 0) {
       EXPECT_TRUE(log.lines().empty());
-      int client = ConnectPeer(path.c_str(), false, 1);  // ours now
-      EXPECT_GE(client, 0);
-      close(client);
-      RunFor(5);
       StopServer(path.c_str());
-      EXPECT_NE(access(path.c_str(), F_OK), 0);
       continue;
     }
     EXPECT_EQ(after.st_ino, before.st_ino);
@@ -238,7 +359,7 @@ TEST_F(EventServerTest, OverlongPathAndSecondServer) {
   EXPECT_TRUE(S_ISREG(st.st_mode));
   EXPECT_EQ(log.lines().size(), 1u);
   Start();
-  std::string other = dir_.File("other.sock");  // a second server
+  std::string other = dir_.File("other.sock");
   EXPECT_EQ(BuildServer(base_, other.c_str(), &args_), -1);
   EXPECT_NE(access(other.c_str(), F_OK), 0);
 }
@@ -287,35 +408,55 @@ TEST_F(EventServerTest, AcceptErrorEndsTheLoop) {
   EXPECT_NE(g_listener, nullptr);
 }
 
-TEST_F(EventServerTest, RunningOutOfDescriptorsPausesAccepting) {
+// Out of descriptors, the daemon's loop goes on. With no connection to
+// give up, accepting pauses and resumes. When a flood of connections stalled
+// in a request holds the descriptors, the longest waiting are given up, so
+// a client that then asks is answered long before the deadlines would have
+// freed anything.
+TEST_F(EventServerTest, RunningOutOfDescriptorsLocksNoClientOut) {
   LogCapture log;
   handler_ = Succeed;
-  Start();
-  int fd = RawConnect();
+  const ServerLimits limits = {30000, 30000, kMaxTotalPendingOutput};
+  Start(&limits);
   struct rlimit saved;
   getrlimit(RLIMIT_NOFILE, &saved);
-  struct rlimit low = saved;
-  low.rlim_cur = 256;
-  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
   std::vector<int> filler;
-  for (int d; (d = dup(0)) >= 0;) filler.push_back(d);
+  auto exhaust = [&](size_t spare) {  // takes all descriptors but `spare`
+    struct rlimit low = {256, saved.rlim_max};
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
+    for (int d; (d = dup(0)) >= 0;) filler.push_back(d);
+    for (; spare > 0; --spare, filler.pop_back()) close(filler.back());
+  };
+  auto restore = [&] {
+    for (int d : filler) close(d);
+    filler.clear();
+    setrlimit(RLIMIT_NOFILE, &saved);
+  };
+  const std::string accept_failed =
+      "quvaidx_daemon:N [Error] accept: 24, Too many open files; ";
+  int fd = RawConnect();
+  exhaust(0);
   RunFor(20);
   EXPECT_EQ(GetCurrentConnCount(), 0);
-  ASSERT_EQ(log.lines().size(), 1u);
-  EXPECT_EQ(
-      log.Normalized()[0].rfind("quvaidx_daemon:N [Error] accept: 24, ", 0),
-      0u);
-  for (int d : filler) close(d);
-  setrlimit(RLIMIT_NOFILE, &saved);
-  // After the pause the connection is served.
+  EXPECT_EQ(log.Count(accept_failed + "pausing for 100 ms"), 1);
+  restore();
   Send(fd, Request("HANDSHAKE"));
-  EXPECT_EQ(ReceiveBody(fd, 3), "{\"success\":true}\n");
+  EXPECT_EQ(ReceiveBody(fd, 3000), kSuccess);
+  for (int i = 0; i < 40; ++i) Send(Connect(), std::string("\x15\xbe", 2));
+  RunFor(150);  // all accepted, and stalled for longer than a pause
+  ASSERT_EQ(GetCurrentConnCount(), 41);
+  exhaust(1);  // room for one more client
+  int asking = RawConnect();
+  Send(asking, Request("HELLO"));
+  EXPECT_EQ(ReceiveBody(asking), kSuccess);
+  restore();
+  EXPECT_EQ(log.Count(accept_failed + "closed 16 stalled connections"), 1);
+  EXPECT_EQ(GetCurrentConnCount(), 41 + 1 - 16);
 }
 
-// Replies to a client that is gone raise no SIGPIPE; replies to a client
-// that does not read are bounded.
-TEST_F(EventServerTest, SlowOrGoneClientsDoNotHurtTheDaemon) {
-  signal(SIGPIPE, SIG_DFL);
+// Replies to a client that does not read are bounded, and all sent once it
+// reads.
+TEST_F(EventServerTest, RepliesToASlowClientAreBounded) {
   const std::string blob(10000, 'r');
   handler_ = [&](Json::Value&, Json::Value& reply) {
     reply["blob"] = blob;
@@ -325,18 +466,6 @@ TEST_F(EventServerTest, SlowOrGoneClientsDoNotHurtTheDaemon) {
   const int kRequests = 400;  // 4 MB of replies
   std::string requests;
   for (int i = 0; i < kRequests; ++i) requests += Request("R");
-  int gone = Connect();
-  Send(gone, requests.substr(0, requests.size() / 4));
-  RunFor(10);  // replies pile up unread
-  close(gone);
-  clients_.clear();
-  RunFor(20);  // writing to the closed client raises SIGPIPE, if not ignored
-  EXPECT_EQ(GetCurrentConnCount(), 0);
-  struct sigaction action;
-  sigaction(SIGPIPE, nullptr, &action);
-  EXPECT_EQ(action.sa_handler, SIG_IGN);
-
-  requests_.clear();
   int fd = Connect();
   Send(fd, requests);
   RunFor(50);
@@ -344,10 +473,159 @@ TEST_F(EventServerTest, SlowOrGoneClientsDoNotHurtTheDaemon) {
   size_t served = requests_.size();
   EXPECT_LT(served, static_cast<size_t>(kRequests));
   EXPECT_LT(served * blob.size(), kMaxPendingOutput + 2 * 1024 * 1024);
-  // Once the client reads, everything is answered.
   const size_t reply_size = 4 + blob.size() + 12;
   EXPECT_EQ(Receive(fd, reply_size * kRequests).size(), reply_size * kRequests);
   EXPECT_EQ(requests_.size(), static_cast<size_t>(kRequests));
+}
+
+// A request that trickles in is closed at the packet deadline counted from
+// its first byte, however steadily its bytes come; a silent connection at
+// the idle deadline; a client that keeps asking is never closed.
+TEST_F(EventServerTest, StalledPeersAreClosedAtTheirDeadlines) {
+  const ServerLimits limits = {150, 400, kMaxTotalPendingOutput};
+  handler_ = Succeed;
+  Start(&limits);
+  LogCapture log(6);
+  int trickle = Connect();
+  int silent = Connect();
+  int good = Connect();
+  const auto start = Clock::now();
+  Send(trickle, std::string("\x15\xbe\x00\x64{", 5));  // 100 bytes announced
+  long long trickle_closed = -1;
+  long long silent_closed = -1;
+  int answered = 0;
+  for (int round = 0; MsSince(start) < 1000; ++round) {
+    RunFor(25);
+    if (trickle_closed < 0) {
+      send(trickle, " ", 1, MSG_DONTWAIT | MSG_NOSIGNAL);
+      if (ServerClosed(trickle)) trickle_closed = MsSince(start);
+    }
+    if (silent_closed < 0 && ServerClosed(silent)) {
+      silent_closed = MsSince(start);
+    }
+    if (round % 4 == 0) {
+      Send(good, Request("PING"));
+      answered += ReceiveBody(good) == kSuccess;
+    }
+  }
+  EXPECT_GE(trickle_closed, 140);
+  EXPECT_LT(trickle_closed, 400);
+  EXPECT_GE(silent_closed, 390);
+  EXPECT_LT(silent_closed, 1000);
+  EXPECT_FALSE(ServerClosed(good));
+  EXPECT_EQ(answered, static_cast<int>(requests_.size()));
+  EXPECT_GE(answered, 8);
+  EXPECT_EQ(GetCurrentConnCount(), 1);
+  const std::string closed = "quvaidx_daemon:N [testd] closed 1 stalled ";
+  EXPECT_EQ(log.Count(closed + "connections: 1 in a request for over 150 ms, "
+                               "0 waiting for over 400 ms"),
+            1);
+  EXPECT_EQ(log.Count(closed + "connections: 0 in a request for over 150 ms, "
+                               "1 waiting for over 400 ms"),
+            1);
+}
+
+// A client that pipelines its requests and shuts down its sending side gets
+// every reply before the server closes.
+TEST_F(EventServerTest, HalfClosedClientGetsEveryReply) {
+  handler_ = Succeed;
+  Start();
+  const int kRequests = 20000;
+  std::string requests;
+  for (int i = 0; i < kRequests; ++i) requests += Request("R");
+  int fd = Connect();
+  // Everything goes out before the client reads a byte, so replies are
+  // still queued in the server when it sees the end of the stream.
+  for (size_t sent = 0; sent < requests.size();) {
+    ssize_t n = send(fd, requests.data() + sent, requests.size() - sent,
+                     MSG_DONTWAIT | MSG_NOSIGNAL);
+    sent += n > 0 ? static_cast<size_t>(n) : 0;
+    event_base_loop(base_, EVLOOP_NONBLOCK);
+  }
+  ASSERT_EQ(shutdown(fd, SHUT_WR), 0);
+  bool closed = false;
+  const std::string reply = std::string("\x15\xbe\x00\x11", 4) + kSuccess;
+  std::string received =
+      Receive(fd, reply.size() * kRequests + 1, &closed, 10000);
+  EXPECT_TRUE(closed);
+  EXPECT_EQ(requests_.size(), static_cast<size_t>(kRequests));
+  ASSERT_EQ(received.size(), reply.size() * kRequests);
+  for (size_t at = 0; at < received.size(); at += reply.size()) {
+    ASSERT_EQ(received.compare(at, reply.size(), reply), 0) << at;
+  }
+  EXPECT_EQ(GetCurrentConnCount(), 0);
+}
+
+// A connection finishing (a refused request after replies that did not all
+// fit the socket) whose client goes away is closed on the write error, not
+// left to the idle deadline; writing to the vanished client raises no
+// SIGPIPE, which would end the daemon.
+TEST_F(EventServerTest, ErrorOnAFinishingConnectionClosesIt) {
+  signal(SIGPIPE, SIG_DFL);
+  handler_ = [](Json::Value& request, Json::Value& reply) {
+    reply["blob"] = std::string(8000, 'b');
+    return request["command"] == "QUIT" ? -1 : 0;
+  };
+  Start();
+  std::string requests;
+  for (int i = 0; i < 60; ++i) requests += Request("BIG");
+  int fd = Connect();
+  Send(fd, requests + Request("QUIT"));
+  ASSERT_TRUE(RunUntil([&] { return requests_.size() == 61; }, 2000));
+  ASSERT_EQ(GetCurrentConnCount(), 1);  // still writing its replies
+  close(fd);
+  clients_.clear();
+  EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 2000));
+  struct sigaction action;
+  sigaction(SIGPIPE, nullptr, &action);
+  EXPECT_EQ(action.sa_handler, SIG_IGN);
+}
+
+// However many clients leave their replies unread, the unsent replies of
+// all connections stay within the bound: the connection holding the most
+// goes. Others are still served.
+TEST_F(EventServerTest, UnsentRepliesOfAllConnectionsAreBounded) {
+  const size_t kBound = 1 << 20;
+  const ServerLimits limits = {kPacketDeadlineMs, kIdleDeadlineMs, kBound};
+  handler_ = [](Json::Value&, Json::Value& reply) {
+    reply["blob"] = std::string(4000, 'b');
+    return 0;
+  };
+  Start(&limits);
+  LogCapture log;
+  std::string burst;  // about 400 KB of replies, more than a socket holds
+  for (int i = 0; i < 100; ++i) burst += Request("R");
+  const int kClients = 300;
+  size_t peak = 0;
+  for (int i = 0; i < kClients; ++i) {
+    int fd = RawConnect();
+    ASSERT_GE(fd, 0);
+    Send(fd, burst);
+    for (int step = 0; step < 4; ++step) {
+      event_base_loop(base_, EVLOOP_NONBLOCK);
+      peak = std::max(peak, quvaidx::PendingOutputTotal());
+    }
+  }
+  EXPECT_LE(peak, kBound);
+  EXPECT_GT(peak, kBound / 2);
+  int closed = 0;
+  for (const std::string& line : log.Normalized()) {
+    closed += line.rfind(
+                  "quvaidx_daemon:N [Error] [testd] unsent replies "
+                  "over 1048576 bytes in all: closed fd = ",
+                  0) == 0;
+  }
+  EXPECT_EQ(static_cast<size_t>(closed), log.lines().size());
+  EXPECT_GT(closed, kClients / 2);
+  EXPECT_EQ(GetCurrentConnCount(), kClients - closed);
+  handler_ = Succeed;
+  int fresh = Connect();
+  Send(fresh, Request("STILL_THERE"));
+  EXPECT_EQ(ReceiveBody(fresh), kSuccess);
+  for (int fd : clients_) close(fd);
+  clients_.clear();
+  EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 5000));
+  EXPECT_EQ(quvaidx::PendingOutputTotal(), 0u);
 }
 
 }  // namespace

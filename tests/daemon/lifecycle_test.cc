@@ -4,18 +4,19 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <chrono>
 #include <fstream>
-#include <iterator>
+#include <functional>
 #include <sstream>
 #include <string>
-#include <thread>
+#include <utility>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -35,6 +36,15 @@ using quvaidx::test::TempDir;
 
 using quvaidx::test::ReadFile;
 using quvaidx::test::WriteFile;
+
+// Polls `done` for up to five seconds; returns whether it held.
+bool WaitFor(const std::function<bool()>& done) {
+  for (int i = 0; i < 2500; ++i) {
+    if (done()) return true;
+    usleep(2000);
+  }
+  return done();
+}
 
 class LifecycleTest : public ::testing::Test {
  protected:
@@ -92,30 +102,25 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   ASSERT_EQ(mkfifo(dir_.File("fifo").c_str(), 0600), 0);
   ASSERT_EQ(mkdir(dir_.File("dir").c_str(), 0700), 0);
   ASSERT_EQ(link(victim.c_str(), dir_.File("hardlink").c_str()), 0);
-  const std::string not_regular =
-      " is not a regular file; not used as a pid "
-      "file";
-  struct Case {
-    const char* name;
-    std::string line;  // after "quvaidx_daemon:N [Error] " and the path
-  } cases[] = {
-      {"link", not_regular},
-      {"dangling", not_regular},
-      {"fifo", not_regular},
-      {"dir", not_regular},
+  const std::string odd = " is not a regular file; not used as a pid file";
+  const std::pair<const char*, std::string> cases[] = {
+      // name, and the line after "quvaidx_daemon:N [Error] " and the path
+      {"link", odd},
+      {"dangling", odd},
+      {"fifo", odd},
+      {"dir", odd},
       {"hardlink", " has 2 names; not used as a pid file"},
   };
   alarm(10);  // an open waiting on the FIFO would end the test here
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.name);
-    const std::string path = dir_.File(c.name);
+  for (const auto& [name, line] : cases) {
+    SCOPED_TRACE(name);
+    const std::string path = dir_.File(name);
     struct stat before;
     ASSERT_EQ(lstat(path.c_str(), &before), 0);
     LogCapture log;
     EXPECT_EQ(BecomeProcess(path.c_str()), -1);
-    EXPECT_EQ(
-        log.Normalized(),
-        std::vector<std::string>{"quvaidx_daemon:N [Error] " + path + c.line});
+    EXPECT_EQ(log.Normalized(), std::vector<std::string>{
+                                    "quvaidx_daemon:N [Error] " + path + line});
     struct stat after;
     ASSERT_EQ(lstat(path.c_str(), &after), 0);
     EXPECT_EQ(after.st_mode, before.st_mode);
@@ -125,43 +130,67 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   EXPECT_NE(access(dir_.File("nowhere").c_str(), F_OK), 0);
 }
 
+// Instances of a daemon in child processes: each runs BecomeProcess on the
+// pid file once Go() is called, reports whether it runs, and lives until
+// End().
+class Instances {
+ public:
+  Instances(const std::string& pid_file, int count) {
+    if (pipe(go_) != 0 || pipe(report_) != 0 || pipe(hold_) != 0) return;
+    for (int i = 0; i < count; ++i) {
+      pids_.push_back(fork());
+      if (pids_.back() == 0) Run(pid_file);
+    }
+    close(go_[0]);
+    close(report_[1]);
+    close(hold_[0]);
+  }
+  ~Instances() { End(); }
+
+  // Lets all start at once; one letter per instance: R runs, - refused.
+  std::string Go() {
+    close(go_[1]);
+    std::string outcome;
+    char byte;
+    while (outcome.size() < pids_.size() && read(report_[0], &byte, 1) == 1) {
+      outcome += byte;
+    }
+    return outcome;
+  }
+
+  void End() {
+    if (pids_.empty()) return;
+    close(hold_[1]);
+    close(report_[0]);
+    for (pid_t pid : pids_) waitpid(pid, nullptr, 0);
+    pids_.clear();
+  }
+
+  pid_t pid(size_t i) const { return pids_[i]; }
+
+ private:
+  [[noreturn]] void Run(const std::string& pid_file) {
+    char byte = 0;
+    close(go_[1]);
+    close(report_[0]);
+    close(hold_[1]);
+    (void)!read(go_[0], &byte, 1);         // all start when go closes
+    dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
+    byte = BecomeProcess(pid_file.c_str()) == 0 ? 'R' : '-';
+    (void)!write(report_[1], &byte, 1);
+    (void)!read(hold_[0], &byte, 1);  // a runner lives until End()
+    _exit(0);
+  }
+
+  int go_[2] = {-1, -1}, report_[2] = {-1, -1}, hold_[2] = {-1, -1};
+  std::vector<pid_t> pids_;
+};
+
 // Of instances started at the same moment exactly one runs, every time:
 // the check of the pid in the file alone lets several through.
 TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
-  const int kTries = 50;
-  const int kInstances = 3;
-  for (int attempt = 0; attempt < kTries; ++attempt) {
-    int go[2], results[2], hold[2];
-    ASSERT_EQ(pipe(go) | pipe(results) | pipe(hold), 0);
-    std::vector<pid_t> instances;
-    for (int i = 0; i < kInstances; ++i) {
-      pid_t child = fork();
-      ASSERT_GE(child, 0);
-      if (child == 0) {
-        char byte = 0;
-        close(go[1]);
-        close(hold[1]);
-        (void)!read(go[0], &byte, 1);          // all start when go closes
-        dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
-        byte = BecomeProcess(pid_file_.c_str()) == 0 ? 'R' : '-';
-        (void)!write(results[1], &byte, 1);
-        (void)!read(hold[0], &byte, 1);  // a runner lives until all tried
-        _exit(0);
-      }
-      instances.push_back(child);
-    }
-    close(go[0]);
-    close(results[1]);
-    close(hold[0]);
-    close(go[1]);
-    std::string outcome;
-    char byte;
-    while (outcome.size() < kInstances && read(results[0], &byte, 1) == 1) {
-      outcome += byte;
-    }
-    close(hold[1]);
-    close(results[0]);
-    for (pid_t child : instances) waitpid(child, nullptr, 0);
+  for (int attempt = 0; attempt < 50; ++attempt) {
+    std::string outcome = Instances(pid_file_, 3).Go();
     ASSERT_EQ(std::count(outcome.begin(), outcome.end(), 'R'), 1)
         << "attempt " << attempt << ": " << outcome;
   }
@@ -170,34 +199,19 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
 // DeletePidFile removes a stale pid file and this process's own, never that
 // of another live instance.
 TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
-  int hold[2];
-  ASSERT_EQ(pipe(hold), 0);
-  pid_t other = fork();
-  ASSERT_GE(other, 0);
-  if (other == 0) {
-    close(hold[1]);
-    char byte = 0;
-    if (BecomeProcess(pid_file_.c_str()) != 0) _exit(3);
-    (void)!read(hold[0], &byte, 1);  // lives until the pipe closes
-    _exit(0);
-  }
-  close(hold[0]);
-  auto end = std::chrono::steady_clock::now() + std::chrono::seconds(2);
-  while (ReadFile(pid_file_) != std::to_string(other)) {
-    ASSERT_LT(std::chrono::steady_clock::now(), end);
-    usleep(2000);
-  }
+  Instances other(pid_file_, 1);
+  ASSERT_EQ(other.Go(), "R");
+  const std::string pid = std::to_string(other.pid(0));
   {
     LogCapture log;
     EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);
-    EXPECT_EQ(log.Normalized(), std::vector<std::string>{
-                                    "quvaidx_daemon:N [Error] " + pid_file_ +
-                                    " names live process " +
-                                    std::to_string(other) + "; not removed"});
+    EXPECT_EQ(log.Normalized(),
+              std::vector<std::string>{"quvaidx_daemon:N [Error] " + pid_file_ +
+                                       " names live process " + pid +
+                                       "; not removed"});
   }
-  EXPECT_EQ(ReadFile(pid_file_), std::to_string(other));
-  close(hold[1]);
-  waitpid(other, nullptr, 0);
+  EXPECT_EQ(ReadFile(pid_file_), pid);
+  other.End();
   EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);  // stale now
   EXPECT_NE(access(pid_file_.c_str(), F_OK), 0);
   quvaidx::test::FdLeakCheck leaks;
@@ -205,25 +219,6 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);  // our own
   EXPECT_NE(access(pid_file_.c_str(), F_OK), 0);
   EXPECT_TRUE(leaks.NoLeak());  // and its lock released
-}
-
-TEST_F(LifecycleTest, RecycledPidDoesNotLockTheDaemonOut) {
-  // The pid file was written an hour ago; the process now holding its pid
-  // started after that, so it cannot be the daemon that wrote it.
-  pid_t stranger = fork();
-  if (stranger == 0) {
-    pause();
-    _exit(0);
-  }
-  WriteFile(pid_file_, std::to_string(stranger));
-  struct timespec times[2] = {{time(nullptr) - 3600, 0},
-                              {time(nullptr) - 3600, 0}};
-  ASSERT_EQ(utimensat(AT_FDCWD, pid_file_.c_str(), times, 0), 0);
-  int result = BecomeProcess(pid_file_.c_str());
-  kill(stranger, SIGKILL);
-  waitpid(stranger, nullptr, 0);
-  EXPECT_EQ(result, 0);
-  EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
 }
 
 // The detached process also keeps the lock taken before detaching: a second
@@ -254,11 +249,7 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   int status = 0;
   waitpid(child, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  auto end = std::chrono::steady_clock::now() + std::chrono::seconds(2);
-  while (access(report.c_str(), F_OK) != 0 &&
-         std::chrono::steady_clock::now() < end) {
-    usleep(2000);
-  }
+  ASSERT_TRUE(WaitFor([&] { return access(report.c_str(), F_OK) == 0; }));
   std::istringstream fields(ReadFile(report));
   std::string pid, leader, cwd, stdin_target;
   fields >> pid >> leader >> cwd >> stdin_target;
@@ -273,15 +264,14 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   EXPECT_EQ(::testing::internal::GetCapturedStdout(),
             "Daemon alive. No need to start\n");
   WriteFile(stop, "");
-  // Ended: a zombie its new parent has not reaped yet counts.
-  auto running = [&] {
-    std::string stat = ReadFile("/proc/" + pid + "/stat");
-    size_t close = stat.rfind(')');
-    return close != std::string::npos && stat.compare(close, 3, ") Z") != 0;
-  };
-  end = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-  while (running() && std::chrono::steady_clock::now() < end) usleep(2000);
-  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), 0);  // the lock went with it
+  // Once it ends, its lock goes with it.
+  EXPECT_TRUE(WaitFor([&] {
+    int fd = open(pid_file_.c_str(), O_RDONLY | O_CLOEXEC);
+    bool free = flock(fd, LOCK_EX | LOCK_NB) == 0;
+    close(fd);
+    return free;
+  }));
+  EXPECT_EQ(BecomeProcess(pid_file_.c_str()), 0);
 }
 
 // Ready at once, polled every ten seconds, or given up after fifteen

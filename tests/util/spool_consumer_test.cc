@@ -149,20 +149,6 @@ TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadLines) {
   EXPECT_EQ(ReadFile(queue_), "/back\n");
 }
 
-TEST_F(SpoolConsumerTest, TrimRemovesTheHeadAndKeepsTheMode) {
-  WriteFile(queue_, "/a\n/b\n/c");
-  chmod(queue_.c_str(), 0640);
-  EXPECT_EQ(TrimQueueHead(queue_.c_str(), 0), 0);
-  EXPECT_EQ(ReadFile(queue_), "/a\n/b\n/c");
-  EXPECT_EQ(TrimQueueHead(queue_.c_str(), 1), 0);
-  EXPECT_EQ(ReadFile(queue_), "/b\n/c");
-  EXPECT_EQ(TrimQueueHead(queue_.c_str(), 99), 0);
-  EXPECT_EQ(ReadFile(queue_), "");
-  struct stat st;
-  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0640u);
-}
-
 // A consumer that waited for the lock while the queue was replaced must
 // read and trim the new file, not the unlinked old one.
 TEST_F(SpoolConsumerTest, WaiterFollowsAQueueReplacedWhileItWaited) {
