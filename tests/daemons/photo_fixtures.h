@@ -1,7 +1,7 @@
 // Photos made at test time for the preview daemons' tests: images of known
-// content written with libvips, EXIF orientations set with exiftool, a PNG
-// decompression bomb written with zlib, and readers for what a thumbnail
-// turned out to be. Nothing is copied in from elsewhere.
+// content and a PNG decompression bomb written with libvips, EXIF
+// orientations set with exiftool, and readers for what a thumbnail turned
+// out to be. Nothing is copied in from elsewhere.
 #ifndef QUVAIDX_TESTS_DAEMONS_PHOTO_FIXTURES_H_
 #define QUVAIDX_TESTS_DAEMONS_PHOTO_FIXTURES_H_
 
@@ -24,7 +24,7 @@ bool WritePhoto(const std::string& path, int width, int height, Rgb left,
                 Rgb right, int bands = 3, int alpha = 255);
 
 // Writes a valid 1-bit grey PNG of `width` x `height` black pixels whose
-// compressed data is tiny: a decompression bomb.
+// compressed data is tiny (about a thousandth): a decompression bomb.
 bool WritePngBomb(const std::string& path, int width, int height);
 
 // True when exiftool can be run.
