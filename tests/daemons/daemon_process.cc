@@ -4,29 +4,19 @@
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <fstream>
-#include <sstream>
 #include <thread>
 
+#include "support/fd_check.h"
+
 namespace quvaidx::daemon_test {
-namespace {
-
-std::string Slurp(const std::string& path) {
-  std::ostringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
-}
-
-}  // namespace
 
 bool DaemonProcess::Start(const std::string& program,
                           const std::vector<std::string>& args,
                           const std::string& output_dir,
-                          const std::string& name) {
+                          const std::string& name, const std::string& ready) {
   out_ = output_dir + "/" + name + ".out";
   err_ = output_dir + "/" + name + ".err";
   std::vector<std::string> all = {program};
@@ -34,16 +24,17 @@ bool DaemonProcess::Start(const std::string& program,
   std::vector<char*> argv;
   for (std::string& arg : all) argv.push_back(arg.data());
   argv.push_back(nullptr);
-  pid_ = fork();
-  if (pid_ < 0) return false;
+  // Opened here, not in the child, so that no output of an earlier process
+  // under the same name is taken for this one's.
+  const int out =
+      open(out_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+  const int err =
+      open(err_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+  pid_ = out < 0 || err < 0 ? -1 : fork();
   if (pid_ == 0) {
-    int out = open(out_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    int err = open(err_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (out < 0 || err < 0) _exit(126);
     dup2(out, 1);
     dup2(err, 2);
-    // The test binary may ignore or block signals; the daemon must not
-    // inherit that.
+    // The test binary may block signals; the daemon must not inherit that.
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);
@@ -53,40 +44,33 @@ bool DaemonProcess::Start(const std::string& program,
     execv(argv[0], argv.data());
     _exit(127);
   }
-  return true;
+  if (out >= 0) close(out);
+  if (err >= 0) close(err);
+  WaitUntil(10, [&] {
+    return Output().find(ready) != std::string::npos || !Running();
+  });
+  return Running() && Output().find(ready) != std::string::npos;
 }
 
 DaemonProcess::~DaemonProcess() {
-  if (pid_ > 0 && Running()) {
-    kill(pid_, SIGKILL);
-    int status;
-    WaitExit(5, &status);
-  }
+  if (Signal(SIGKILL)) WaitExit(5, false);
 }
 
-std::string DaemonProcess::Output() const { return Slurp(out_); }
-std::string DaemonProcess::Errors() const { return Slurp(err_); }
+std::string DaemonProcess::Output() const { return test::ReadFile(out_); }
+std::string DaemonProcess::Errors() const { return test::ReadFile(err_); }
 
 bool DaemonProcess::Signal(int signal) {
-  return pid_ > 0 && kill(pid_, signal) == 0;
+  return Running() && kill(pid_, signal) == 0;
 }
 
-bool DaemonProcess::WaitExit(double seconds, int* status) {
-  if (pid_ <= 0) return false;
-  bool ended = WaitUntil(
-      seconds, [&] { return waitpid(pid_, status, WNOHANG) == pid_; });
-  if (ended) pid_ = -1;
-  return ended;
+bool DaemonProcess::WaitExit(double seconds, bool clean) {
+  return WaitUntil(seconds, [&] { return !Running(); }) &&
+         (!clean || (WIFEXITED(status_) && WEXITSTATUS(status_) == 0));
 }
 
 bool DaemonProcess::Running() {
-  if (pid_ <= 0) return false;
-  int status;
-  if (waitpid(pid_, &status, WNOHANG) == pid_) {
-    pid_ = -1;
-    return false;
-  }
-  return true;
+  if (pid_ > 0 && waitpid(pid_, &status_, WNOHANG) == pid_) pid_ = -1;
+  return pid_ > 0;
 }
 
 bool WaitUntil(double seconds, const std::function<bool()>& done) {

@@ -16,26 +16,28 @@ class DaemonProcess {
  public:
   // Starts `program` with `args`; its standard output and error go to
   // `output_dir`/<name>.out and .err, and the host stand-in reads its files
-  // from `output_dir` (QUVA_HOST_ETC). False when it could not be started.
+  // from `output_dir` (QUVA_HOST_ETC). Then waits (10 s at most) until its
+  // standard output holds `ready`. False when it did not get that far.
   bool Start(const std::string& program, const std::vector<std::string>& args,
-             const std::string& output_dir, const std::string& name);
+             const std::string& output_dir, const std::string& name,
+             const std::string& ready);
   ~DaemonProcess();
 
-  pid_t pid() const { return pid_; }
   // Standard output and error so far.
   std::string Output() const;
   std::string Errors() const;
 
   // Sends `signal`; false when the process is gone.
   bool Signal(int signal);
-  // Waits until the process has ended, at most `seconds`; stores its wait
-  // status. False on time-out.
-  bool WaitExit(double seconds, int* status);
+  // Waits until the process has ended, at most `seconds`. True when it did,
+  // with exit status 0 when `clean`.
+  bool WaitExit(double seconds, bool clean = true);
   // True when the process has not ended.
   bool Running();
 
  private:
   pid_t pid_ = -1;
+  int status_ = 0;
   std::string out_;
   std::string err_;
 };

@@ -1,7 +1,7 @@
-// Photos made at test time for the preview daemons' tests: JPEG and PNG
-// files of known content written with libvips, EXIF orientations set with
-// exiftool, a PNG decompression bomb written with zlib, and readers for
-// what a thumbnail turned out to be. Nothing is copied in from elsewhere.
+// Photos made at test time for the preview daemons' tests: images of known
+// content and a PNG decompression bomb written with libvips, EXIF
+// orientations set with exiftool, and readers for what a thumbnail turned
+// out to be. Nothing is copied in from elsewhere.
 #ifndef QUVAIDX_TESTS_DAEMONS_PHOTO_FIXTURES_H_
 #define QUVAIDX_TESTS_DAEMONS_PHOTO_FIXTURES_H_
 
@@ -14,24 +14,17 @@ namespace quvaidx::daemon_test {
 struct Rgb {
   int r, g, b;
 };
+constexpr Rgb kRed = {230, 20, 20};
+constexpr Rgb kBlue = {20, 20, 230};
 
-// Starts libvips for the fixtures (once per process; repeated calls are
-// harmless). False when it cannot start.
-bool StartVips();
+// Writes a `width` x `height` image, in the format its name's suffix says,
+// whose left half is `left` and right half `right`. `bands`: 3 RGB, 1 grey
+// (the red channel), 4 RGB with `alpha` for every pixel. False on failure.
+bool WritePhoto(const std::string& path, int width, int height, Rgb left,
+                Rgb right, int bands = 3, int alpha = 255);
 
-// Writes a `width` x `height` JPEG (quality 90) whose left half is `left`
-// and right half `right`. False on failure.
-bool WriteSplitJpeg(const std::string& path, int width, int height, Rgb left,
-                    Rgb right);
-
-// Writes a PNG of one colour with `bands` bands: 1 grey, 3 RGB, 4 RGB and
-// alpha (then `alpha` is the alpha of every pixel).
-bool WritePng(const std::string& path, int width, int height, int bands,
-              Rgb colour, int alpha = 255);
-
-// Writes a valid 1-bit grey PNG of `width` x `height` black pixels, whose
-// compressed data is tiny (about a thousandth of the pixels): a
-// decompression bomb.
+// Writes a valid 1-bit grey PNG of `width` x `height` black pixels whose
+// compressed data is tiny (about a thousandth): a decompression bomb.
 bool WritePngBomb(const std::string& path, int width, int height);
 
 // True when exiftool can be run.
@@ -51,12 +44,18 @@ struct ImageFacts {
 };
 ImageFacts ReadImage(const std::string& path);
 
-// The mean colour of the box (x, y, w, h), in fractions of the image's
-// width and height, of an 8-bit RGB image file.
-Rgb MeanColour(const std::string& path, double x, double y, double w, double h);
+// The colour of the pixel at (x, y), in fractions of the width and height,
+// of an RGB image file; {-1, -1, -1} when it cannot be read.
+Rgb ColourAt(const std::string& path, double x, double y);
 
 // True when `colour` is within `tolerance` of `expected` in every channel.
 bool Near(Rgb colour, Rgb expected, int tolerance = 40);
+
+// The thumbnail item `label` ("XL", "B", "M", "S"; first name) of `photo`.
+std::string ThumbItem(const std::string& photo, const std::string& label);
+
+// The paths under `dir`, recursively, sorted; relative to `dir`.
+std::vector<std::string> NamesUnder(const std::string& dir);
 
 }  // namespace quvaidx::daemon_test
 

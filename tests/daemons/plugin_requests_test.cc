@@ -5,9 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <chrono>
-#include <filesystem>
 #include <map>
 #include <memory>
 #include <string>
@@ -15,6 +13,7 @@
 
 #include <gtest/gtest.h>
 
+#include "photo_fixtures.h"
 #include "plugin_requests.h"
 #include "quvaidx/ipc.h"
 #include "support/fd_check.h"
@@ -22,8 +21,6 @@
 
 namespace {
 
-using plugind::HandlePluginRequest;
-using plugind::PluginConfig;
 using quvaidx::test::ReadFile;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -44,34 +41,73 @@ class PluginRequestsTest : public ::testing::Test {
  protected:
   Json::Value Ask(const Json::Value& request) {
     Json::Value reply;
-    EXPECT_EQ(HandlePluginRequest(config_, request, &reply), 0);
+    EXPECT_EQ(plugind::HandlePluginRequest(config_, request, &reply), 0);
     return reply;
   }
 
   // Makes `file` in `folder` and the EA items `items` beside it (name ->
-  // content).
+  // content; "<dir>" makes a folder).
   std::string File(const std::string& folder, const std::string& file,
                    const std::map<std::string, std::string>& items = {}) {
+    const std::string ea = dir_.File(folder + "/.quvameta/" + file + "/");
     mkdir(dir_.File(folder).c_str(), 0755);
-    std::string path = dir_.File(folder + "/" + file);
-    WriteFile(path, "photo or video");
+    WriteFile(dir_.File(folder + "/" + file), "photo or video");
     if (!items.empty()) {
       mkdir(dir_.File(folder + "/.quvameta").c_str(), 0755);
-      mkdir(dir_.File(folder + "/.quvameta/" + file).c_str(), 0755);
+      mkdir(ea.c_str(), 0755);
     }
     for (const auto& [name, content] : items) {
-      std::string item = dir_.File(folder + "/.quvameta/" + file + "/" + name);
       if (content == "<dir>") {
-        mkdir(item.c_str(), 0755);
+        mkdir((ea + name).c_str(), 0755);
       } else {
-        WriteFile(item, content);
+        WriteFile(ea + name, content);
       }
     }
-    return path;
+    return dir_.File(folder + "/" + file);
+  }
+
+  // A media parser that answers GET_MEDIA_INFO from `codecs` (path ->
+  // video, audio, container), or with "success" false for other paths, and
+  // counts the questions.
+  std::unique_ptr<ScriptedPeer> Parser(
+      std::map<std::string, std::vector<std::string>> codecs) {
+    config_.media_parser_socket = dir_.File("mediaparser.sock");
+    config_.media_parser_timeout_s = 1;
+    return std::make_unique<ScriptedPeer>(
+        config_.media_parser_socket, [this, codecs](int& fd, int) {
+          Json::Value request;
+          if (RecvPacket(fd, request) != 0) return;
+          ++asked_;
+          Json::Value reply(Json::objectValue);
+          auto found = codecs.find(request["path"].asString());
+          reply["success"] = found != codecs.end();
+          if (found == codecs.end()) {
+            reply["reason"] = "cannot parse";
+          } else {
+            reply["media"]["szVideoCodec"] = found->second[0];
+            reply["media"]["szAudioCodec"] = found->second[1];
+            reply["media"]["szContainerType"] = found->second[2];
+          }
+          SendPacket(fd, reply);
+        });
+  }
+
+  // INDEX_CONVERT_ADD for the copy `copy` of `source`.
+  Json::Value Add(const std::string& source, const std::string& copy,
+                  const Json::Value& package = Json::Value()) {
+    Json::Value request = Request("INDEX_CONVERT_ADD");
+    request["src"]["szPath"] = source;
+    request["src"]["duration"] = 12.5;
+    request["src"]["szTitle"] = 42;  // mistyped: read as an empty text
+    request["convert"]["szPath"] = copy;
+    request["convert"]["resolutionX"] = 1280;
+    if (!package.isNull()) request["package"] = package;
+    return Ask(request);
   }
 
   TempDir dir_;
-  PluginConfig config_;
+  plugind::PluginConfig config_;
+  int asked_ = 0;
 };
 
 // The map has the bit of a size exactly when an item of that size (either
@@ -112,8 +148,9 @@ TEST_F(PluginRequestsTest, SizeMapsMatchTheFilesPresent) {
   }
 }
 
-// The folder's map is that of its first web photo by bytewise name:
-// not an AppleDouble file, a link, a folder, or a file of another kind.
+// The folder's map is that of its first web photo by bytewise name: not an
+// AppleDouble file, a link, a folder or a file of another kind. An empty
+// folder has 0 and no photo.
 TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
   const std::string jpeg(100, 'j');
   File("f", "b.jpg", {{"QUVAPHOTO_THUMB_XL.jpg", jpeg}});
@@ -176,43 +213,10 @@ TEST_F(PluginRequestsTest, OnlyRunningPluginsAreNamed) {
   EXPECT_EQ(reply["plugin_names"], expected);
 }
 
-class VideoNeedConvertTest : public PluginRequestsTest {
- protected:
-  void SetUp() override {
-    config_.media_parser_socket = dir_.File("mediaparser.sock");
-    config_.media_parser_timeout_s = 1;
-  }
-
-  // A media parser that answers GET_MEDIA_INFO from `codecs` (path ->
-  // video, audio, container), or with "success" false for other paths, and
-  // counts the questions.
-  std::unique_ptr<ScriptedPeer> Parser(
-      std::map<std::string, std::vector<std::string>> codecs) {
-    return std::make_unique<ScriptedPeer>(
-        config_.media_parser_socket, [this, codecs](int& fd, int) {
-          Json::Value request;
-          if (RecvPacket(fd, request) != 0) return;
-          ++asked_;
-          Json::Value reply(Json::objectValue);
-          auto found = codecs.find(request["path"].asString());
-          reply["success"] = found != codecs.end();
-          if (found == codecs.end()) {
-            reply["reason"] = "cannot parse";
-          } else {
-            reply["media"]["szVideoCodec"] = found->second[0];
-            reply["media"]["szAudioCodec"] = found->second[1];
-            reply["media"]["szContainerType"] = found->second[2];
-          }
-          SendPacket(fd, reply);
-        });
-  }
-
-  int asked_ = 0;
-};
-
 // "result" follows the codecs the media parser reports; a converted copy
-// under any of the twenty converted-video names settles it without asking.
-TEST_F(VideoNeedConvertTest, ResultFollowsCodecsAndConvertedCopies) {
+// under any of the twenty converted-video names, or a file that is not a
+// video, settles it without asking.
+TEST_F(PluginRequestsTest, VideoNeedConvertFollowsCodecsAndConvertedCopies) {
   struct Case {
     const char* file;
     std::vector<std::string> codecs;  // video, audio, container
@@ -240,22 +244,12 @@ TEST_F(VideoNeedConvertTest, ResultFollowsCodecsAndConvertedCopies) {
   }
   EXPECT_EQ(asked_, 9);
 
-  // Not a video, or converted already: 0 without asking.
-  const char* names[] = {"QUVAPHOTO_FILM_H264.mp4",
-                         "QUVAPHOTO_FILM_MPEG4.mp4",
-                         "QUVAPHOTO_FILM_CONVERT_MPEG4.mp4",
-                         "QUVAPHOTO_FILM_MOBILE.mp4",
-                         "QUVAPHOTO_FILM_MOBILE_IPHONE",
-                         "QUVAPHOTO_FILM_MOBILE_ANDROID",
-                         "QUVAPHOTO_FILM.flv",
-                         "QUVAPHOTO_FILM_H.mp4",
-                         "QUVAPHOTO_FILM_M.mp4",
-                         "QUVAPHOTO_FILM_L.mp4"};
   int n = 0;
-  for (const char* name : names) {
-    for (bool second : {false, true}) {
-      std::string item = name;
-      if (second) item[9] = ':';
+  for (std::string name :
+       {"H264.mp4", "MPEG4.mp4", "CONVERT_MPEG4.mp4", "MOBILE.mp4",
+        "MOBILE_IPHONE", "MOBILE_ANDROID", ".flv", "H.mp4", "M.mp4", "L.mp4"}) {
+    for (const char* prefix : {"QUVAPHOTO_FILM", "QUVAPHOTO:FILM"}) {
+      std::string item = prefix + (name[0] == '.' ? name : "_" + name);
       std::string video =
           File("c", std::to_string(n++) + ".mkv", {{item, "converted video"}});
       Json::Value reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
@@ -271,13 +265,14 @@ TEST_F(VideoNeedConvertTest, ResultFollowsCodecsAndConvertedCopies) {
 // Without an answer from the media parser the daemon cannot tell: the reply
 // fails (the caller reads 0), and a parser that never answers costs at most
 // the configured wait.
-TEST_F(VideoNeedConvertTest, NoAnswerFromTheMediaParserFailsTheReply) {
+TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
   std::string video = File("v", "a.mkv");
-  Json::Value reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
-  EXPECT_FALSE(reply["success"].asBool());  // no parser at all
+  config_.media_parser_socket = dir_.File("mediaparser.sock");
+  EXPECT_FALSE(
+      Ask(Request("IS_VIDEO_NEED_CONVERT", video))["success"].asBool());
 
   auto refusing = Parser({});
-  reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
+  Json::Value reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
   EXPECT_FALSE(reply["success"].asBool());
   EXPECT_NE(reply["reason"].asString().find("cannot parse"), std::string::npos);
   refusing.reset();
@@ -290,31 +285,15 @@ TEST_F(VideoNeedConvertTest, NoAnswerFromTheMediaParserFailsTheReply) {
     }
   });
   const auto started = std::chrono::steady_clock::now();
-  reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
-  const double seconds =
-      std::chrono::duration<double>(std::chrono::steady_clock::now() - started)
-          .count();
-  EXPECT_FALSE(reply["success"].asBool());
-  EXPECT_LT(seconds, 3.0);
+  EXPECT_FALSE(
+      Ask(Request("IS_VIDEO_NEED_CONVERT", video))["success"].asBool());
+  EXPECT_LT(std::chrono::steady_clock::now() - started,
+            std::chrono::seconds(3));
 }
 
-class ConvertAddTest : public PluginRequestsTest {
- protected:
-  Json::Value Add(const std::string& source, const std::string& copy,
-                  const Json::Value& package = Json::Value()) {
-    Json::Value request = Request("INDEX_CONVERT_ADD");
-    request["src"]["szPath"] = source;
-    request["src"]["duration"] = 12.5;
-    request["src"]["szTitle"] = 42;  // mistyped: read as an empty text
-    request["convert"]["szPath"] = copy;
-    request["convert"]["resolutionX"] = 1280;
-    if (!package.isNull()) request["package"] = package;
-    return Ask(request);
-  }
-};
-
-// The record lands beside the converted copy, complete and clean.
-TEST_F(ConvertAddTest, RecordIsWrittenBesideTheConvertedCopy) {
+// The record lands beside the converted copy, complete and clean, and
+// nothing else does.
+TEST_F(PluginRequestsTest, ConvertRecordIsWrittenBesideTheConvertedCopy) {
   std::string video =
       File("v", "a.mkv", {{"QUVAPHOTO:FILM_H.mp4", "converted video"}});
   std::string copy = dir_.File("v/.quvameta/a.mkv/QUVAPHOTO:FILM_H.mp4");
@@ -331,20 +310,14 @@ TEST_F(ConvertAddTest, RecordIsWrittenBesideTheConvertedCopy) {
   EXPECT_EQ(record["src"].size(), 47u);
   EXPECT_EQ(record["convert"]["resolutionX"], 1280);
   EXPECT_EQ(record["package"], package);
-  // Nothing but the copy and its record in the EA directory.
-  std::vector<std::string> names;
-  for (const auto& entry :
-       std::filesystem::directory_iterator(dir_.File("v/.quvameta/a.mkv"))) {
-    names.push_back(entry.path().filename());
-  }
-  std::sort(names.begin(), names.end());
-  EXPECT_EQ(names, (std::vector<std::string>{"QUVAPHOTO:FILM_H.mp4",
-                                             "QUVAPHOTO:FILM_H.mp4.json"}));
+  EXPECT_EQ(quvaidx::daemon_test::NamesUnder(dir_.File("v/.quvameta/a.mkv")),
+            (std::vector<std::string>{"QUVAPHOTO:FILM_H.mp4",
+                                      "QUVAPHOTO:FILM_H.mp4.json"}));
 }
 
 // A record may only go beside a real converted copy of a real video: no
 // file is ever written where a request points elsewhere.
-TEST_F(ConvertAddTest, RecordsOutsideAVideosEADirectoryAreRefused) {
+TEST_F(PluginRequestsTest, ConvertRecordsOutsideAVideosEADirectoryAreRefused) {
   std::string video =
       File("v", "a.mkv", {{"QUVAPHOTO_FILM_L.mp4", "converted video"}});
   std::string photo = File("v", "p.jpg", {{"QUVAPHOTO_FILM_L.mp4", "x y"}});
@@ -364,10 +337,8 @@ TEST_F(ConvertAddTest, RecordsOutsideAVideosEADirectoryAreRefused) {
       {"source relative", "v/a.mkv", ea + "QUVAPHOTO_FILM_L.mp4"},
   };
   for (const Case& c : cases) {
-    Json::Value reply = Add(c.source, c.copy);
-    EXPECT_FALSE(reply["success"].asBool()) << c.fault;
-    struct stat st;
-    EXPECT_NE(stat((c.copy + ".json").c_str(), &st), 0) << c.fault;
+    EXPECT_FALSE(Add(c.source, c.copy)["success"].asBool()) << c.fault;
+    EXPECT_NE(access((c.copy + ".json").c_str(), F_OK), 0) << c.fault;
   }
   Json::Value bare = Request("INDEX_CONVERT_ADD");
   bare["src"] = "not a record";
