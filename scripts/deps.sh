@@ -19,7 +19,7 @@ set -euo pipefail
 # The media parser builds on FFmpeg's libraries, TagLib, exiv2 and libblkid,
 # the thumbnail daemon on libvips. Media and photos for the demo, the tests
 # and the fuzzers' seeds are made on the spot with ffmpeg, exiftool and the
-# vips command (the tests also use zlib, and ffprobe and exiftool as
+# vips command (the tests also use ffprobe and exiftool as
 # oracles); the benchmarks compare with ffprobe, MiniDLNA, vipsthumbnail and
 # ImageMagick's convert.
 build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
@@ -27,8 +27,7 @@ build=(cmake make g++ pkg-config libjsoncpp-dev libevent-dev libicu-dev
        libexiv2-dev libblkid-dev libvips-dev)
 media=(python3 ffmpeg libimage-exiftool-perl libvips-tools)
 demo=("${media[@]}")
-test=("${media[@]}" libgtest-dev libgmock-dev man-db systemd clang-format
-      zlib1g-dev)
+test=("${media[@]}" libgtest-dev libgmock-dev man-db systemd clang-format)
 bench=("${media[@]}" libbenchmark-dev strace time minidlna imagemagick)
 fuzz=("${media[@]}" clang libclang-rt-14-dev)
 
