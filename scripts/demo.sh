@@ -155,7 +155,7 @@ heading "Type 2 first, then whatever is oldest"
 show taskq pop "$queue_key" 7 --type 2
 show taskq pop "$queue_key" 7
 
-heading "Empty now: one attempt costs a second, exit status 1"
+heading "Empty now: one attempt and no wait after it, exit status 1"
 show taskq pop "$queue_key" 7 --nowait --attempts 1 2>&1
 
 heading "Delete the queue"
