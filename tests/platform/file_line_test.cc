@@ -6,8 +6,7 @@
 #include <string>
 
 #include "file_line.h"
-#include "host_test_util.h"
-#include "quvahost/quvahost.h"
+#include "support/fake_host.h"
 
 namespace quvahost::test {
 namespace {

@@ -4,8 +4,7 @@
 
 #include <string>
 
-#include "host_test_util.h"
-#include "quvahost/quvahost.h"
+#include "support/fake_host.h"
 
 namespace quvahost::test {
 namespace {
