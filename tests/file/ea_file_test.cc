@@ -65,20 +65,19 @@ TEST(EADirMaking, FailuresAreLoggedAndExistingDirNeedsNoCall) {
   const std::string ea = dir.File(".quvameta/a.jpg");
   LogCapture log;
   FakeHost host;
-  host.AnswerEADirPath(ea);
   host.Fail(HostOp::kEAMKDir, EACCES);
+  const std::string media = dir.File("a.jpg");
   char buf[4096];
-  EXPECT_EQ(-1, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(-1, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Make ea dir path error. eaDir "
                          "path: " +
                          ea));
   host.Pass(HostOp::kEAMKDir);
-  EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(0, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(ea, buf);
-  EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(0, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(2, host.Calls(HostOp::kEAMKDir)) << "made an existing directory";
-  host.AnswerEADirPath(dir.File("missing/.quvameta/a.jpg"));
-  EXPECT_EQ(-1, MakeEADir("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(-1, MakeEADir(dir.File("missing/a.jpg").c_str(), buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Cannot mkdir " +
                          dir.File("missing/.quvameta") + ", error:2"));
 }

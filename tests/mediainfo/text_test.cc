@@ -15,7 +15,9 @@
 namespace {
 
 using quvahost::test::FakeHost;
+using quvahost::test::HostEtc;
 using quvahost::test::HostOp;
+using quvahost::test::WriteFile;
 
 std::string Repeat(const std::string& unit, size_t at_least) {
   std::string text;
@@ -99,8 +101,9 @@ TEST(TextTest, StringTrimAndEscapePercentSign) {
 }
 
 TEST(TextTest, CodePageFallsBackTo15WhenTheHostFails) {
+  HostEtc etc;
+  WriteFile(etc.File("host.conf"), "[system]\ncode_page = 3\n");
   FakeHost host;
-  host.AnswerCodePage(3);
   EXPECT_EQ(QUVAIndexCodePageGet(), 3);
   host.Fail(HostOp::kCodePageGet, ENOENT);
   EXPECT_EQ(QUVAIndexCodePageGet(), 15);
@@ -123,7 +126,10 @@ __tag_QUVA_MEDIA_INFO CleanRecord(const char* path = "/m/Album X/01 s.mp3") {
 
 class MediaValidTest : public ::testing::Test {
  protected:
-  MediaValidTest() { host_.AnswerCodePage(1); }  // windows-1252
+  MediaValidTest() {
+    WriteFile(etc_.File("host.conf"), "[system]\ncode_page = 1\n");  // 1252
+  }
+  HostEtc etc_;
   FakeHost host_;
 };
 

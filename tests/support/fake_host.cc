@@ -27,7 +27,6 @@ struct OpState {
 struct FakeState {
   HostOps previous{}, next{};
   OpState ops[static_cast<int>(HostOp::kCount)];
-  int code_page = 0;
   QLIBCFileStatRecord stat_record{};
   int outstanding_records = 0;
   bool records_on_failure = false;  // failed lookups hand out a record
@@ -144,20 +143,6 @@ void FakeHost::Answer(HostOp op, std::initializer_list<int> results) {
 void FakeHost::Pass(HostOp op) {
   Op(op).fail = false;
   Op(op).answers.clear();
-}
-
-void FakeHost::AnswerEADirPath(const std::string& path) {
-  Op(HostOp::kEADirPath).text = path;
-  g_state->next.EADirPath = [](int, const char*, char* buffer, int size) {
-    return CopyAnswer(HostOp::kEADirPath, buffer, size) < 0 ? -1 : 0;
-  };
-}
-
-void FakeHost::AnswerCodePage(int code_page) {
-  g_state->code_page = code_page;
-  g_state->next.CodePageGet = [](int, int* out) {
-    return out == nullptr ? Refuse(EINVAL) : (*out = g_state->code_page, 0);
-  };
 }
 
 void FakeHost::AnswerFileStat(const QLIBCFileStatRecord& record) {

@@ -52,8 +52,6 @@ class FakeHost {
   // Typed answers: every later call succeeds with this output; a text that
   // does not fit the caller's buffer fails with ERANGE, except conversions
   // (kUnicodeStrUTF16ToUTF8, kUnicodeStrCPToUTF8), cut on a character.
-  void AnswerEADirPath(const std::string& path);
-  void AnswerCodePage(int code_page);
   void AnswerFileStat(const QLIBCFileStatRecord& record);
   void AnswerSectionValue(const std::string& value);
   void AnswerConversion(HostOp op, const std::string& utf8);
