@@ -174,6 +174,8 @@ TEST(ProcAliveTest, LiveZombieDeadOrRecycled) {
   ASSERT_EQ(waitpid(child, nullptr, 0), child);
   EXPECT_EQ(alive(child, 0), 0) << "dead";
   EXPECT_EQ(QLIBCProcAliveByPidFile(dir.File("none").c_str()), 0);
+  WriteFile(dir.File("bad"), "abc");
+  EXPECT_EQ(QLIBCProcAliveByPidFile(dir.File("bad").c_str()), 0);
   EXPECT_EQ(QLIBCProcAliveByPidFile(nullptr), 0);
 }
 
