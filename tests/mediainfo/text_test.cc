@@ -2,7 +2,9 @@
 // EscapePercentSign, the code page) and MediaInfoValid against a host made
 // to convert or fail.
 #include <string.h>
+#include <syslog.h>
 
+#include <regex>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -11,6 +13,7 @@
 
 #include "quvaidx/text.h"
 #include "support/fake_host.h"
+#include "support/log_capture.h"
 
 namespace {
 
@@ -132,6 +135,16 @@ class MediaValidTest : public ::testing::Test {
   HostEtc etc_;
   FakeHost host_;
 };
+
+TEST_F(MediaValidTest, NullRecordIsLogged) {
+  quvaidx::test::LogCapture log;
+  MediaInfoValid(nullptr);
+  ASSERT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(log.lines()[0].priority, LOG_ERR);
+  EXPECT_TRUE(std::regex_match(
+      log.lines()[0].text,
+      std::regex(R"(quvaidx_unicode \(\d+\) Bad parameter\.)")));
+}
 
 TEST_F(MediaValidTest, CleanUtf8RecordComesOutUnchanged) {
   __tag_QUVA_MEDIA_INFO r = CleanRecord();

@@ -64,7 +64,9 @@ TEST(FileGetLineTest, LinesAtTheBlockBoundary) {
   }
 }
 
+// Refused without blocking on a FIFO, and without a descriptor left open.
 TEST(FileGetLineTest, BadArgumentsAndFiles) {
+  quvaidx::test::FdLeakCheck leaks;
   TempDir dir;
   WriteFile(dir.File("q"), "a\n");
   ASSERT_EQ(mkfifo(dir.File("fifo").c_str(), 0600), 0);
@@ -91,6 +93,7 @@ TEST(FileGetLineTest, BadArgumentsAndFiles) {
   }
   EXPECT_EQ(QLIBCFileGetLine(q.c_str(), "a", buffer, 2, kExact), 1);
   EXPECT_STREQ(buffer, "a");
+  EXPECT_TRUE(leaks.NoLeak());
 }
 
 // A value is copied only whole: one that does not fit leaves the buffer as

@@ -23,7 +23,7 @@ const char kDatabase[] =
     "[no-path]\nstatus = 0x20\n"
     "[hex]\npath = /h\nstatus = 0X2a\n[max]\npath = /m\nstatus = 4294967295\n"
     "[over]\npath = /o\nstatus = 4294967296\n[neg]\npath = /n\nstatus = -1\n"
-    "[two]\npath = /t\nstatus = 1 2\n";
+    "[two]\npath = /t\nstatus = 1 2\n[empty]\npath = /e\nstatus =\n";
 
 class ShareDbTest : public ::testing::Test {
  protected:
@@ -71,7 +71,8 @@ TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
                {"no-path", nullptr, 0},
                {"over", nullptr, 0},
                {"neg", nullptr, 0},
-               {"two", nullptr, 0}};
+               {"two", nullptr, 0},
+               {"empty", nullptr, 0}};
   for (const auto& c : cases) {
     Found found = Get(c.name);
     EXPECT_EQ(found.result, c.path ? 0 : -1) << c.name;
