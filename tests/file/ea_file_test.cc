@@ -33,7 +33,7 @@ bool IsLink(const std::string& path) {
 
 // Bad parameters never reach the host; a host failure is logged with the
 // host's error by every caller.
-TEST(EADirHostFailure, LoggedWithTheHostErrorByEveryCaller) {
+TEST(EADirHostFailure, BadParametersNeverReachTheHostAndFailuresAreLogged) {
   LogCapture log;
   FakeHost host;
   char buf[64];

@@ -18,7 +18,7 @@ bool IsDir(const std::string& path) {
 
 // The path is written only whole: one that does not fit leaves the buffer
 // as it was.
-TEST(EaDirTest, PathOfFileIsHiddenDirInItsFolder) {
+TEST(EaDirTest, PathOfFileIsHiddenDirInItsFolderWrittenOnlyWhole) {
   const struct {
     const char* file;
     int size;

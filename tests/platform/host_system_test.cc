@@ -87,7 +87,7 @@ TEST(FsTypeTest, MagicNumbersAndTheRemoteAndImageTable) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
 }
 
-TEST(FileStatTest, TypeSizeAndTimes) {
+TEST(FileStatTest, TypeSizeAndTimesAndNothingWrittenOnFailure) {
   static_assert(sizeof(QLIBCFileStatRecord) == 128);
   TempDir dir;
   time_t before = time(nullptr);
