@@ -9,7 +9,6 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -25,21 +24,27 @@ using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
 using quvaidx::test::TempDir;
-
-void WriteFile(const std::string& path, const std::string& text) {
-  std::ofstream(path) << text;
-}
+using quvaidx::test::WriteFile;
 
 bool IsLink(const std::string& path) {
   struct stat st;
   return lstat(path.c_str(), &st) == 0 && S_ISLNK(st.st_mode);
 }
 
-TEST(EADirHostFailure, LoggedWithTheHostErrorByEveryCaller) {
+// Bad parameters never reach the host; a host failure is logged with the
+// host's error by every caller.
+TEST(EADirHostFailure, BadParametersNeverReachTheHostAndFailuresAreLogged) {
   LogCapture log;
   FakeHost host;
-  host.Fail(HostOp::kEADirPath, ENAMETOOLONG);
   char buf[64];
+  for (auto* fn : {MakeEADir, GetEADirPath}) {
+    EXPECT_EQ(-1, fn(nullptr, buf, sizeof(buf)));
+    EXPECT_EQ(-1, fn("/v/a.jpg", nullptr, 16));
+    EXPECT_EQ(-1, fn("/v/a.jpg", buf, 0));
+  }
+  EXPECT_EQ(6, log.Count("quvaidx_eafile:N Bad parameters."));
+  EXPECT_EQ(0, host.Calls(HostOp::kEADirPath));
+  host.Fail(HostOp::kEADirPath, ENAMETOOLONG);
   EXPECT_EQ(-1, MakeEADir("/v/a.jpg", buf, sizeof(buf)));
   EXPECT_EQ(-1, RemoveEAFile2("/v/a.jpg", "n1", "n2"));
   EXPECT_EQ(-1, GetEAFilePath("/v/a.jpg", "n1", "n2", buf, sizeof(buf)));
@@ -48,24 +53,11 @@ TEST(EADirHostFailure, LoggedWithTheHostErrorByEveryCaller) {
   snprintf(line, sizeof(line),
            "quvaidx_eafile:N QUVAEADirPath error [0x0024 %s:%d] on /v/a.jpg",
            QLIBCErrorGetFile(), QLIBCErrorGetLine());
-  EXPECT_EQ(4, log.Count(line)) << log.lines().at(0).text;
-  EXPECT_EQ(LOG_ERR, log.lines().at(0).priority);
+  EXPECT_EQ(4, log.Count(line)) << log.lines().back().text;
+  for (const auto& logged : log.lines()) EXPECT_EQ(LOG_ERR, logged.priority);
   EXPECT_EQ(-1, GetEADirPath("/v/a.jpg", buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Get ea dir path error. file path: "
                          "/v/a.jpg"));
-}
-
-TEST(EADirBadParameters, NullPathNullBufferAndSizeZero) {
-  LogCapture log;
-  FakeHost host;
-  char buf[16];
-  for (auto* fn : {MakeEADir, GetEADirPath}) {
-    EXPECT_EQ(-1, fn(nullptr, buf, sizeof(buf)));
-    EXPECT_EQ(-1, fn("/v/a.jpg", nullptr, 16));
-    EXPECT_EQ(-1, fn("/v/a.jpg", buf, 0));
-  }
-  EXPECT_EQ(6, log.Count("quvaidx_eafile:N Bad parameters."));
-  EXPECT_EQ(0, host.Calls(HostOp::kEADirPath));
 }
 
 TEST(EADirMaking, FailuresAreLoggedAndExistingDirNeedsNoCall) {
@@ -73,20 +65,19 @@ TEST(EADirMaking, FailuresAreLoggedAndExistingDirNeedsNoCall) {
   const std::string ea = dir.File(".quvameta/a.jpg");
   LogCapture log;
   FakeHost host;
-  host.AnswerEADirPath(ea);
   host.Fail(HostOp::kEAMKDir, EACCES);
+  const std::string media = dir.File("a.jpg");
   char buf[4096];
-  EXPECT_EQ(-1, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(-1, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Make ea dir path error. eaDir "
                          "path: " +
                          ea));
   host.Pass(HostOp::kEAMKDir);
-  EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(0, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(ea, buf);
-  EXPECT_EQ(0, GetEADirPath("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(0, GetEADirPath(media.c_str(), buf, sizeof(buf)));
   EXPECT_EQ(2, host.Calls(HostOp::kEAMKDir)) << "made an existing directory";
-  host.AnswerEADirPath(dir.File("missing/.quvameta/a.jpg"));
-  EXPECT_EQ(-1, MakeEADir("/any/a.jpg", buf, sizeof(buf)));
+  EXPECT_EQ(-1, MakeEADir(dir.File("missing/a.jpg").c_str(), buf, sizeof(buf)));
   EXPECT_EQ(1, log.Count("quvaidx_eafile:N Cannot mkdir " +
                          dir.File("missing/.quvameta") + ", error:2"));
 }
@@ -94,16 +85,10 @@ TEST(EADirMaking, FailuresAreLoggedAndExistingDirNeedsNoCall) {
 // The real stand-in: the EA directory of <dir>/a.jpg is <dir>/.quvameta/a.jpg.
 class RealTree : public ::testing::Test {
  protected:
-  void SetUp() override {
-    setenv("QUVA_HOST_ETC", etc_.path().c_str(), 1);
-    media_ = dir_.File("a.jpg");
-    hidden_ = dir_.File(".quvameta");
-    ea_ = hidden_ + "/a.jpg";
-    WriteFile(media_, "jpeg");
-  }
-  void TearDown() override { unsetenv("QUVA_HOST_ETC"); }
-  TempDir etc_, dir_, outside_;
-  std::string media_, hidden_, ea_;
+  void SetUp() override { WriteFile(media_, "jpeg"); }
+  TempDir dir_, outside_;
+  std::string media_ = dir_.File("a.jpg"), hidden_ = dir_.File(".quvameta"),
+              ea_ = hidden_ + "/a.jpg";
 };
 
 TEST_F(RealTree, BothFunctionsCreateTheDirectoriesAndKeepItems) {

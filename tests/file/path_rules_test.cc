@@ -10,7 +10,6 @@
 #include <unistd.h>
 #include <utime.h>
 
-#include <fstream>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -96,9 +95,8 @@ TEST(MountTests, FailureIsLoggedAtDebugAndAnsweredSafely) {
   for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
 }
 
+// Sets TZ for the rest of this test's process.
 TEST(TimeTexts, LocalAndCutToTheirBuffers) {
-  const char* tz = getenv("TZ");
-  const std::string saved = tz ? tz : "";
   setenv("TZ", "QTZ-9", 1);  // nine hours east of UTC, no summer time
   tzset();
   FakeHost host;
@@ -118,18 +116,12 @@ TEST(TimeTexts, LocalAndCutToTheirBuffers) {
   EXPECT_EQ(-3, QUVAIndexCTimeMTimeGet("/f", c, sizeof(c), m, sizeof(m)));
   EXPECT_STREQ("2015-03-07 09:05:03", c);
   EXPECT_STREQ("2017-01-01 08:59:59", m);
-  if (tz) {
-    setenv("TZ", saved.c_str(), 1);
-  } else {
-    unsetenv("TZ");
-  }
-  tzset();
 }
 
 TEST(ExistenceTests, RegularFilesDirectoriesAndLinks) {
   TempDir dir;
   const std::string file = dir.File("a.mp4"), sub = dir.File("sub");
-  std::ofstream(file) << "12345";
+  quvaidx::test::WriteFile(file, "12345");
   ASSERT_EQ(0, mkdir(sub.c_str(), 0755));
   ASSERT_EQ(0, symlink(file.c_str(), dir.File("to_file").c_str()));
   int64_t size = -7;

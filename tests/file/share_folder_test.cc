@@ -1,11 +1,10 @@
-// Shared folders through the fake host's in-memory share database.
+// Shared folders on the stand-in's share database, through the fake host.
 #include "quvaidx/share_folder.h"
 
 #include <errno.h>
 #include <string.h>
 #include <syslog.h>
 
-#include <fstream>
 #include <functional>
 #include <string>
 
@@ -18,33 +17,51 @@
 namespace {
 
 using quvahost::test::FakeHost;
+using quvahost::test::HostEtc;
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
 using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+
+// A share database with the share "video" at `path` with `status`.
+void WriteShares(const HostEtc& etc, const std::string& path = "/vol1/video",
+                 unsigned status = 0) {
+  WriteFile(etc.File("shares.conf"), "[video]\npath = " + path + "\nstatus = " +
+                                         std::to_string(status) + "\n");
+}
+
+unsigned Status(const char* name) {
+  ShareRecord* record = nullptr;
+  unsigned status = QUVAShareGet(name, &record) == 0 ? record->uStatus : ~0u;
+  QUVAShareFree(record);
+  return status;
+}
 
 TEST(IndexStatus, SetsOrClearsOnlyWhatDiffersAndFreesEveryRecord) {
   const struct {
     unsigned before;
     bool set;
-    size_t updates;
+    int updates;
     unsigned after;
   } cases[] = {
       {0x00, true, 1, 0x20}, {0x21, false, 1, 0x01}, {0x25, true, 0, 0x25}};
   for (const auto& c : cases) {
+    HostEtc etc;
+    WriteShares(etc, "/vol1/video", c.before);
     FakeHost host;
-    host.AddShare("video", "/vol1/video", c.before);
     EXPECT_EQ(0, c.set ? ShareIndexStatusSet("video")
                        : ShareIndexStatusClear("video"));
-    EXPECT_EQ(c.updates, host.ShareUpdates().size()) << c.before;
-    EXPECT_EQ(c.after, host.ShareStatus("video"));
+    EXPECT_EQ(c.updates, host.Calls(HostOp::kShareUpdate)) << c.before;
     EXPECT_EQ(0, host.OutstandingShareRecords());
+    EXPECT_EQ(c.after, Status("video"));
   }
 }
 
 TEST(IndexStatus, MissingShareIsMinusOneAndFailedUpdateStillZero) {
+  HostEtc etc;
+  WriteShares(etc);
   LogCapture log;
   FakeHost host;
-  host.AddShare("video", "/vol1/video", 0);
   EXPECT_EQ(-1, ShareIndexStatusSet("nope"));
   EXPECT_EQ(-1, ShareIndexStatusClear("nope"));
   EXPECT_EQ(2, log.Count("quvaidx_folder:N QUVAShareGet failed: nope"));
@@ -66,14 +83,16 @@ TEST(IsDefaultShare, ThreeNamesInAnyCase) {
 }
 
 TEST(SharePath, ShareRelativePathsBecomeDiskPaths) {
+  HostEtc etc;
+  WriteShares(etc);
   FakeHost host;
-  host.AddShare("video", "/vol1/video", 0);
   const struct {
     const char* path;
     int out_size;
     const char* out;  // "untouched": -1
   } cases[] = {{"/video/movies/a.mkv", 64, "/vol1/video/movies/a.mkv"},
                {"/video/a", 8, "/vol1/v"},  // cut to the out size
+               {"/video/", 64, "/vol1/video"},
                {"/Video/a", 64, "untouched"},
                {"video/a", 64, "untouched"},  // not share-relative
                {"/video/a", 0, "untouched"}};
@@ -92,9 +111,10 @@ TEST(SharePath, ShareRelativePathsBecomeDiskPaths) {
 // releases it, so none leaks on a failed lookup either.
 TEST(ShareRecords, ReleasedAfterAFailedLookupToo) {
   TempDir outside;
+  HostEtc etc;
+  WriteShares(etc);
   LogCapture log;
   FakeHost host;
-  host.AddShare("video", "/vol1/video", 0);
   host.HandOutRecordsOnFailure();
   char out[64] = "untouched";
   DirInfo info = {};
@@ -125,11 +145,12 @@ TEST(DirInfo, GuidFromTheMapOnlyInsideAShare) {
   TempDir dir;
   DirInfo info = {};
   strcpy(info.szGuid, "caller's");
+  HostEtc etc;
+  WriteShares(etc);
   FakeHost host;
-  host.AddShare("music", "/vol1/music", 0);
   EXPECT_EQ(0, GetDirInfo(dir.path().c_str(), &info));  // outside shares
   EXPECT_EQ(0, host.Calls(HostOp::kFileGetSectionValue));
-  host.AddShare("video", dir.path(), 0);
+  WriteShares(etc, dir.path());
   host.Fail(HostOp::kFileGetSectionValue, ENOENT);  // no map entry
   EXPECT_EQ(0, GetDirInfo(dir.path().c_str(), &info));
   EXPECT_EQ(1, host.Calls(HostOp::kFileGetSectionValue));
@@ -150,7 +171,7 @@ TEST(DirInfo, FilesMissingPathsAndBadArgumentsFail) {
   DirInfo info = {};
   LogCapture log;
   FakeHost host;
-  std::ofstream(dir.File("f")) << "x";
+  quvaidx::test::WriteFile(dir.File("f"), "x");
   EXPECT_EQ(-1, GetDirInfo(dir.File("f").c_str(), &info));
   EXPECT_EQ(-1, GetDirInfo(dir.File("missing").c_str(), &info));
   EXPECT_TRUE(log.lines().empty());

@@ -1,6 +1,5 @@
-// The preview queues, with a real (child) daemon to signal.
+// The preview queues; this process plays the daemon that is woken.
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -24,47 +23,10 @@ using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
-// A stand-in for the thumbnail or web-video daemon: a child process that
-// reports every SIGUSR1 it receives through a pipe.
-class FakeDaemon {
- public:
-  FakeDaemon() {
-    int fds[2];
-    if (pipe(fds) != 0) return;
-    sigset_t usr1, saved;
-    sigemptyset(&usr1);
-    sigaddset(&usr1, SIGUSR1);
-    sigprocmask(SIG_BLOCK, &usr1, &saved);
-    if ((pid_ = fork()) == 0) {
-      for (int signal_number;
-           sigwait(&usr1, &signal_number) != 0 || write(fds[1], "U", 1) == 1;) {
-      }
-      _exit(0);
-    }
-    sigprocmask(SIG_SETMASK, &saved, nullptr);
-    close(fds[1]);
-    report_ = fds[0];
-  }
-  ~FakeDaemon() {
-    kill(pid_, SIGKILL);
-    waitpid(pid_, nullptr, 0);
-    close(report_);
-  }
-  pid_t pid() const { return pid_; }
-  // Signals received within `ms` milliseconds.
-  int Signals(int ms = 200) {
-    int count = 0;
-    struct pollfd p = {report_, POLLIN, 0};
-    char c;
-    for (; poll(&p, 1, ms) > 0 && read(report_, &c, 1) == 1; ms = 20) ++count;
-    return count;
-  }
+volatile sig_atomic_t g_wakeups = 0;
 
- private:
-  pid_t pid_ = -1;
-  int report_ = -1;
-};
-
+// Both pid files name this process, whose SIGUSR1 is counted: a signal a
+// process sends itself arrives before kill returns.
 class ThumbQueueTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -75,10 +37,20 @@ class ThumbQueueTest : public ::testing::Test {
     for (const char* name : {"x.jpg", "x.txt", "x.mp4", "x.mkv"}) {
       WriteFile(media_ + "/" + name, "data");
     }
-    WriteFile(thumb_pid_, std::to_string(daemon_.pid()));
-    WriteFile(flv_pid_, std::to_string(daemon_.pid()));
+    WriteFile(thumb_pid_, std::to_string(getpid()));
+    WriteFile(flv_pid_, std::to_string(getpid()));
+    signal(SIGUSR1, [](int) { ++g_wakeups; });
   }
-  void TearDown() override { quvaidx::SetSpoolPaths(previous_); }
+  void TearDown() override {
+    signal(SIGUSR1, SIG_DFL);
+    quvaidx::SetSpoolPaths(previous_);
+  }
+  // Wake-ups since the last call.
+  int Signals() {
+    int count = g_wakeups;
+    g_wakeups = 0;
+    return count;
+  }
 
   TempDir dir_;
   std::string media_ = dir_.File("album.2015");
@@ -88,7 +60,6 @@ class ThumbQueueTest : public ::testing::Test {
   std::string flv_pid_ = dir_.File("quvamkflvd.pid");
   quvaidx::SpoolPaths paths_;
   quvaidx::SpoolPaths previous_;
-  FakeDaemon daemon_;
 };
 
 // A photo queues its folder (once), a web video the file itself; a file of
@@ -101,7 +72,7 @@ TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
       {media_ + "/x.mkv", THUMB_TYPE_VIDEO}};
   for (const auto& c : calls) {
     EXPECT_EQ(WriteThumbQueue(c.first.c_str(), c.second), 0) << c.first;
-    EXPECT_EQ(daemon_.Signals(), 1) << c.first;
+    EXPECT_EQ(Signals(), 1) << c.first;
   }
   EXPECT_EQ(ReadFile(thumb_queue_), media_ + "\n");
   EXPECT_EQ(ReadFile(flv_queue_), "");
@@ -109,7 +80,7 @@ TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
   EXPECT_EQ(WriteThumbQueue(video.c_str(), THUMB_TYPE_VIDEO), 0);
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), 0);
   EXPECT_EQ(ReadFile(flv_queue_), video + "\n" + media_ + "\n");
-  EXPECT_GE(daemon_.Signals(), 1);
+  EXPECT_EQ(Signals(), 2);
 }
 
 // Other types do nothing; paths that are neither file nor folder fail.
@@ -121,7 +92,7 @@ TEST_F(ThumbQueueTest, OtherTypesAndPathsDoNothing) {
   }
   EXPECT_EQ(WriteThumbQueue(nullptr, THUMB_TYPE_PHOTO), -1);
   EXPECT_EQ(WriteThumbQueue("/dev/null", THUMB_TYPE_PHOTO), -1);
-  EXPECT_EQ(daemon_.Signals(50), 0);
+  EXPECT_EQ(Signals(), 0);
   EXPECT_EQ(ReadFile(thumb_queue_), "");
 }
 
@@ -136,12 +107,12 @@ TEST_F(ThumbQueueTest, MissingDeadOrRecycledDaemonQueuesNothing) {
   waitpid(dead, nullptr, 0);
   WriteFile(flv_pid_, std::to_string(dead));
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_VIDEO), -1);
-  WriteFile(thumb_pid_, std::to_string(daemon_.pid()));
+  WriteFile(thumb_pid_, std::to_string(getpid()));
   struct timespec old[2] = {{time(nullptr) - 3600, 0},
                             {time(nullptr) - 3600, 0}};
   ASSERT_EQ(utimensat(AT_FDCWD, thumb_pid_.c_str(), old, 0), 0);
   EXPECT_EQ(WriteThumbQueue(media_.c_str(), THUMB_TYPE_PHOTO), -1);
-  EXPECT_EQ(daemon_.Signals(100), 0);
+  EXPECT_EQ(Signals(), 0);
   EXPECT_EQ(log.Normalized(),
             (std::vector<std::string>{
                 "quvaidx_system:N [Error] quvamkthumbd is dead",

@@ -198,19 +198,28 @@ TEST(VideoMetadataTest, RoundTripAndMistypedMembers) {
   }
 }
 
-// The dump of a record with ID 7, szTitle "Song", duration 1.5, fileSize
-// 2^32 + 5 and everything else zero or empty: one item per member, printed
-// without a line feed, logged as one error line each whatever the level.
+// The dump of a record with edge values and zeros elsewhere: one item per
+// member, printed without a line feed, logged as one error line each
+// whatever the level. Texts are values, never formats, and end at their
+// field's capacity; fileSize prints in full.
 TEST(MediaDumpTest, PrintAndSyslogWriteExactlyTheItems) {
   __tag_QUVA_MEDIA_INFO r = Zero();
-  r.ID = 7;
+  r.ID = r.video_bitrate = 4294967295u;
+  r.track = -1;
   strcpy(r.szTitle, "Song");
+  strcpy(r.szComment, "100%s %d %n");
+  memset(r.szExposure, 'e', sizeof(r.szExposure));  // unterminated
   r.duration = 1.5f;
-  r.fileSize = (uint64_t{1} << 32) + 5;
-  const std::map<std::string, std::string> set = {{"ID", "7"},
-                                                  {"szTitle", "Song"},
-                                                  {"duration", "1.500000"},
-                                                  {"fileSize", "4294967301"}};
+  r.fileSize = UINT64_MAX;
+  const std::map<std::string, std::string> set = {
+      {"ID", "4294967295"},
+      {"video_bitrate", "4294967295"},
+      {"track", "-1"},
+      {"szTitle", "Song"},
+      {"szComment", "100%s %d %n"},
+      {"szExposure", std::string(20, 'e')},
+      {"duration", "1.500000"},
+      {"fileSize", "18446744073709551615"}};
   std::vector<std::string> items;
   for (const std::string& name : Fields()) {
     auto it = set.find(name);
@@ -234,32 +243,8 @@ TEST(MediaDumpTest, PrintAndSyslogWriteExactlyTheItems) {
     EXPECT_EQ(log.lines()[i].priority, LOG_ERR);
     EXPECT_EQ(lines[i], "quvaidx_mediainfo:N " + items[i]);
   }
-  const std::string prefix = "quvaidx_mediainfo:N ";
-  EXPECT_EQ(lines[0], prefix + "ID              = 7,");
-  EXPECT_EQ(lines[7], prefix + "szTitle         = Song,");
-  EXPECT_EQ(lines[21], prefix + "duration        = 1.500000,");
-  EXPECT_EQ(lines[31], prefix + "fileSize        = 4294967301,");
-  EXPECT_EQ(lines[42], prefix + "szContainerType = ,");
-}
-
-TEST(MediaDumpTest, PrintShowsEdgeValuesInFull) {
-  __tag_QUVA_MEDIA_INFO r = Zero();
-  r.fileSize = UINT64_MAX;
-  r.ID = r.video_bitrate = 4294967295u;
-  r.track = -1;
-  strcpy(r.szComment, "100%s %d %n");  // an argument, never a format
-  memset(r.szExposure, 'e', sizeof(r.szExposure));  // unterminated
-  testing::internal::CaptureStdout();
-  PrintMediaInfoObject(r);
-  fflush(stdout);
-  std::string out = testing::internal::GetCapturedStdout();
-  for (std::string item :
-       {"fileSize        = 18446744073709551615,",
-        "ID              = 4294967295,", "video_bitrate   = 4294967295,",
-        "track           = -1,", "szComment       = 100%s %d %n,",
-        "szExposure      = eeeeeeeeeeeeeeeeeeee,szAperture"}) {
-    EXPECT_NE(out.find(item), std::string::npos) << item;
-  }
+  EXPECT_EQ(lines[0], "quvaidx_mediainfo:N ID              = 4294967295,");
+  EXPECT_EQ(lines[42], "quvaidx_mediainfo:N szContainerType = ,");
 }
 
 }  // namespace

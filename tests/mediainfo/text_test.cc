@@ -2,7 +2,9 @@
 // EscapePercentSign, the code page) and MediaInfoValid against a host made
 // to convert or fail.
 #include <string.h>
+#include <syslog.h>
 
+#include <regex>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -11,11 +13,14 @@
 
 #include "quvaidx/text.h"
 #include "support/fake_host.h"
+#include "support/log_capture.h"
 
 namespace {
 
 using quvahost::test::FakeHost;
+using quvahost::test::HostEtc;
 using quvahost::test::HostOp;
+using quvahost::test::WriteFile;
 
 std::string Repeat(const std::string& unit, size_t at_least) {
   std::string text;
@@ -99,8 +104,9 @@ TEST(TextTest, StringTrimAndEscapePercentSign) {
 }
 
 TEST(TextTest, CodePageFallsBackTo15WhenTheHostFails) {
+  HostEtc etc;
+  WriteFile(etc.File("host.conf"), "[system]\ncode_page = 3\n");
   FakeHost host;
-  host.AnswerCodePage(3);
   EXPECT_EQ(QUVAIndexCodePageGet(), 3);
   host.Fail(HostOp::kCodePageGet, ENOENT);
   EXPECT_EQ(QUVAIndexCodePageGet(), 15);
@@ -123,9 +129,22 @@ __tag_QUVA_MEDIA_INFO CleanRecord(const char* path = "/m/Album X/01 s.mp3") {
 
 class MediaValidTest : public ::testing::Test {
  protected:
-  MediaValidTest() { host_.AnswerCodePage(1); }  // windows-1252
+  MediaValidTest() {
+    WriteFile(etc_.File("host.conf"), "[system]\ncode_page = 1\n");  // 1252
+  }
+  HostEtc etc_;
   FakeHost host_;
 };
+
+TEST_F(MediaValidTest, NullRecordIsLogged) {
+  quvaidx::test::LogCapture log;
+  MediaInfoValid(nullptr);
+  ASSERT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(log.lines()[0].priority, LOG_ERR);
+  EXPECT_TRUE(std::regex_match(
+      log.lines()[0].text,
+      std::regex(R"(quvaidx_unicode \(\d+\) Bad parameter\.)")));
+}
 
 TEST_F(MediaValidTest, CleanUtf8RecordComesOutUnchanged) {
   __tag_QUVA_MEDIA_INFO r = CleanRecord();

@@ -4,8 +4,7 @@
 
 #include <string>
 
-#include "host_test_util.h"
-#include "quvahost/quvahost.h"
+#include "support/fake_host.h"
 
 namespace quvahost::test {
 namespace {
@@ -44,32 +43,48 @@ TEST(CodePageTest, SettingForms) {
   }
 }
 
-TEST(UTF16Test, ByteOrderAndCharacters) {
+// The text a conversion left in `out`, filled with '#' before: "untouched"
+// when it failed without writing.
+std::string Written(int result, const char* out) {
+  return result >= 0 ? out : out[0] == '#' ? "untouched" : "written";
+}
+
+// Output is cut on a character boundary to out_size; input is read no
+// further than out_size bytes, and a character cut by that limit is dropped.
+TEST(UTF16Test, ByteOrderCharactersAndBounds) {
+  std::string long_text;  // 127 'A' within the 254 bytes read, then 'B'
+  for (int i = 0; i < 150; ++i)
+    long_text += std::string(i < 127 ? "A" : "B") + '\0';
   const struct {
     std::string bytes;
-    int result;
-    const char* utf8;
+    int out_size, result;
+    std::string utf8;
   } cases[] = {
-      {std::string("A\0B\0\0\0", 6), 2, "AB"},          // LE, no BOM
-      {std::string("\377\376A\0B\0\0\0", 8), 2, "AB"},  // LE BOM
-      {std::string("\xFE\xFF\0A\0B\0\0", 8), 2, "AB"},  // BE BOM
+      {std::string("A\0B\0\0\0", 6), 255, 2, "AB"},          // LE, no BOM
+      {std::string("\377\376A\0B\0\0\0", 8), 255, 2, "AB"},  // LE BOM
+      {std::string("\xFE\xFF\0A\0B\0\0", 8), 255, 2, "AB"},  // BE BOM
       // Only both bytes make a mark: one of them alone is text.
-      {std::string("\376\0\0\0", 4), 2, "\xC3\xBE"},     // U+00FE
-      {std::string("\377\0\0\0", 4), 2, "\xC3\xBF"},     // U+00FF
-      {std::string("A\377\0\0", 4), 3, "\xEF\xBD\x81"},  // U+FF41
-      {std::string("A\376\0\0", 4), 3, "\xEF\xB9\x81"},  // U+FE41
-      {std::string("\xE5\x65\x2C\x67\0\0", 6), 6, "日本"},
-      {std::string("\x3D\xD8\x00\xDE\0\0", 6), 4, "\xF0\x9F\x98\x80"},
-      {std::string("\0\336A\0\0\0", 6), -1, "untouched"},  // lone trail
-      {std::string("=\330A\0\0\0", 6), -1, "untouched"},   // lone lead
-      {std::string("\x3D\xD8\0\0", 4), -1, "untouched"}};  // lead, then end
+      {std::string("\376\0\0\0", 4), 255, 2, "\xC3\xBE"},     // U+00FE
+      {std::string("\377\0\0\0", 4), 255, 2, "\xC3\xBF"},     // U+00FF
+      {std::string("A\377\0\0", 4), 255, 3, "\xEF\xBD\x81"},  // U+FF41
+      {std::string("A\376\0\0", 4), 255, 3, "\xEF\xB9\x81"},  // U+FE41
+      {std::string("\xE5\x65\x2C\x67\0\0", 6), 255, 6, "日本"},
+      {std::string("\x3D\xD8\x00\xDE\0\0", 6), 255, 4, "\xF0\x9F\x98\x80"},
+      {std::string("\0\336A\0\0\0", 6), 255, -1, "untouched"},  // lone trail
+      {std::string("=\330A\0\0\0", 6), 255, -1, "untouched"},   // lone lead
+      {std::string("\x3D\xD8\0\0", 4), 255, -1, "untouched"},  // lead, then end
+      {std::string("\xE5\x65\x2C\x67\0", 5), 6, 3, "日"},
+      {std::string("A\0\x3D\xD8\x00\xDE\0", 7), 4, 1, "A"},
+      {long_text, 255, 127, std::string(127, 'A')}};
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.utf8);
-    char text[64] = {};
+    SCOPED_TRACE(c.utf8.substr(0, 8));
+    char text[320] = {};
     memcpy(text, c.bytes.data(), c.bytes.size());
-    char out[255] = "untouched";
-    EXPECT_EQ(QLIBCUnicodeStrUTF16ToUTF8(text, out, sizeof out), c.result);
-    EXPECT_STREQ(out, c.utf8);
+    char out[300];
+    memset(out, '#', sizeof out);
+    EXPECT_EQ(QLIBCUnicodeStrUTF16ToUTF8(text, out, c.out_size), c.result);
+    EXPECT_EQ(Written(c.result, out), c.utf8);
+    EXPECT_EQ(out[c.out_size], '#');
     EXPECT_TRUE(c.result >= 0 || QLIBCErrGet() == EILSEQ);
   }
   char field[255] = "h\0i\0\0";  // in place
@@ -81,72 +96,41 @@ TEST(UTF16Test, ByteOrderAndCharacters) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
 }
 
-// Output is cut on a character boundary; input is read no further than the
-// output size, and a character cut by that limit is dropped.
-TEST(UTF16Test, Bounds) {
-  char out[8];
-  memset(out, '#', sizeof out);
-  EXPECT_EQ(QLIBCUnicodeStrUTF16ToUTF8("\xE5\x65\x2C\x67\0", out, 6), 3);
-  EXPECT_STREQ(out, "日");
-  EXPECT_EQ(out[6], '#');
-  EXPECT_EQ(QLIBCUnicodeStrUTF16ToUTF8("A\0\x3D\xD8\x00\xDE\0", out, 4), 1);
-  EXPECT_STREQ(out, "A");
-  char memory[300];
-  for (int i = 0; i < 300; i += 2) {
-    memory[i] = i < 254 ? 'A' : 'B';
-    memory[i + 1] = 0;
-  }
-  char big[255];
-  EXPECT_EQ(QLIBCUnicodeStrUTF16ToUTF8(memory, big, 255), 127);
-  EXPECT_EQ(std::string(big), std::string(127, 'A'));
-}
-
-TEST(CodePageConversionTest, Texts) {
+TEST(CodePageConversionTest, TextsAndBounds) {
+  const std::string aaaa(15, 'a');  // no terminator within 8 bytes
+  const std::string e254(254, '\xE9');
+  std::string e127;
+  for (int i = 0; i < 127; ++i) e127 += "é";
   const struct {
     int code_page;
     const char* text;
-    int result;
+    int out_size, result;
     const char* utf8;
     int error;
-  } cases[] = {{1, "caf\xE9", 5, "café", 0},
-               {11, "\x93\xFA\x96\x7B", 6, "日本", 0},
-               {0, "\xC3\xA9t\xC3\xA9", 5, "été", 0},
-               {0, "ab\xC3", -1, "untouched", EILSEQ},    // truncated UTF-8
-               {0, "\xC0\x80", -1, "untouched", EILSEQ},  // overlong
-               {11, "\x93", -1, "untouched", EILSEQ},     // truncated Shift_JIS
-               {99, "abc", -1, "untouched", EINVAL},
-               {1, "", 0, "", 0}};
+  } cases[] = {{1, "caf\xE9", 255, 5, "café", 0},
+               {11, "\x93\xFA\x96\x7B", 255, 6, "日本", 0},
+               {0, "\xC3\xA9t\xC3\xA9", 255, 5, "été", 0},
+               {0, "ab\xC3", 255, -1, "untouched", EILSEQ},    // cut UTF-8
+               {0, "\xC0\x80", 255, -1, "untouched", EILSEQ},  // overlong
+               {11, "\x93", 255, -1, "untouched", EILSEQ},     // cut Shift_JIS
+               {99, "abc", 255, -1, "untouched", EINVAL},
+               {1, "", 255, 0, "", 0},
+               {1, "\xE9\xE9\xE9", 4, 2, "é", 0},
+               {1, aaaa.c_str(), 8, 7, "aaaaaaa", 0},
+               // 日日 limited to 3 input bytes: the second 日 is cut.
+               {11, "\x93\xFA\x93\xFA", 4, 3, "日", 0},
+               // 254 Latin-1 bytes expand to 508 bytes of UTF-8: cut to 254.
+               {15, e254.c_str(), 255, 254, e127.c_str(), 0}};
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.utf8);
-    char out[255] = "untouched";
-    EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(c.code_page, c.text, out, sizeof out),
+    SCOPED_TRACE(c.text);
+    char out[300];
+    memset(out, '#', sizeof out);
+    EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(c.code_page, c.text, out, c.out_size),
               c.result);
-    EXPECT_STREQ(out, c.utf8);
+    EXPECT_EQ(Written(c.result, out), c.utf8);
+    EXPECT_EQ(out[c.out_size], '#');
     EXPECT_TRUE(c.result >= 0 || QLIBCErrGet() == c.error);
   }
-}
-
-TEST(CodePageConversionTest, Bounds) {
-  char out[16];
-  memset(out, '#', sizeof out);
-  EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(1, "\xE9\xE9\xE9", out, 4), 2);
-  EXPECT_STREQ(out, "é");
-  EXPECT_EQ(out[4], '#');
-  char memory[16];
-  memset(memory, 'a', sizeof memory);  // no terminator within 8 bytes
-  memory[15] = '\0';
-  EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(1, memory, out, 8), 7);
-  EXPECT_STREQ(out, "aaaaaaa");
-  // 日日 in Shift_JIS, limited to 3 input bytes: the second 日 is cut.
-  EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(11, "\x93\xFA\x93\xFA", out, 4), 3);
-  EXPECT_STREQ(out, "日");
-  // 254 Latin-1 bytes expand to 508 bytes of UTF-8: cut to 254.
-  char field[255];
-  memset(field, '\xE9', 254);
-  field[254] = '\0';
-  char full[255];
-  EXPECT_EQ(QLIBCUnicodeStrCPToUTF8(15, field, full, sizeof full), 254);
-  EXPECT_EQ(QLIBCUnicodeUTF8StrCountChar(full), 127);
 }
 
 TEST(UTF8StepTest, CountAndForward) {

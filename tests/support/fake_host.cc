@@ -1,13 +1,13 @@
 // Every host operation becomes a hook that counts the call, applies a
 // failure or int answer, and otherwise calls its entry of the "next" table:
-// the previous operation, a typed answer, or the in-memory shares.
+// the previous operation or a typed answer.
 #include "support/fake_host.h"
 
 #include <string.h>
 
 #include <algorithm>
-#include <map>
 #include <type_traits>
+#include <vector>
 
 #include "host_error.h"
 #include "share_db.h"
@@ -24,15 +24,10 @@ struct OpState {
   std::string text;  // typed text answer
 };
 
-using Shares = std::map<std::string, std::pair<std::string, unsigned>>;
-
 struct FakeState {
   HostOps previous{}, next{};
   OpState ops[static_cast<int>(HostOp::kCount)];
-  int code_page = 0;
   QLIBCFileStatRecord stat_record{};
-  Shares shares;  // name to normalized path and status
-  std::vector<std::pair<std::string, unsigned>> share_updates;
   int outstanding_records = 0;
   bool records_on_failure = false;  // failed lookups hand out a record
 };
@@ -41,15 +36,18 @@ FakeState* g_state = nullptr;
 
 OpState& Op(HostOp op) { return g_state->ops[static_cast<int>(op)]; }
 
-// What a failed share lookup leaves in *record: null, or a blank record
-// when the fake plays a host that hands one out all the same.
+// After a share lookup: what a failed one leaves in *record (null, or a
+// blank record when the fake plays a host that hands one out all the same),
+// and the count of records handed out.
 template <typename T>
-void FailedShareOutput(T) {}
-void FailedShareOutput(ShareRecord** record) {
+void AfterLookup(bool, T) {}
+void AfterLookup(bool failed, ShareRecord** record) {
   if (record == nullptr) return;
-  int error = 0;
-  *record =
-      g_state->records_on_failure ? NewShareRecord("", "", 0, &error) : nullptr;
+  if (failed) {
+    int error = 0;
+    *record = g_state->records_on_failure ? NewShareRecord("", "", 0, &error)
+                                          : nullptr;
+  }
   if (*record != nullptr) ++g_state->outstanding_records;
 }
 
@@ -63,7 +61,7 @@ struct HookFor<kOp, R (*)(A...)> {
     OpState& op = Op(kOp);
     ++op.calls;
     if (op.fail) {
-      (FailedShareOutput(args), ...);
+      (AfterLookup(true, args), ...);
       HostFail(op.fail_code, __FILE__, __LINE__);
       if constexpr (std::is_pointer_v<R>) return nullptr;
       if constexpr (!std::is_pointer_v<R>) return R(op.fail_result);
@@ -74,8 +72,12 @@ struct HookFor<kOp, R (*)(A...)> {
         if (op.next_answer + 1 < op.answers.size()) ++op.next_answer;
         return answer;
       }
+      int result = (g_state->next.*kSlot)(args...);
+      (AfterLookup(result != 0, args), ...);
+      return result;
+    } else {
+      return (g_state->next.*kSlot)(args...);
     }
-    return (g_state->next.*kSlot)(args...);
   }
 };
 
@@ -88,55 +90,6 @@ constexpr HostOps kHooks = {
 };
 
 int Refuse(int code) { return HostFail(code, __FILE__, __LINE__); }
-
-int RefuseLookup(int code, ShareRecord** record) {
-  FailedShareOutput(record);
-  return Refuse(code);
-}
-
-// --- in-memory shares, installed by the first AddShare ---------------------
-
-int HandOut(Shares::const_iterator it, ShareRecord** record) {
-  if (it == g_state->shares.end()) return RefuseLookup(ENOENT, record);
-  int error = 0;
-  *record =
-      NewShareRecord(it->first, it->second.first, it->second.second, &error);
-  if (*record == nullptr) return RefuseLookup(error, record);
-  ++g_state->outstanding_records;
-  return 0;
-}
-
-int ShareGet(const char* name, ShareRecord** record) {
-  if (record != nullptr) *record = nullptr;
-  if (name == nullptr || record == nullptr) return RefuseLookup(EINVAL, record);
-  return HandOut(g_state->shares.find(name), record);
-}
-
-// The share with the longest path that holds `value`.
-int ShareGetByAttrStr(const char* value, int attribute, ShareRecord** record) {
-  std::string path;
-  if (record != nullptr) *record = nullptr;
-  if (value == nullptr || record == nullptr ||
-      attribute != QUVA_SHARE_ATTR_PATH || !NormalizeAbsolutePath(value, &path))
-    return RefuseLookup(EINVAL, record);
-  auto best = g_state->shares.cend();
-  for (auto it = g_state->shares.cbegin(); it != g_state->shares.cend(); ++it) {
-    if (ShareHoldsPath(it->second.first, path) &&
-        (best == g_state->shares.cend() ||
-         it->second.first.size() > best->second.first.size()))
-      best = it;
-  }
-  return HandOut(best, record);
-}
-
-int ShareUpdate(const ShareRecord* record) {
-  if (record == nullptr) return Refuse(EINVAL);
-  auto it = g_state->shares.find(record->szName);
-  if (it == g_state->shares.end()) return Refuse(ENOENT);
-  it->second.second = record->uStatus;
-  g_state->share_updates.emplace_back(it->first, record->uStatus);
-  return 0;
-}
 
 void ShareFree(ShareRecord* record) {
   if (record != nullptr) --g_state->outstanding_records;
@@ -167,6 +120,7 @@ FakeHost::FakeHost() {
   g_state = new FakeState;
   previous_ = SetHostOps(&kHooks);
   g_state->previous = g_state->next = previous_;
+  g_state->next.ShareFree = ShareFree;  // counts the releases
 }
 
 FakeHost::~FakeHost() {
@@ -189,20 +143,6 @@ void FakeHost::Answer(HostOp op, std::initializer_list<int> results) {
 void FakeHost::Pass(HostOp op) {
   Op(op).fail = false;
   Op(op).answers.clear();
-}
-
-void FakeHost::AnswerEADirPath(const std::string& path) {
-  Op(HostOp::kEADirPath).text = path;
-  g_state->next.EADirPath = [](int, const char*, char* buffer, int size) {
-    return CopyAnswer(HostOp::kEADirPath, buffer, size) < 0 ? -1 : 0;
-  };
-}
-
-void FakeHost::AnswerCodePage(int code_page) {
-  g_state->code_page = code_page;
-  g_state->next.CodePageGet = [](int, int* out) {
-    return out == nullptr ? Refuse(EINVAL) : (*out = g_state->code_page, 0);
-  };
 }
 
 void FakeHost::AnswerFileStat(const QLIBCFileStatRecord& record) {
@@ -233,31 +173,7 @@ void FakeHost::AnswerConversion(HostOp op, const std::string& utf8) {
   }
 }
 
-void FakeHost::AddShare(const std::string& name, const std::string& path,
-                        unsigned status) {
-  g_state->next.ShareGet = ShareGet;
-  g_state->next.ShareGetByAttrStr = ShareGetByAttrStr;
-  g_state->next.ShareUpdate = ShareUpdate;
-  g_state->next.ShareFree = ShareFree;
-  std::string normal;
-  g_state->shares[name] = {NormalizeAbsolutePath(path, &normal) ? normal : path,
-                           status};
-}
-
-unsigned FakeHost::ShareStatus(const std::string& name) const {
-  auto it = g_state->shares.find(name);
-  return it == g_state->shares.end() ? 0 : it->second.second;
-}
-
-const std::vector<std::pair<std::string, unsigned>>& FakeHost::ShareUpdates()
-    const {
-  return g_state->share_updates;
-}
-
-void FakeHost::HandOutRecordsOnFailure() {
-  g_state->records_on_failure = true;
-  g_state->next.ShareFree = ShareFree;  // counts the releases
-}
+void FakeHost::HandOutRecordsOnFailure() { g_state->records_on_failure = true; }
 
 int FakeHost::OutstandingShareRecords() const {
   return g_state->outstanding_records;

@@ -1,4 +1,5 @@
-// A fault and answer layer over the host operations (quvahost.h).
+// A fault and answer layer over the host operations (quvahost.h), and a
+// host directory for the stand-in.
 //
 // While a FakeHost lives, each host operation is counted, then failed or
 // answered as told, or else passed on to the stand-in (the real files under
@@ -12,14 +13,14 @@
 #define QUVAIDX_TESTS_SUPPORT_FAKE_HOST_H_
 
 #include <errno.h>
+#include <stdlib.h>
 
 #include <initializer_list>
 #include <string>
-#include <utility>
-#include <vector>
 
 #include "host_ops.h"
 #include "quvahost/quvahost.h"
+#include "support/fd_check.h"
 
 namespace quvahost::test {
 
@@ -51,27 +52,43 @@ class FakeHost {
   // Typed answers: every later call succeeds with this output; a text that
   // does not fit the caller's buffer fails with ERANGE, except conversions
   // (kUnicodeStrUTF16ToUTF8, kUnicodeStrCPToUTF8), cut on a character.
-  void AnswerEADirPath(const std::string& path);
-  void AnswerCodePage(int code_page);
   void AnswerFileStat(const QLIBCFileStatRecord& record);
   void AnswerSectionValue(const std::string& value);
   void AnswerConversion(HostOp op, const std::string& utf8);
 
-  // In-memory shares: once one is added, share lookups (with the share
-  // file's path rules) and updates use them; updates are recorded.
-  void AddShare(const std::string& name, const std::string& path,
-                unsigned status);
-  unsigned ShareStatus(const std::string& name) const;
-  const std::vector<std::pair<std::string, unsigned>>& ShareUpdates() const;
-  // From now on a failing share lookup (Fail, or no in-memory share) still
-  // hands out a blank record in *record, as a host may: callers must
-  // release *record after a failed lookup too. Counted as outstanding.
+  // From now on a failing share lookup still hands out a blank record in
+  // *record, as a host may: callers must release *record after a failed
+  // lookup too.
   void HandOutRecordsOnFailure();
-  int OutstandingShareRecords() const;  // handed out, not freed
-  int Calls(HostOp op) const;           // calls of `op` since installation
+  // Records handed out by share lookups since installation, not freed.
+  int OutstandingShareRecords() const;
+  int Calls(HostOp op) const;  // calls of `op` since installation
 
  private:
   HostOps previous_;
+};
+
+using quvaidx::test::ReadFile;
+using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+
+// A fresh host directory: $QUVA_HOST_ETC names it while it lives.
+class HostEtc : public TempDir {
+ public:
+  HostEtc() {
+    if (const char* old = getenv(QUVA_HOST_ETC_ENV)) old_ = old;
+    setenv(QUVA_HOST_ETC_ENV, path().c_str(), 1);
+  }
+  ~HostEtc() {
+    if (old_.empty()) {
+      unsetenv(QUVA_HOST_ETC_ENV);
+    } else {
+      setenv(QUVA_HOST_ETC_ENV, old_.c_str(), 1);
+    }
+  }
+
+ private:
+  std::string old_;
 };
 
 }  // namespace quvahost::test

@@ -20,7 +20,6 @@ class FdLeakCheck {
  public:
   FdLeakCheck() : before_(OpenDescriptorCount()) {}
   bool NoLeak() const { return OpenDescriptorCount() == before_; }
-  int before() const { return before_; }
 
  private:
   int before_;
