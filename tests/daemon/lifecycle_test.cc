@@ -25,6 +25,7 @@
 #include "support/fake_sleep.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
+#include "support/unprivileged.h"
 
 namespace {
 
@@ -32,6 +33,7 @@ using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
 using quvaidx::test::FakeSleep;
 using quvaidx::test::LogCapture;
+using quvaidx::test::RunWithFileSizeLimit;
 using quvaidx::test::TempDir;
 
 using quvaidx::test::ReadFile;
@@ -194,6 +196,17 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
     ASSERT_EQ(std::count(outcome.begin(), outcome.end(), 'R'), 1)
         << "attempt " << attempt << ": " << outcome;
   }
+}
+
+// A pid that cannot be written (here the disk is full) fails the start and
+// leaves the file unlocked, so the next start is not turned away.
+TEST_F(LifecycleTest, PidThatCannotBeWrittenFailsAndUnlocks) {
+  auto refused_then_free = [&] {
+    if (BecomeProcess(pid_file_.c_str()) != -1) return 1;
+    int fd = open(pid_file_.c_str(), O_RDONLY | O_CLOEXEC);
+    return fd >= 0 && flock(fd, LOCK_EX | LOCK_NB) == 0 ? 0 : 2;
+  };
+  EXPECT_EQ(RunWithFileSizeLimit(0, refused_then_free), 0);
 }
 
 // DeletePidFile removes a stale pid file and this process's own, never that

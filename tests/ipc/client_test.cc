@@ -220,4 +220,22 @@ TEST_F(ClientTest, ExchangeOnCallersDescriptor) {
   close(fds[0]);
 }
 
+// A daemon started with its standard input closed gets connections on
+// descriptor 0: disconnecting must close that one too, and only it.
+TEST_F(ClientTest, DisconnectClosesDescriptorZero) {
+  int saved = dup(0);
+  ASSERT_GE(saved, 0);
+  int fds[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+  ASSERT_EQ(dup2(fds[0], 0), 0);
+  close(fds[0]);
+  EXPECT_EQ(DisconnectPeer(0), 0);
+  EXPECT_EQ(fcntl(0, F_GETFD), -1);
+  EXPECT_EQ(DisconnectPeer(-1), 0);
+  EXPECT_NE(fcntl(fds[1], F_GETFD), -1);
+  close(fds[1]);
+  dup2(saved, 0);
+  close(saved);
+}
+
 }  // namespace

@@ -101,6 +101,27 @@ TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
   EXPECT_EQ(Get("/a/c", true).name, "a");
 }
 
+// A share whose name or path would fill its record field, terminator
+// included, is no valid share; one byte less fits.
+TEST_F(ShareDbTest, NamesAndPathsFitTheRecord) {
+  const std::string name(QUVA_SHARE_NAME_SIZE - 1, 'n');
+  const std::string path = "/" + std::string(QUVA_SHARE_PATH_SIZE - 2, 'p');
+  const struct {
+    std::string name, path;
+    int result;
+  } cases[] = {{name, "/a", 0},
+               {name + "n", "/a", -1},
+               {"p", path, 0},
+               {"p", path + "p", -1}};
+  for (const auto& c : cases) {
+    WriteFile(Db(), "[" + c.name + "]\npath = " + c.path + "\n");
+    Found found = Get(c.name.c_str());
+    EXPECT_EQ(found.result, c.result) << c.name.size() << " " << c.path.size();
+    EXPECT_EQ(found.path, c.result == 0 ? c.path : "");
+    EXPECT_TRUE(c.result == 0 || QLIBCErrGet() == ENOENT);
+  }
+}
+
 // Updates `name` to `status` (with a scribbled path) and returns the file.
 std::string Update(const std::string& db, const char* name, unsigned status) {
   ShareRecord* record = nullptr;
