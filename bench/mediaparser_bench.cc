@@ -23,7 +23,6 @@
 #include <fcntl.h>
 #include <math.h>
 #include <signal.h>
-#include <spawn.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -45,14 +44,13 @@ extern "C" {
 #include <exiv2/exiv2.hpp>
 #pragma GCC diagnostic pop
 
+#include "bench_process.h"
 #include "bench_support.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/media_type.h"
 #include "requests/index_requests_internal.h"
 
 namespace qb = quvaidx_bench;
-
-extern char** environ;
 
 namespace {
 
@@ -84,27 +82,13 @@ std::vector<MediaFile> ReadCorpus(const std::string& dir) {
 }
 
 // Runs `argv` with its output to /dev/null; returns its exit status or -1.
+// With `pid_out`, only starts it and stores its pid there (0 or -1).
 int Spawn(const std::vector<std::string>& argv, pid_t* pid_out = nullptr) {
-  std::vector<char*> args;
-  for (const std::string& arg : argv)
-    args.push_back(const_cast<char*>(arg.c_str()));
-  args.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid;
-  int error =
-      posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  if (error != 0) return -1;
-  if (pid_out != nullptr) {
-    *pid_out = pid;
-    return 0;
-  }
-  int status;
-  if (waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) return -1;
-  return WEXITSTATUS(status);
+  pid_t pid = quvaidx_bench::SpawnQuiet(argv);
+  if (pid < 0) return -1;
+  if (pid_out == nullptr) return quvaidx_bench::WaitExit(pid);
+  *pid_out = pid;
+  return 0;
 }
 
 void FloorOne(const MediaFile& file) {

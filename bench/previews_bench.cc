@@ -23,7 +23,6 @@
 // vipsthumbnail call; a size map in at most 1.3 times a handshake.
 #include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -38,11 +37,10 @@
 #include <quvaidx/ipc.h>
 #include <vips/vips.h>
 
+#include "bench_process.h"
 #include "bench_report.h"
 #include "preview_names.h"
 #include "thumbnailer.h"
-
-extern char** environ;
 
 namespace qb = quvaidx_bench;
 
@@ -74,23 +72,9 @@ std::string FindProgram(std::initializer_list<const char*> names) {
 }
 
 // Runs `argv` with its output thrown away and waits. True on exit status 0.
-bool Run(std::vector<std::string> argv) {
-  std::vector<char*> args;
-  for (std::string& arg : argv) args.push_back(arg.data());
-  args.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid;
-  int failed =
-      posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  if (failed != 0) return false;
-  int status = 0;
-  while (waitpid(pid, &status, 0) < 0) {
-  }
-  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+bool Run(const std::vector<std::string>& argv) {
+  pid_t pid = quvaidx_bench::SpawnQuiet(argv);
+  return pid >= 0 && quvaidx_bench::WaitExit(pid) == 0;
 }
 
 bool MakePhoto(const std::string& path) {
@@ -177,16 +161,8 @@ bool StartPlugind(const std::string& program) {
   std::vector<std::string> argv = {program,     "--foreground",
                                    "--socket",  g_socket,
                                    "--pidfile", g_dir + "/plugind.pid"};
-  std::vector<char*> args;
-  for (std::string& arg : argv) args.push_back(arg.data());
-  args.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-  int failed =
-      posix_spawn(&g_plugind, args[0], &actions, nullptr, args.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  if (failed != 0) return false;
+  g_plugind = quvaidx_bench::SpawnQuiet(argv, true);
+  if (g_plugind < 0) return false;
   for (int i = 0; i < 500; ++i) {  // at most 5 s
     Json::Value value(Json::objectValue);
     value["command"] = "HANDSHAKE";
