@@ -9,6 +9,7 @@
 #include <string>
 
 #include <json/json.h>
+#include <unicode/utf8.h>
 
 #include "support/fd_check.h"
 
@@ -67,31 +68,15 @@ inline Json::Value CommandJson(const std::string& command) {
   return value;
 }
 
-// Strict UTF-8 (ICU's rules: no overlong forms, surrogates or values above
-// U+10FFFF).
+// Strict UTF-8 (no overlong forms, surrogates or values above U+10FFFF),
+// judged by ICU's decoder rather than the daemon's own check.
 inline bool IsValidUTF8(const std::string& text) {
-  size_t i = 0;
-  while (i < text.size()) {
-    unsigned char c = static_cast<unsigned char>(text[i]);
-    int extra = c < 0x80                 ? 0
-                : c >= 0xC2 && c <= 0xDF ? 1
-                : c >= 0xE0 && c <= 0xEF ? 2
-                : c >= 0xF0 && c <= 0xF4 ? 3
-                                         : -1;
-    if (extra < 0 || text.size() - i <= static_cast<size_t>(extra)) {
-      return false;
-    }
-    unsigned cp = extra == 0 ? c : c & (0x3F >> extra);
-    for (int k = 1; k <= extra; ++k) {
-      unsigned char next = static_cast<unsigned char>(text[i + k]);
-      if ((next & 0xC0) != 0x80) return false;
-      cp = cp << 6 | (next & 0x3F);
-    }
-    if ((extra == 2 && (cp < 0x800 || (cp >= 0xD800 && cp <= 0xDFFF))) ||
-        (extra == 3 && (cp < 0x10000 || cp > 0x10FFFF))) {
-      return false;
-    }
-    i += extra + 1;
+  const int32_t length = static_cast<int32_t>(text.size());
+  int32_t i = 0;
+  while (i < length) {
+    UChar32 c;
+    U8_NEXT(text.data(), i, length, c);
+    if (c < 0) return false;
   }
   return true;
 }
