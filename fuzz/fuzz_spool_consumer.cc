@@ -31,30 +31,20 @@
 
 #include "fuzz_report.h"
 #include "fuzz_scratch_dir.h"
+#include "queue_filler.h"
 #include "quvaidx/spool_consumer.h"
 #include "quvaidx/system.h"
 
 namespace {
 
+using fuzz_queue::Filler;
+using fuzz_queue::kFillerUnit;
+
 constexpr size_t kMaxInput = 64 * 1024;
-constexpr size_t kFillerUnit = 2731;
 constexpr unsigned kFillerUnits = 24;
 
 [[noreturn]] void Fail(const char* what, std::string_view input) {
   FuzzFail("fuzz_spool_consumer", what, input);
-}
-
-// `bytes` bytes of lines of 1 to 97 bytes ('\n' included), the last one
-// possibly cut.
-std::string Filler(size_t bytes) {
-  std::string text;
-  for (int i = 0; text.size() < bytes; ++i) {
-    text.append(static_cast<size_t>(i * 37 % 97),
-                static_cast<char>('a' + i % 26));
-    text += '\n';
-  }
-  text.resize(bytes);
-  return text;
 }
 
 // The model: the first `max` lines of `text` as entries, and the text that

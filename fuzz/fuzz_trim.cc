@@ -26,7 +26,9 @@
 #include <string>
 #include <string_view>
 
+#include "fuzz_report.h"
 #include "fuzz_scratch_dir.h"
+#include "queue_filler.h"
 #include "quvaidx/system.h"
 
 namespace {
@@ -36,38 +38,17 @@ constexpr int kMinCount = -2;
 constexpr int kMaxCount = 60000;
 constexpr mode_t kMode = 0640;
 
+using fuzz_queue::Filler;
+using fuzz_queue::kFillerUnit;
 using fuzz_scratch::Die;
 using Scratch = fuzz_scratch::ScratchDir;
 
 [[noreturn]] void Fail(const char* what, int n, std::string_view text) {
-  fprintf(stderr, "fuzz_trim: %s; n %d, file (%zu bytes): \"", what, n,
-          text.size());
-  for (unsigned char c : text.substr(0, 300)) {
-    if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
-      fputc(c, stderr);
-    } else {
-      fprintf(stderr, "\\x%02x", c);
-    }
-  }
-  fprintf(stderr, "%s\"\n", text.size() > 300 ? "..." : "");
-  abort();
+  std::string message = std::string(what) + "; n " + std::to_string(n);
+  FuzzFail("fuzz_trim", message.c_str(), text);
 }
 
-constexpr size_t kFillerUnit = 2731;
 constexpr unsigned kFillerUnits = 48;
-
-// `bytes` bytes of lines of 1 to 97 bytes ('\n' included), the last one
-// possibly cut.
-std::string Filler(size_t bytes) {
-  std::string text;
-  for (int i = 0; text.size() < bytes; ++i) {
-    text.append(static_cast<size_t>(i * 37 % 97),
-                static_cast<char>('a' + i % 26));
-    text += '\n';
-  }
-  text.resize(bytes);
-  return text;
-}
 
 // The text without its first n lines.
 std::string_view Model(std::string_view text, int n) {
