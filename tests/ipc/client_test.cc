@@ -22,6 +22,7 @@ namespace {
 
 using quvaidx::test::FakeSleep;
 using quvaidx::test::FdLeakCheck;
+using quvaidx::test::ListenUnix;
 using quvaidx::test::LogCapture;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -79,14 +80,9 @@ TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
 // A daemon whose backlog stays full does not hold the client: each attempt
 // gives up after the connect limit and counts as failed, with its line.
 TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
-  struct sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  path_.copy(address.sun_path, sizeof(address.sun_path) - 1);
-  int daemon = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  ASSERT_EQ(bind(daemon, reinterpret_cast<struct sockaddr*>(&address),
-                 sizeof(address)),
-            0);
-  ASSERT_EQ(listen(daemon, 0), 0);  // never accepts
+  int daemon = ListenUnix(path_, 0);
+  ASSERT_GE(daemon, 0);
+  struct sockaddr_un address = quvaidx::test::UnixAddress(path_);
   std::vector<int> queued;
   for (int i = 0; i < 8; ++i) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
@@ -183,6 +179,8 @@ TEST_F(ClientTest, ResetRestartsTheExchangeAFewTimes) {
   }
 }
 
+// A notification goes out after a handshake, and the value sent is left
+// null: the caller must not read a reply into it.
 TEST_F(ClientTest, SendWithoutReplyHandshakesFirstAndNullsTheValue) {
   Json::Value received;
   ScriptedPeer peer(path_, [&](int& fd, int) {
