@@ -134,17 +134,6 @@ TEST_F(ClientTest, OverlongPathIsRefusedNotCut) {
           "quvaidx_ipc_core:N [Error] socket path too long: " + longest + "q"});
 }
 
-// A failed exchange empties the request; scalars cannot be cleared in
-// place and become null, without throwing.
-TEST_F(ClientTest, FailedExchangeEmptiesTheRequest) {
-  Json::Value object = Command("X"), text("not an object"), number(5);
-  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), object, 1), -1);
-  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), text, 1), -1);
-  EXPECT_EQ(AutoSendPacket(path_.c_str(), number, 1), -1);
-  EXPECT_EQ(object, Json::Value(Json::objectValue));
-  EXPECT_TRUE(text.isNull() && number.isNull());
-}
-
 // A reset restarts the exchange (answered on the second connection), at
 // most kMaxExchangeRestarts times; a peer that hangs up fails the handshake
 // on each attempt.
@@ -179,9 +168,16 @@ TEST_F(ClientTest, ResetRestartsTheExchangeAFewTimes) {
   }
 }
 
-// A notification goes out after a handshake, and the value sent is left
-// null: the caller must not read a reply into it.
-TEST_F(ClientTest, SendWithoutReplyHandshakesFirstAndNullsTheValue) {
+// What an exchange leaves in the value: a failed one empties the request
+// (scalars cannot be cleared in place and become null, without throwing); a
+// notification, sent after a handshake, is nulled once it went out.
+TEST_F(ClientTest, ExchangesLeaveTheValueEmptyOrNull) {
+  Json::Value object = Command("X"), text("not an object"), number(5);
+  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), object, 1), -1);
+  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), text, 1), -1);
+  EXPECT_EQ(AutoSendPacket(path_.c_str(), number, 1), -1);
+  EXPECT_EQ(object, Json::Value(Json::objectValue));
+  EXPECT_TRUE(text.isNull() && number.isNull());
   Json::Value received;
   ScriptedPeer peer(path_, [&](int& fd, int) {
     Json::Value request, reply(Json::objectValue);
