@@ -208,12 +208,9 @@ case_lifecycle() {
   run send -s "$WORK/plain" --attempts 2 '{}'
   expect_error "quvaidx send: no daemon answered on $WORK/plain after 2 attempts: not a socket"
   # A daemon that accepts and never answers: --timeout bounds the wait.
-  python3 -c 'import socket, sys, time
+  start mute mute python3 -c 'import socket, sys, time
 s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
-print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock" \
-    >"$WORK/mute.out" &
-  PIDS+=("$!")
-  until_ok grep -qs mute "$WORK/mute.out" || fail "no mute peer"
+print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock"
   run send -s "$WORK/mute.sock" --timeout 0.2 '{}'
   expect_error "quvaidx send: the daemon on $WORK/mute.sock sent no reply within 0.2 s"
   # A new daemon replaces the stale socket; SIGINT stops it cleanly.
