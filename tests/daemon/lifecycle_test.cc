@@ -309,6 +309,8 @@ TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
             "quvaidx_system:N [NOTICE] system is not ready? start anyway.");
 }
 
+// A started program's standard streams are /dev/null; a program that cannot
+// run ends its child with an abort; the caller's SA_NOCLDWAIT survives.
 TEST(ForkExecvTest, ChildOnDevNullMissingProgramAbortsNoChildWaitKept) {
   TempDir dir;
   std::string out = dir.File("out");

@@ -75,6 +75,8 @@ TEST_F(TaskQueueTest, TextAreaSizeClasses) {
             "quvaidx_daemon:N [Error] message is too big: {\"k\":\"t");
 }
 
+// A positive type pops exactly that type, a negative one the lowest type up
+// to its size, zero the oldest; a push needs a type above zero.
 TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
   LogCapture log;
   for (int type : {5, 2, 9, 2})
@@ -93,7 +95,10 @@ TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
   EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] msgsnd: Invalid argument"), 2);
 }
 
-TEST_F(TaskQueueTest, EmptyNonBlockingPopSleepsAfterEachAttempt) {
+// An empty non-blocking pop sleeps once per attempt and logs nothing; a task
+// that is not JSON is still taken off the queue. A blocking pop ignores the
+// attempts and waits: for a push, or until the queue is removed under it.
+TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   LogCapture log;
   Json::Value out;
   EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 3, out), -1);
@@ -108,17 +113,10 @@ TEST_F(TaskQueueTest, EmptyNonBlockingPopSleepsAfterEachAttempt) {
   ASSERT_EQ(msgsnd(id_, &raw, sizeof(raw.text), 0), 0);
   EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
   EXPECT_EQ(GetNumOfMessageInQueue(id_), 0);
-}
-
-// A blocking pop ignores the attempts and waits: for a push, or until the
-// queue is removed under it.
-TEST_F(TaskQueueTest, BlockingPopWaitsForAPushOrTheQueuesRemoval) {
-  LogCapture log;
   std::thread pusher([&] {
     usleep(50 * 1000);
     PushTaskToQueue(id_, Task(42), 4);
   });
-  Json::Value out;
   EXPECT_EQ(PopTaskFromQueue(id_, 4, true, 0, out), 0);
   pusher.join();
   EXPECT_EQ(out["n"].asInt(), 42);

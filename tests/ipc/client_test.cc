@@ -22,6 +22,7 @@ namespace {
 
 using quvaidx::test::FakeSleep;
 using quvaidx::test::FdLeakCheck;
+using quvaidx::test::ListenUnix;
 using quvaidx::test::LogCapture;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -79,14 +80,9 @@ TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
 // A daemon whose backlog stays full does not hold the client: each attempt
 // gives up after the connect limit and counts as failed, with its line.
 TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
-  struct sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  path_.copy(address.sun_path, sizeof(address.sun_path) - 1);
-  int daemon = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  ASSERT_EQ(bind(daemon, reinterpret_cast<struct sockaddr*>(&address),
-                 sizeof(address)),
-            0);
-  ASSERT_EQ(listen(daemon, 0), 0);  // never accepts
+  int daemon = ListenUnix(path_, 0);
+  ASSERT_GE(daemon, 0);
+  struct sockaddr_un address = quvaidx::test::UnixAddress(path_);
   std::vector<int> queued;
   for (int i = 0; i < 8; ++i) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
@@ -138,17 +134,6 @@ TEST_F(ClientTest, OverlongPathIsRefusedNotCut) {
           "quvaidx_ipc_core:N [Error] socket path too long: " + longest + "q"});
 }
 
-// A failed exchange empties the request; scalars cannot be cleared in
-// place and become null, without throwing.
-TEST_F(ClientTest, FailedExchangeEmptiesTheRequest) {
-  Json::Value object = Command("X"), text("not an object"), number(5);
-  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), object, 1), -1);
-  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), text, 1), -1);
-  EXPECT_EQ(AutoSendPacket(path_.c_str(), number, 1), -1);
-  EXPECT_EQ(object, Json::Value(Json::objectValue));
-  EXPECT_TRUE(text.isNull() && number.isNull());
-}
-
 // A reset restarts the exchange (answered on the second connection), at
 // most kMaxExchangeRestarts times; a peer that hangs up fails the handshake
 // on each attempt.
@@ -183,7 +168,16 @@ TEST_F(ClientTest, ResetRestartsTheExchangeAFewTimes) {
   }
 }
 
-TEST_F(ClientTest, SendWithoutReplyHandshakesFirstAndNullsTheValue) {
+// What an exchange leaves in the value: a failed one empties the request
+// (scalars cannot be cleared in place and become null, without throwing); a
+// notification, sent after a handshake, is nulled once it went out.
+TEST_F(ClientTest, ExchangesLeaveTheValueEmptyOrNull) {
+  Json::Value object = Command("X"), text("not an object"), number(5);
+  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), object, 1), -1);
+  EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), text, 1), -1);
+  EXPECT_EQ(AutoSendPacket(path_.c_str(), number, 1), -1);
+  EXPECT_EQ(object, Json::Value(Json::objectValue));
+  EXPECT_TRUE(text.isNull() && number.isNull());
   Json::Value received;
   ScriptedPeer peer(path_, [&](int& fd, int) {
     Json::Value request, reply(Json::objectValue);

@@ -7,24 +7,33 @@
 
 namespace quvaidx::test {
 
-ScriptedPeer::ScriptedPeer(const std::string& path, Script script)
-    : path_(path), script_(std::move(script)) {
+struct sockaddr_un UnixAddress(const std::string& path) {
   struct sockaddr_un address;
   memset(&address, 0, sizeof(address));
   address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof(address.sun_path)) return;
-  memcpy(address.sun_path, path.data(), path.size());
-  unlink(path.c_str());
+  path.copy(address.sun_path, sizeof(address.sun_path) - 1);
+  return address;
+}
+
+int ListenUnix(const std::string& path, int backlog) {
+  struct sockaddr_un address = UnixAddress(path);
   int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return;
+  if (fd < 0) return -1;
   if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) !=
           0 ||
-      listen(fd, 16) != 0) {
+      listen(fd, backlog) != 0) {
     close(fd);
-    return;
+    return -1;
   }
-  listen_fd_ = fd;
-  thread_ = std::thread([this] { Run(); });
+  return fd;
+}
+
+ScriptedPeer::ScriptedPeer(const std::string& path, Script script)
+    : path_(path), script_(std::move(script)) {
+  if (path.size() >= sizeof(sockaddr_un::sun_path)) return;
+  unlink(path.c_str());
+  listen_fd_ = ListenUnix(path, 16);
+  if (listen_fd_ >= 0) thread_ = std::thread([this] { Run(); });
 }
 
 ScriptedPeer::~ScriptedPeer() {

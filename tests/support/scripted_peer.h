@@ -4,12 +4,21 @@
 #ifndef QUVAIDX_TESTS_SUPPORT_SCRIPTED_PEER_H_
 #define QUVAIDX_TESTS_SUPPORT_SCRIPTED_PEER_H_
 
+#include <sys/un.h>
+
 #include <atomic>
 #include <functional>
 #include <string>
 #include <thread>
 
 namespace quvaidx::test {
+
+// The address of the Unix-domain socket at `path`, cut to what it holds.
+struct sockaddr_un UnixAddress(const std::string& path);
+
+// A socket bound to `path` and listening with `backlog` that nobody accepts
+// on: a live daemon that is busy or stuck. -1 when it cannot be made.
+int ListenUnix(const std::string& path, int backlog);
 
 class ScriptedPeer {
  public:

@@ -126,12 +126,17 @@ start() {
 serve() {
   start serve "quvaidx serve: listening on $1" "$TOOL" serve --socket "$@"
 }
-# stop SIGNAL: signals process BG and waits for its end; sets BG_RC.
+# stop SIGNAL FILE...: signals `quvaidx serve` (process BG), which must end
+# with status 0, say why on stdout, and leave none of the FILEs behind.
 stop() {
-  kill -"$1" "$BG"
-  until_ok gone "$BG" || fail "process $BG ignored SIG$1"
-  BG_RC=0
-  wait "$BG" || BG_RC=$?
+  local sig=$1 rc=0 file
+  shift
+  kill -"$sig" "$BG"
+  until_ok gone "$BG" || fail "process $BG ignored SIG$sig"
+  wait "$BG" || rc=$?
+  [ "$rc" -eq 0 ] || fail "exit status $rc after SIG$sig"
+  for file; do [ ! -e "$file" ] || fail "$file left behind"; done
+  has serve.out "quvaidx serve: stopped by SIG$sig"
 }
 
 case_serve_send() {
@@ -175,9 +180,7 @@ case_serve_send() {
   expect_error "quvaidx serve: $WORK/file exists and is not a socket"
   [ "$(cat "$WORK/file")" = keep ] || fail "the file was changed"
   run send -s "$sock" -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
-  stop TERM
-  [ "$BG_RC" -eq 0 ] && [ ! -e "$sock" ] || fail "exit $BG_RC, or socket left"
-  has serve.out "quvaidx serve: stopped by SIGTERM"
+  stop TERM "$sock"
   # --verbose: the library's debug lines reach stderr.
   grep -qF "[quvaidx-serve] BEV_EVENT_EOF" "$WORK/serve.err" ||
     fail "no library log line on the daemon's stderr"
@@ -205,20 +208,15 @@ case_lifecycle() {
   run send -s "$WORK/plain" --attempts 2 '{}'
   expect_error "quvaidx send: no daemon answered on $WORK/plain after 2 attempts: not a socket"
   # A daemon that accepts and never answers: --timeout bounds the wait.
-  python3 -c 'import socket, sys, time
+  start mute mute python3 -c 'import socket, sys, time
 s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
-print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock" \
-    >"$WORK/mute.out" &
-  PIDS+=("$!")
-  until_ok grep -qs mute "$WORK/mute.out" || fail "no mute peer"
+print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock"
   run send -s "$WORK/mute.sock" --timeout 0.2 '{}'
   expect_error "quvaidx send: the daemon on $WORK/mute.sock sent no reply within 0.2 s"
   # A new daemon replaces the stale socket; SIGINT stops it cleanly.
   serve "$sock"
   run send -s "$sock" -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
-  stop INT
-  [ "$BG_RC" -eq 0 ] && [ ! -e "$sock" ] || fail "exit $BG_RC, or socket left"
-  has serve.out "quvaidx serve: stopped by SIGINT"
+  stop INT "$sock"
   [ ! -s "$WORK/serve.err" ] || fail "serve wrote to stderr"
 }
 
@@ -318,9 +316,7 @@ case_serve_pidfile() {
     [ ! -e "$WORK/b.sock" ] && [ "$(cat "$pid_file")" = "$BG" ] ||
       fail "the refused daemon made its socket or changed the pid file"
   done
-  stop TERM
-  [ "$BG_RC" -eq 0 ] && [ ! -e "$pid_file" ] && [ ! -e "$sock" ] ||
-    fail "exit $BG_RC, or pid file or socket left"
+  stop TERM "$pid_file" "$sock"
   # --daemon: what the detached process could not report is found first.
   run serve --daemon --pidfile "$WORK/none/d.pid" --socket "$sock"
   expect_error "quvaidx serve: cannot create the pid file $WORK/none/d.pid: $WORK/none: No such file or directory"
