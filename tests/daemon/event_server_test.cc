@@ -482,6 +482,34 @@ TEST_F(EventServerTest, RepliesToASlowHalfClosedClientAreBoundedAndAllSent) {
   EXPECT_EQ(GetCurrentConnCount(), 0);
 }
 
+// Many small replies still queued when the end of the stream arrives: a
+// client that pipelines 20,000 requests and shuts down its sending side
+// gets every one before the server closes.
+TEST_F(EventServerTest, HalfClosedPipelineGetsEveryReply) {
+  handler_ = Succeed;
+  Start();
+  const int kRequests = 20000;
+  const std::string requests = Requests("R", kRequests);
+  int fd = Connect();
+  // Everything goes out before the client reads a byte.
+  for (size_t sent = 0; sent < requests.size();) {
+    ssize_t n = send(fd, requests.data() + sent, requests.size() - sent,
+                     MSG_DONTWAIT | MSG_NOSIGNAL);
+    sent += n > 0 ? static_cast<size_t>(n) : 0;
+    event_base_loop(base_, EVLOOP_NONBLOCK);
+  }
+  ASSERT_EQ(shutdown(fd, SHUT_WR), 0);
+  bool closed = false;
+  const std::string reply = std::string("\x15\xbe\x00\x11", 4) + kSuccess;
+  const std::string received =
+      Receive(fd, reply.size() * kRequests + 1, &closed, 10000);
+  EXPECT_TRUE(closed);
+  ASSERT_EQ(received.size(), reply.size() * kRequests);
+  for (size_t at = 0; at < received.size(); at += reply.size()) {
+    ASSERT_EQ(received.compare(at, reply.size(), reply), 0) << at;
+  }
+}
+
 // A request that trickles in is closed at the packet deadline counted from
 // its first byte, however steadily its bytes come; a silent connection at
 // the idle deadline; a client that keeps asking is never closed.
