@@ -467,6 +467,8 @@ TEST_F(MediaParserTest, FilesOfFourGibibytesAndMoreAreAnswered) {
   EXPECT_EQ(reason_, "not a media file");
 }
 
+// The time and read limits end the reading with a reason naming the
+// limit; a limit the file fits in lets it be read.
 TEST_F(MediaParserTest, LimitsStopTheReadingWithAReason) {
   ParserOptions no_time;
   no_time.read.time_ms = 0;

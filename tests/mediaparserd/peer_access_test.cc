@@ -34,6 +34,8 @@ struct stat Status(uid_t uid, gid_t gid, mode_t mode) {
   return status;
 }
 
+// As the kernel decides: the first class the peer is in (owner, group,
+// others) decides alone.
 TEST(PeerAccessTest, OwnerThenGroupThenOthersDecide) {
   const std::vector<gid_t> groups = {100, 200};
   struct Case {
