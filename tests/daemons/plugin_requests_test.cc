@@ -21,6 +21,7 @@
 
 namespace {
 
+using quvaidx::daemon_test::NamesUnder;
 using quvaidx::test::ReadFile;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -199,20 +200,6 @@ TEST_F(PluginRequestsTest, RequestsItCannotAnswerAreRefused) {
   }
 }
 
-// A plug-in is named when its daemon's pid file names a live process.
-TEST_F(PluginRequestsTest, OnlyRunningPluginsAreNamed) {
-  WriteFile(dir_.File("alive.pid"), std::to_string(getpid()));
-  WriteFile(dir_.File("dead.pid"), "999999999");
-  config_.plugins = {{"photo_thumbnail", dir_.File("alive.pid")},
-                     {"web_video", dir_.File("dead.pid")},
-                     {"other", dir_.File("missing.pid")}};
-  Json::Value reply = Ask(Request("GET_ALL_PLUGIN_NAME"));
-  EXPECT_TRUE(reply["success"].asBool());
-  Json::Value expected(Json::arrayValue);
-  expected.append("photo_thumbnail");
-  EXPECT_EQ(reply["plugin_names"], expected);
-}
-
 // "result" follows the codecs the media parser reports; a converted copy
 // under any of the twenty converted-video names, or a file that is not a
 // video, settles it without asking.
@@ -291,35 +278,13 @@ TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
             std::chrono::seconds(3));
 }
 
-// The record lands beside the converted copy, complete and clean, and
-// nothing else does.
-TEST_F(PluginRequestsTest, ConvertRecordIsWrittenBesideTheConvertedCopy) {
-  std::string video =
-      File("v", "a.mkv", {{"QUVAPHOTO:FILM_H.mp4", "converted video"}});
-  std::string copy = dir_.File("v/.quvameta/a.mkv/QUVAPHOTO:FILM_H.mp4");
-  Json::Value package(Json::objectValue);
-  package["job"] = 7;
-  Json::Value reply = Add(video, copy, package);
-  ASSERT_TRUE(reply["success"].asBool()) << reply;
-  EXPECT_EQ(reply["record"], copy + ".json");
-  Json::Value record;
-  ASSERT_TRUE(Json::Reader().parse(ReadFile(copy + ".json"), record));
-  EXPECT_EQ(record["conversion_type"], "CONVERTA_HIGH");
-  EXPECT_EQ(record["src"]["szPath"], video);
-  EXPECT_EQ(record["src"]["szTitle"], "");
-  EXPECT_EQ(record["src"].size(), 47u);
-  EXPECT_EQ(record["convert"]["resolutionX"], 1280);
-  EXPECT_EQ(record["package"], package);
-  EXPECT_EQ(quvaidx::daemon_test::NamesUnder(dir_.File("v/.quvameta/a.mkv")),
-            (std::vector<std::string>{"QUVAPHOTO:FILM_H.mp4",
-                                      "QUVAPHOTO:FILM_H.mp4.json"}));
-}
-
-// A record may only go beside a real converted copy of a real video: no
-// file is ever written where a request points elsewhere.
-TEST_F(PluginRequestsTest, ConvertRecordsOutsideAVideosEADirectoryAreRefused) {
-  std::string video =
-      File("v", "a.mkv", {{"QUVAPHOTO_FILM_L.mp4", "converted video"}});
+// The record lands beside the converted copy, complete and clean. A record
+// may only go beside a real converted copy of a real video: no file is ever
+// written where a request points elsewhere.
+TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
+  std::string video = File("v", "a.mkv",
+                           {{"QUVAPHOTO:FILM_H.mp4", "converted video"},
+                            {"QUVAPHOTO_FILM_L.mp4", "converted video"}});
   std::string photo = File("v", "p.jpg", {{"QUVAPHOTO_FILM_L.mp4", "x y"}});
   std::string ea = dir_.File("v/.quvameta/a.mkv/");
   struct Case {
@@ -329,7 +294,7 @@ TEST_F(PluginRequestsTest, ConvertRecordsOutsideAVideosEADirectoryAreRefused) {
   } cases[] = {
       {"copy elsewhere", video, dir_.File("v/QUVAPHOTO_FILM_L.mp4")},
       {"copy not named as one", video, ea + "other.mp4"},
-      {"copy missing", video, ea + "QUVAPHOTO_FILM_H.mp4"},
+      {"copy missing", video, ea + "QUVAPHOTO_FILM_M.mp4"},
       {"copy under a path trick", video, ea + "../a.mkv/QUVAPHOTO_FILM_L.mp4"},
       {"source not a video", photo,
        dir_.File("v/.quvameta/p.jpg/QUVAPHOTO_FILM_L.mp4")},
@@ -343,6 +308,25 @@ TEST_F(PluginRequestsTest, ConvertRecordsOutsideAVideosEADirectoryAreRefused) {
   Json::Value bare = Request("INDEX_CONVERT_ADD");
   bare["src"] = "not a record";
   EXPECT_FALSE(Ask(bare)["success"].asBool());
+
+  const std::string copy = ea + "QUVAPHOTO:FILM_H.mp4";
+  Json::Value package(Json::objectValue);
+  package["job"] = 7;
+  Json::Value reply = Add(video, copy, package);
+  ASSERT_TRUE(reply["success"].asBool()) << reply;
+  EXPECT_EQ(reply["record"], copy + ".json");
+  Json::Value record;
+  ASSERT_TRUE(Json::Reader().parse(ReadFile(copy + ".json"), record));
+  EXPECT_EQ(record["conversion_type"], "CONVERTA_HIGH");
+  EXPECT_EQ(record["src"]["szPath"], video);
+  EXPECT_EQ(record["src"]["szTitle"], "");
+  EXPECT_EQ(record["src"].size(), 47u);
+  EXPECT_EQ(record["convert"]["resolutionX"], 1280);
+  EXPECT_EQ(record["package"], package);
+  EXPECT_EQ(NamesUnder(ea),
+            (std::vector<std::string>{"QUVAPHOTO:FILM_H.mp4",
+                                      "QUVAPHOTO:FILM_H.mp4.json",
+                                      "QUVAPHOTO_FILM_L.mp4"}));
 }
 
 }  // namespace

@@ -198,14 +198,18 @@ TEST(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   for (const std::string& file : {photo, video}) WriteFile(file, "media");
   const quvaidx::IndexSockets previous =
       quvaidx::SetIndexSockets({media.c_str(), socket.c_str()});
+  // Plug-ins are named only while their pid file names a live process:
+  // not when it is missing (web_video) or names a dead one.
   WriteFile(dir.File("quvamkthumbd.pid"), std::to_string(getpid()));
+  WriteFile(dir.File("dead.pid"), "999999999");
   DaemonProcess daemon;
   ASSERT_TRUE(
       daemon.Start(PLUGIND_PATH,
                    {"--foreground", "--socket", socket, "--pidfile", pid_file,
                     "--media-parser", media, "--plugin",
                     "photo_thumbnail=" + dir.File("quvamkthumbd.pid"),
-                    "--plugin", "web_video=" + dir.File("quvamkflvd.pid")},
+                    "--plugin", "web_video=" + dir.File("quvamkflvd.pid"),
+                    "--plugin", "other=" + dir.File("dead.pid")},
                    dir.path(), "plugind", "listening"))
       << daemon.Errors();
 

@@ -70,6 +70,8 @@ TEST_F(BoundedReaderTest, PiecesAcrossBlocksReadWhatTheFileHolds) {
   EXPECT_EQ(Read(&reader, -1, 10), "");
 }
 
+// A file cut while it is read reads short, and what it grows by after the
+// open is not read: the size is the one checked.
 TEST_F(BoundedReaderTest, FileThatShrinksReadsShortAndGrowthIsNotSeen) {
   BoundedReader reader(file_.fd(), file_.status().st_size, ReadLimits());
   ASSERT_EQ(truncate(path_.c_str(), 100 * 1024), 0);

@@ -85,6 +85,8 @@ class RecordFillTest : public ::testing::Test {
   FileFacts file_;
 };
 
+// A container is media when it has an audio or video stream, not a cover;
+// the image formats all go by one container name.
 TEST_F(RecordFillTest, KindAndContainerNameComeFromTheStreams) {
   struct Case {
     const char* format;
@@ -115,8 +117,12 @@ TEST_F(RecordFillTest, KindAndContainerNameComeFromTheStreams) {
   }
 }
 
-TEST_F(RecordFillTest, OutOfRangeNumbersAreBoundedToTheirFields) {
-  ContainerFacts container = Container("mov,mp4,m4a,3gp,3g2,mj2", "av");
+// Numbers beyond their field are bounded to it, and names that are not
+// UTF-8 are left out: a record never holds a wrapped number or bad text.
+TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
+  ContainerFacts container = Container("mp\xFF", "av");
+  container.streams[1].codec = "";
+  file_.fs_uuid = "1234-\xC0\x80";
   container.duration = 1e300;
   container.bit_rate = int64_t{1} << 40;
   StreamFacts& audio = container.streams[0];
@@ -145,22 +151,15 @@ TEST_F(RecordFillTest, OutOfRangeNumbersAreBoundedToTheirFields) {
   EXPECT_EQ(r.frame_rate_num, 0);
   EXPECT_EQ(r.frame_rate_den, 0);
   EXPECT_EQ(r.fileSize, 5ull << 32);
+  EXPECT_STREQ(r.szContainerType, "");
+  EXPECT_STREQ(r.szVideoCodec, "");
+  EXPECT_STREQ(r.szFsUUID, "");
+  container.streams[0].codec = "fl\xE9";
+  EXPECT_STREQ(Fill(kVideo, container).szAudioCodec, "");
   for (double duration : {static_cast<double>(NAN), -3.0}) {
     container.duration = duration;
     EXPECT_EQ(Fill(kVideo, container).duration, 0.0f) << duration;
   }
-}
-
-TEST_F(RecordFillTest, NamesThatAreNotUTF8AreLeftOut) {
-  ContainerFacts container = Container("mp\xFF", "av");
-  container.streams[0].codec = "fl\xE9";
-  container.streams[1].codec = "";
-  file_.fs_uuid = "1234-\xC0\x80";
-  __tag_QUVA_MEDIA_INFO r = Fill(kVideo, container);
-  EXPECT_STREQ(r.szContainerType, "");
-  EXPECT_STREQ(r.szAudioCodec, "");
-  EXPECT_STREQ(r.szVideoCodec, "");
-  EXPECT_STREQ(r.szFsUUID, "");
 }
 
 // A song's only stream is what the container's rate measures; covers are
@@ -186,6 +185,7 @@ TEST_F(RecordFillTest, SongTakesTheContainerRateAndCountsItsCovers) {
   EXPECT_STREQ(r.szContainerType, "mp3");
 }
 
+// AAC is named by its object type; any other type is "aac_invalid".
 TEST_F(RecordFillTest, AacIsNamedByItsObjectType) {
   struct Case {
     int64_t type;
@@ -243,6 +243,7 @@ TEST_F(RecordFillTest, LongTextsAreCutAtACharacterBoundary) {
   EXPECT_EQ(strlen(Fill(photo).szModel), 98u);
 }
 
+// Tag bytes of no declared encoding are decoded in the host's code page.
 TEST_F(RecordFillTest, RawTagBytesAreReadInTheHostCodePage) {
   const std::string cp1251_hello = "\xCF\xF0\xE8\xE2\xE5\xF2";  // Привет
   const std::string gbk_hello = "\xC4\xE3\xBA\xC3";             // 你好
@@ -285,6 +286,7 @@ TEST_F(RecordFillTest, LongLegacyTextIsCutBetweenDoubleByteCharacters) {
   EXPECT_TRUE(IsValidUTF8(comment));
 }
 
+// The first tag of a key counts; numbers are their leading digits, bounded.
 TEST_F(RecordFillTest, ContainerTagsGiveTextsAndLeadingNumbers) {
   ContainerFacts container;
   container.tags = {{"title", "Clip"},
@@ -309,6 +311,7 @@ TEST_F(RecordFillTest, ContainerTagsGiveTextsAndLeadingNumbers) {
   EXPECT_EQ(r.disc, 0);
 }
 
+// Exposure and aperture as photographers write them; nonsense gives none.
 TEST_F(RecordFillTest, ExposureAndApertureReadAsPhotographersWriteThem) {
   struct Case {
     int64_t exposure_num, exposure_den;
@@ -335,6 +338,7 @@ TEST_F(RecordFillTest, ExposureAndApertureReadAsPhotographersWriteThem) {
   }
 }
 
+// Only a whole EXIF date and time is a taken time; blank dates are none.
 TEST_F(RecordFillTest, TakenTimeKeepsOnlyRealDates) {
   struct Case {
     const char* exif;
@@ -354,6 +358,8 @@ TEST_F(RecordFillTest, TakenTimeKeepsOnlyRealDates) {
   }
 }
 
+// Camera names lose their padding and are read in the host's code page;
+// negative sizes and ISO are none.
 TEST_F(RecordFillTest, CameraNamesAreCleanUTF8WithoutPadding) {
   HostCodePage host("windows-1251");
   PhotoFacts photo;
@@ -370,6 +376,8 @@ TEST_F(RecordFillTest, CameraNamesAreCleanUTF8WithoutPadding) {
   EXPECT_EQ(r.iso, 0);
 }
 
+// A photo without a size of its own takes its picture stream's; a photo
+// has no duration and no video codec.
 TEST_F(RecordFillTest, PhotoWithoutSizeTakesItsPictureStream) {
   ContainerFacts container = Container("qoi_pipe", "v");
   container.streams[0].width = 3;
@@ -383,26 +391,25 @@ TEST_F(RecordFillTest, PhotoWithoutSizeTakesItsPictureStream) {
   EXPECT_STREQ(r.szContainerType, "image2");
 }
 
-TEST_F(RecordFillTest, RotationIsTheClockwiseQuarterTurnOfTheMatrix) {
-  struct Case {
+// The rotation is the clockwise quarter turn nearest the display matrix's
+// turn, the pixel aspect reduced; both are neutral when unknown.
+TEST_F(RecordFillTest, VideoMetadataIsAQuarterTurnAndAReducedAspect) {
+  struct Turn {
     bool has;
     double counterclockwise;
     int32_t rotation;
-  } cases[] = {
+  } turns[] = {
       {true, -90, 90}, {true, 90, 270},     {true, 180, 180}, {true, -180, 180},
       {true, 0, 0},    {true, -89.6, 90},   {true, 359, 0},   {true, -450, 90},
       {true, NAN, 0},  {true, INFINITY, 0}, {false, -90, 0},
   };
-  for (const Case& c : cases) {
+  for (const Turn& c : turns) {
     ContainerFacts container = Container("", "av");
     container.streams[1].has_rotation = c.has;
     container.streams[1].rotation = c.counterclockwise;
     EXPECT_EQ(VideoMetadataOf(container).rotation, c.rotation)
         << c.counterclockwise;
   }
-}
-
-TEST_F(RecordFillTest, PixelAspectRatioIsReducedAndOneToOneWhenUnknown) {
   struct Case {
     int64_t num, den;
     int32_t width, height;

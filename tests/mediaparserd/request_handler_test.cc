@@ -41,6 +41,8 @@ Json::Value Parse(const char* text) {
   return value;
 }
 
+// A request without a known command and an absolute path is refused with
+// the reason, and the request itself is left as it came.
 TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
   struct Case {
     const char* request;
@@ -83,6 +85,7 @@ TEST_F(RequestHandlerTest, MediaInfoCarriesTheWholeRecordAndItsKind) {
   EXPECT_TRUE(IsValidUTF8(Json::FastWriter().write(reply)));
 }
 
+// The rotation and pixel aspect under their reply keys, for videos only.
 TEST_F(RequestHandlerTest, VideoMetadataIsAnsweredForVideosOnly) {
   Json::Value reply = Ask("GET_VIDEO_METADATA", Fixture("video_rot90.mp4"));
   EXPECT_EQ(
