@@ -20,8 +20,11 @@
 
 #include "quvahost/quvahost.h"
 #include "quvaidx/log.h"
+#include "util/file_io.h"
 
 namespace {
+
+using quvaidx::SameFile;
 
 constexpr char kModule[] = "quvaidx_daemon";
 constexpr mode_t kPidFileMode = 0644;
@@ -49,10 +52,6 @@ bool AnotherInstanceAlive(const char* pid_file) {
   if (QLIBCProcAliveByPidFile(pid_file) == 0) return false;
   PrintAlive();
   return true;
-}
-
-bool SameFile(const struct stat& a, const struct stat& b) {
-  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
 // Opens pid_file for writing, created with kPidFileMode if missing, and

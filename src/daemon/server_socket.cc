@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include "quvaidx/log.h"
+#include "util/file_io.h"
 
 namespace quvaidx {
 namespace {
@@ -28,10 +29,6 @@ Listener ProbeListener(const struct sockaddr_un& address) {
   if (result == 0 || err == EAGAIN) return Listener::kAlive;
   if (err == ECONNREFUSED) return Listener::kGone;
   return Listener::kUnknown;
-}
-
-bool SameFile(const struct stat& a, const struct stat& b) {
-  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
 int RefuseToRemove(const char* path) {

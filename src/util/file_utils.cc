@@ -13,8 +13,26 @@
 
 #include "quvaidx/log.h"
 #include "quvaidx/system.h"
+#include "util/file_io.h"
 #include "util/hooks.h"
 #include "util/log_internal.h"
+
+namespace quvaidx {
+
+bool WriteAll(int fd, const char* buf, size_t n) {
+  while (n > 0) {
+    ssize_t done = write(fd, buf, n);
+    if (done < 0) {
+      if (errno == EINTR) continue;  // Retry
+      return false;
+    }
+    buf += done;
+    n -= static_cast<size_t>(done);
+  }
+  return true;
+}
+
+}  // namespace quvaidx
 
 namespace {
 
@@ -44,20 +62,6 @@ int RenameNoReplace(const char* source, const char* destination) {
   return rename(source, destination) == 0 ? 0 : -1;
 }
 
-// Writes all of buf to fd. Returns false on error.
-bool WriteAll(int fd, const char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t done = write(fd, buf, n);
-    if (done < 0) {
-      if (errno == EINTR) continue;  // Retry
-      return false;
-    }
-    buf += done;
-    n -= static_cast<size_t>(done);
-  }
-  return true;
-}
-
 // Copies everything of `in` after its first `n` lines to `out`. Returns
 // false when reading or writing failed.
 bool CopyAfterLines(int in, int out, int n) {
@@ -82,7 +86,8 @@ bool CopyAfterLines(int in, int out, int n) {
         ++skipped;
       }
     }
-    if (!WriteAll(out, start, static_cast<size_t>(end - start))) return false;
+    if (!quvaidx::WriteAll(out, start, static_cast<size_t>(end - start)))
+      return false;
   }
 }
 

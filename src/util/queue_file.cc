@@ -7,14 +7,15 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "util/file_io.h"
+
 namespace quvaidx {
 
 bool StillTheQueue(int fd, const char* path) {
   struct stat open_file;
   struct stat at_path;
   return fstat(fd, &open_file) == 0 && stat(path, &at_path) == 0 &&
-         open_file.st_dev == at_path.st_dev &&
-         open_file.st_ino == at_path.st_ino;
+         SameFile(open_file, at_path);
 }
 
 int OpenLockedQueue(const char* path, int flags, mode_t mode) {

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "quvaidx/system.h"
+#include "util/file_io.h"
 #include "util/log_internal.h"
 #include "util/queue_file.h"
 
@@ -98,19 +99,6 @@ bool IsQueueableEntry(const std::string& entry) {
          entry.find('\0') == std::string::npos;
 }
 
-bool WriteAll(int fd, const std::string& text) {
-  size_t done = 0;
-  while (done < text.size()) {
-    ssize_t wrote = write(fd, text.data() + done, text.size() - done);
-    if (wrote < 0) {
-      if (errno == EINTR) continue;  // Retry
-      return false;
-    }
-    done += static_cast<size_t>(wrote);
-  }
-  return true;
-}
-
 void LogFailure(const char* function, int line, const char* what,
                 const char* queue, int err) {
   quvaidx::LogDirect(LOG_ERR, "%s: %s(%d) - failed to %s %s, reason=%s",
@@ -122,7 +110,9 @@ void LogFailure(const char* function, int line, const char* what,
 // is cut off again, as WriteIndexQueue does. Returns 0 or an errno value.
 int AppendLines(int fd, const std::string& lines) {
   off_t before = lseek(fd, 0, SEEK_END);
-  if (WriteAll(fd, lines) && fdatasync(fd) == 0) return 0;
+  if (quvaidx::WriteAll(fd, lines.data(), lines.size()) && fdatasync(fd) == 0) {
+    return 0;
+  }
   int err = errno != 0 ? errno : EIO;
   if (before >= 0 && ftruncate(fd, before) != 0) {
     // nothing more can be done; the failure is reported by the caller
