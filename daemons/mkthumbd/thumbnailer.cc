@@ -16,6 +16,7 @@
 #include <quvaidx/ea_file.h>
 #include <vips/vips.h>
 
+#include "atomic_file.h"
 #include "preview_names.h"
 
 namespace mkthumbd {
@@ -86,36 +87,6 @@ void RemoveLeftoverParts(const char* ea_dir) {
   for (const std::string& name : parts) {
     unlinkat(AT_FDCWD, (std::string(ea_dir) + "/" + name).c_str(), 0);
   }
-}
-
-// Writes `data` to `path` through a temporary file beside it, renamed over
-// it. Returns "" or what failed.
-std::string WriteAtomically(const std::string& path, const void* data,
-                            size_t length) {
-  std::string temp = path + kPartMarker + "XXXXXX";
-  int fd = mkostemp(&temp[0], O_CLOEXEC);
-  if (fd < 0) return std::string("cannot create a file: ") + strerror(errno);
-  const char* bytes = static_cast<const char*>(data);
-  size_t done = 0;
-  int err = 0;
-  while (done < length) {
-    ssize_t wrote = write(fd, bytes + done, length - done);
-    if (wrote < 0) {
-      if (errno == EINTR) continue;  // Retry
-      err = errno;
-      break;
-    }
-    done += static_cast<size_t>(wrote);
-  }
-  // mkstemp makes the file private; a thumbnail is as readable as any file.
-  if (err == 0 && fchmod(fd, g_file_mode) != 0) err = errno;
-  if (close(fd) != 0 && err == 0) err = errno;
-  if (err == 0 && rename(temp.c_str(), path.c_str()) != 0) err = errno;
-  if (err != 0) {
-    unlink(temp.c_str());
-    return std::string("cannot write ") + path + ": " + strerror(err);
-  }
-  return "";
 }
 
 // The JPEG shrink-on-load factor for a photo of long side `long_side` whose
@@ -254,7 +225,8 @@ std::string SaveJpeg(VipsImage* image, const std::string& path) {
                            TRUE, "interlace", FALSE, nullptr) != 0) {
     return "cannot encode a thumbnail: " + VipsError();
   }
-  std::string problem = WriteAtomically(path, buffer, length);
+  std::string problem = quvaidx_daemons::WriteAtomically(
+      path, kPartMarker, buffer, length, g_file_mode, false, path);
   g_free(buffer);
   return problem;
 }

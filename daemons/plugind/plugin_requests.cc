@@ -30,6 +30,7 @@
 #include <quvaidx/path_rules.h>
 #include <quvaidx/system.h>
 
+#include "atomic_file.h"
 #include "preview_names.h"
 
 namespace plugind {
@@ -282,33 +283,6 @@ int VideoNeedConvert(const PluginConfig& config, const Json::Value& request,
 // ---------------------------------------------------------------------------
 // 5. Converted copies' records
 
-// Writes `text` to `path` through a synced temporary file beside it renamed
-// over it. "" or what failed.
-std::string WriteAtomically(const std::string& path, const std::string& text) {
-  std::string temp = path + ".XXXXXX";
-  int fd = mkostemp(&temp[0], O_CLOEXEC);
-  if (fd < 0) return std::string("cannot create a file: ") + strerror(errno);
-  size_t done = 0;
-  int err = 0;
-  while (done < text.size() && err == 0) {
-    ssize_t wrote = write(fd, text.data() + done, text.size() - done);
-    if (wrote < 0) {
-      if (errno != EINTR) err = errno;  // else Retry
-    } else {
-      done += static_cast<size_t>(wrote);
-    }
-  }
-  if (err == 0 && fchmod(fd, 0644) != 0) err = errno;
-  if (err == 0 && fsync(fd) != 0) err = errno;
-  if (close(fd) != 0 && err == 0) err = errno;
-  if (err == 0 && rename(temp.c_str(), path.c_str()) != 0) err = errno;
-  if (err != 0) {
-    unlink(temp.c_str());
-    return std::string("cannot write the record: ") + strerror(err);
-  }
-  return "";
-}
-
 // The media record `value` as MediaInfoJson2Object reads it, in its JSON
 // form: every field present, of its type and within its size.
 Json::Value CleanRecord(const Json::Value& value, __tag_QUVA_MEDIA_INFO* out) {
@@ -352,7 +326,9 @@ int ConvertAdd(const Json::Value& request, Json::Value* reply) {
   record["conversion_type"] = type;
   if (request.isMember("package")) record["package"] = request["package"];
   const std::string path = std::string(item) + ".json";
-  std::string problem = WriteAtomically(path, record.toStyledString());
+  const std::string text = record.toStyledString();
+  std::string problem = quvaidx_daemons::WriteAtomically(
+      path, ".", text.data(), text.size(), 0644, true, "the record");
   if (!problem.empty()) return Fail(reply, problem);
   *reply = MakeResponse(true, nullptr);
   (*reply)["record"] = path;
