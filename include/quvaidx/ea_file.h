@@ -20,6 +20,12 @@
 // name "quvaidx_eafile"; each function lists its lines. No state is kept
 // between calls: every function may run in several threads at once.
 //
+// OpenEADir is an addition beside the specified functions: it hands out a
+// descriptor of the EA directory, reached without following links, so that
+// a caller (a root daemon working for a folder's owner) can create and
+// read items relative to it with openat and never through a link planted
+// in the folder.
+//
 // These names are exported without parameter types (C linkage).
 #ifndef QUVAIDX_EA_FILE_H_
 #define QUVAIDX_EA_FILE_H_
@@ -31,6 +37,28 @@
 #ifdef __cplusplus
 extern "C" {
 #endif
+
+// Opens the EA directory of `file_path` without following a symbolic link
+// at the metadata directory or below it. The walk starts at `folder_fd`, an
+// open descriptor of the file's own folder, or, when it is -1, at that
+// folder opened by its path (links in the folder's own path are the
+// caller's business). The metadata directory and the EA directory are each
+// opened with openat(O_NOFOLLOW|O_DIRECTORY). With `create` non-zero, each
+// that is missing is made (mode 0777 less the umask), and a regular file in
+// the way is replaced as MakeEADir does. A symbolic link (or anything but a
+// directory or regular file) in the way is refused and logged ("Refused
+// symbolic link at <path> ..." / "Refused <path>: neither a directory nor a
+// regular file ..."), never removed and never followed. `folder_fd` stays
+// the caller's.
+// Returns a descriptor of the EA directory (O_RDONLY|O_DIRECTORY|
+// O_CLOEXEC) that the caller closes; -1 with errno: ENOENT (missing and not
+// `create`), ELOOP (a link in the way), ENOTDIR (a regular file in the way
+// and not `create`, or a special file), EACCES, EINVAL (bad arguments, the
+// host cannot give the path, logged as the QUVAEADirPath error line below,
+// or the host places the EA directory outside the file's folder, logged),
+// EAGAIN (the entry kept changing under the walk), or another errno of
+// open or mkdir.
+QUVAIDX_API int OpenEADir(const char* file_path, int folder_fd, int create);
 
 // Makes sure that the EA directory of `file_path` and the metadata
 // directory above it exist, and stores the EA directory path in

@@ -3,15 +3,21 @@
 #include "quvaidx/ea_file.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <functional>
+#include <set>
 #include <string>
 
 #include <gtest/gtest.h>
+
+#include "host_ops.h"
 
 #include "quvaidx/path_rules.h"
 #include "support/fake_host.h"
@@ -23,12 +29,29 @@ namespace {
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
 bool IsLink(const std::string& path) {
   struct stat st;
   return lstat(path.c_str(), &st) == 0 && S_ISLNK(st.st_mode);
+}
+
+// The kind of entry at `path` (S_IFMT bits of lstat), 0 when there is none.
+mode_t KindAt(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 ? st.st_mode & S_IFMT : 0;
+}
+
+// Names in directory `dir`.
+std::set<std::string> Entries(const std::string& dir) {
+  std::set<std::string> names;
+  std::error_code ignored;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ignored)) {
+    names.insert(entry.path().filename());
+  }
+  return names;
 }
 
 // Bad parameters never reach the host; a host failure is logged with the
@@ -196,3 +219,184 @@ TEST_F(RealTree, OverlongItemPathNeverTouchesTheFileItsCutNames) {
 }
 
 }  // namespace
+
+// What a user may plant in a photo folder, where the metadata directory
+// (.quvameta) or the EA directory (.quvameta/a.jpg) should be. `outside` is
+// a directory the walk must never reach: it holds a file "victim".
+struct Planted {
+  const char* what;
+  std::function<void(const std::string& hidden, const std::string& ea,
+                     const std::string& outside)>
+      plant;
+  int error_open;    // errno without create, 0: opened
+  int error_create;  // errno with create, 0: opened
+  bool refused;      // a refusal is logged
+};
+
+const Planted kPlanted[] = {
+    {"nothing", [](auto&, auto&, auto&) {}, ENOENT, 0, false},
+    {"both directories",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       mkdir(ea.c_str(), 0755);
+     },
+     0, 0, false},
+    {"metadata dir links to a directory elsewhere",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink(outside.c_str(), hidden.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"EA dir links to a directory elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink(outside.c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"EA dir links to a file elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink((outside + "/victim").c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"dangling link at the metadata dir",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink((outside + "/new").c_str(), hidden.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"dangling link at the EA dir",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink((outside + "/new").c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"FIFO at the metadata dir",
+     [](auto& hidden, auto&, auto&) { mkfifo(hidden.c_str(), 0666); }, ENOTDIR,
+     ENOTDIR, true},
+    {"FIFO at the EA dir",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       mkfifo(ea.c_str(), 0666);
+     },
+     ENOTDIR, ENOTDIR, true},
+    {"regular file at the metadata dir",
+     [](auto& hidden, auto&, auto&) { WriteFile(hidden, "in the way"); },
+     ENOTDIR, 0, false},
+    {"regular file at the EA dir",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       WriteFile(ea, "in the way");
+     },
+     ENOTDIR, 0, false},
+};
+
+// Every planted entry, without and with create, from the folder's path and
+// from a descriptor of the folder: a link or special file is refused,
+// logged and left in place, and nothing outside the folder changes.
+TEST(OpenEADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
+  for (const Planted& c : kPlanted) {
+    for (int create : {0, 1}) {
+      for (bool by_fd : {false, true}) {
+        SCOPED_TRACE(std::string(c.what) + (create ? ", create" : "") +
+                     (by_fd ? ", folder fd" : ""));
+        TempDir dir, outside;
+        WriteFile(outside.File("victim"), "root's");
+        const std::string hidden = dir.File(".quvameta");
+        const std::string ea = hidden + "/a.jpg";
+        c.plant(hidden, ea, outside.path());
+        const mode_t hidden_kind = KindAt(hidden), ea_kind = KindAt(ea);
+        const int folder = by_fd ? open(dir.path().c_str(), O_RDONLY) : -1;
+        quvaidx::test::FdLeakCheck leaks;
+        LogCapture log;
+        errno = 0;
+        const int fd = OpenEADir(dir.File("a.jpg").c_str(), folder, create);
+        const int error = fd < 0 ? errno : 0;
+        const int expected = create ? c.error_create : c.error_open;
+        EXPECT_EQ(expected, error) << strerror(error);
+        EXPECT_EQ(c.refused ? 1u : 0u, log.lines().size());
+        if (fd >= 0) {
+          struct stat opened, named;
+          ASSERT_EQ(0, fstat(fd, &opened));
+          ASSERT_EQ(0, lstat(ea.c_str(), &named));
+          EXPECT_TRUE(S_ISDIR(named.st_mode));
+          EXPECT_EQ(named.st_ino, opened.st_ino);
+          EXPECT_EQ(FD_CLOEXEC, fcntl(fd, F_GETFD) & FD_CLOEXEC);
+          close(fd);
+        } else if (c.refused) {
+          EXPECT_EQ(hidden_kind, KindAt(hidden)) << "removed";
+          EXPECT_EQ(ea_kind, KindAt(ea)) << "removed";
+        }
+        EXPECT_TRUE(leaks.NoLeak());
+        EXPECT_EQ(std::set<std::string>{"victim"}, Entries(outside.path()));
+        EXPECT_EQ("root's", ReadFile(outside.File("victim")));
+        if (folder >= 0) close(folder);
+      }
+    }
+  }
+}
+
+// The walk starts at the descriptor: the folder's path in file_path is not
+// opened then. Made directories take 0777 less the umask.
+TEST(OpenEADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
+  TempDir dir;
+  const int folder = open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+  ASSERT_GE(folder, 0);
+  const mode_t old_umask = umask(027);
+  const int fd = OpenEADir("/no-such-folder/a.jpg", folder, 1);
+  umask(old_umask);
+  ASSERT_GE(fd, 0) << strerror(errno);
+  close(fd);
+  close(folder);
+  for (const char* made : {".quvameta", ".quvameta/a.jpg"}) {
+    struct stat st;
+    ASSERT_EQ(0, lstat(dir.File(made).c_str(), &st));
+    EXPECT_EQ(0750u, st.st_mode & 07777) << made;
+  }
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir("/no-such-folder/a.jpg", -1, 1));
+  EXPECT_EQ(ENOENT, errno);
+}
+
+// What the host answers for every file, set per case.
+const char* g_host_answer = "";
+
+int AnswerHostPath(int, const char*, char* buffer, int size) {
+  snprintf(buffer, static_cast<size_t>(size), "%s", g_host_answer);
+  return 0;
+}
+
+TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
+  TempDir dir, outside;
+  LogCapture log;
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(nullptr, -1, 1));
+  EXPECT_EQ(EINVAL, errno);
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -2, 1));
+  EXPECT_EQ(EINVAL, errno);
+  {
+    FakeHost host;
+    host.Fail(HostOp::kEADirPath, ENAMETOOLONG);
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1));
+    EXPECT_EQ(EINVAL, errno);
+  }
+  const std::string answers[] = {
+      outside.File(".quvameta/a.jpg"),  // another folder
+      dir.File(".quvameta/sub/a.jpg"),  // deeper than two levels
+      dir.File(".quvameta"),            // one level
+      dir.File("../" + std::string(outside.path().substr(5)) + "/a.jpg"),
+  };
+  quvahost::HostOps ops{};
+  ops.EADirPath = AnswerHostPath;
+  const quvahost::HostOps previous = quvahost::SetHostOps(&ops);
+  for (const std::string& answer : answers) {
+    g_host_answer = answer.c_str();
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1)) << answer;
+    EXPECT_EQ(EINVAL, errno) << answer;
+  }
+  quvahost::SetHostOps(&previous);
+  EXPECT_TRUE(Entries(dir.path()).empty());
+  EXPECT_TRUE(Entries(outside.path()).empty());
+  EXPECT_EQ(5u, log.lines().size());  // the host failure and four answers
+}
