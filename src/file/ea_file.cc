@@ -5,10 +5,11 @@
 //
 // A user owns the folder of a media file and may plant anything in its
 // metadata directory; a root daemon that follows a link there would read,
-// write or remove another user's files. So OpenEADir opens the metadata
-// directory and the EA directory one component at a time with
-// O_NOFOLLOW|O_DIRECTORY from their parent's descriptor. A link found
-// there is refused and logged, never followed and never removed.
+// write or remove another user's files. So every function here opens the
+// metadata directory and the EA directory one component at a time with
+// O_NOFOLLOW|O_DIRECTORY from their parent's descriptor, and works on
+// items relative to the EA directory's descriptor. A link found there is
+// refused and logged, never followed and never removed.
 #include "quvaidx/ea_file.h"
 
 #include <errno.h>
@@ -25,7 +26,6 @@
 
 #include "file/file_common.h"
 #include "quvahost/quvahost.h"
-#include "quvaidx/path_rules.h"
 #include "util/log_internal.h"
 
 using quvaidx::file::ComposePath;
@@ -239,24 +239,6 @@ bool IsInsideFolder(std::string_view ea_dir, std::string_view folder) {
          IsPlainName(rest.substr(slash + 1));
 }
 
-// Makes `path` a directory unless it is one already (a link to a directory
-// counts). An entry in the way that is not a directory is unlinked first:
-// unlink(2) removes a link itself, never its target, and refuses
-// directories, so nothing but that entry can be lost. Returns 0 or an errno
-// value.
-int EnsureDirectory(const char* path) {
-  struct stat st;
-  if (stat(path, &st) == 0 && S_ISDIR(st.st_mode)) return 0;
-  if (lstat(path, &st) == 0 && !S_ISDIR(st.st_mode)) {
-    unlink(path);  // if this fails, mkdir below reports why
-  }
-  if (mkdir(path, 0777) == 0) return 0;
-  const int err = errno;
-  // Another process made it between our test and mkdir: it exists now.
-  if (err == EEXIST && stat(path, &st) == 0 && S_ISDIR(st.st_mode)) return 0;
-  return err;
-}
-
 // Asks the host for the EA directory of `file_path` into dir[size]; logs the
 // host's last error on failure.
 bool EADirOf(const char* file_path, char* dir, int size) {
@@ -268,6 +250,40 @@ bool EADirOf(const char* file_path, char* dir, int size) {
                      kModule, __LINE__, QLIBCErrGet(), QLIBCErrorGetFile(),
                      QLIBCErrorGetLine(), Printable(file_path));
   return false;
+}
+
+// What stands at `name` in the EA directory `ea_fd`, never through a link.
+enum class Item { kAbsent, kRegular, kOther };
+
+// Looks at the item `name` of the EA directory `ea_fd` (path `ea_dir`).
+// Names that do not fit a path buffer with the directory, or that hold a
+// '/', name no item. A link is logged and is not an item.
+Item LookAtItem(int ea_fd, const char* ea_dir, const char* name,
+                struct stat* st) {
+  char path[kPathBufferSize];
+  if (name == nullptr || strchr(name, '/') != nullptr ||
+      !ComposePath(path, sizeof(path), ea_dir, "/", name) ||
+      fstatat(ea_fd, name, st, AT_SYMLINK_NOFOLLOW) != 0) {
+    return Item::kAbsent;
+  }
+  if (S_ISLNK(st->st_mode)) {
+    LogRefusedLink(path);
+    return Item::kOther;
+  }
+  return S_ISREG(st->st_mode) ? Item::kRegular : Item::kOther;
+}
+
+// IsEAFileExist on an open EA directory.
+const char* FindItem(int ea_fd, const char* ea_dir, int64_t* size,
+                     const char* name1, const char* name2) {
+  for (const char* name : {name1, name2}) {
+    struct stat st;
+    if (LookAtItem(ea_fd, ea_dir, name, &st) == Item::kRegular) {
+      if (size != nullptr) *size = static_cast<int64_t>(st.st_size);
+      return name;
+    }
+  }
+  return nullptr;
 }
 
 // The found item of IsEAFileExist, if it has at least kMinUsableItemSize
@@ -315,34 +331,15 @@ int MakeEADir(const char* file_path, char* buffer, int size) {
     return -1;
   }
   if (!EADirOf(file_path, buffer, size)) return -1;
-
-  // The metadata directory: the EA directory path up to its last '/'.
-  const char* slash = strrchr(buffer, '/');
-  if (slash != nullptr) {
-    char parent[kPathBufferSize];
-    const int length = static_cast<int>(slash - buffer);
-    int err;
-    if (length >= kPathBufferSize) {
-      err = ENAMETOOLONG;
-    } else if (length == 0) {
-      err = 0;  // the root directory
-    } else {
-      memcpy(parent, buffer, length);
-      parent[length] = '\0';
-      err = EnsureDirectory(parent);
-    }
-    if (err != 0) {
-      quvaidx::LogDirect(LOG_ERR, "%s:%d Cannot mkdir %.*s, error:%d", kModule,
-                         __LINE__, length, buffer, err);
-      return -1;
-    }
-  }
-  const int err = EnsureDirectory(buffer);
-  if (err != 0) {
+  // The metadata directory is the parent of the EA directory (none when
+  // the host answers a single name).
+  Walk walk = WalkTail(buffer, 2, -1, true);
+  if (walk.fd < 0) {
     quvaidx::LogDirect(LOG_ERR, "%s:%d Cannot mkdir %s, error:%d", kModule,
-                       __LINE__, buffer, err);
+                       __LINE__, walk.failed.c_str(), walk.error);
     return -1;
   }
+  close(walk.fd);
   return 0;
 }
 
@@ -358,22 +355,30 @@ int GetEADirPath(const char* file_path, char* buffer, int size) {
     return -1;
   }
   buffer[size - 1] = '\0';
-  if (IsDirExist(buffer)) return 0;
-  if (QUVAEAMKDir(1, buffer) != 0) {
+  Walk walk = WalkTail(buffer, 2, -1, false);
+  // The host makes what is missing; a link or special file in the way is
+  // never handed to it, and what it made is checked the same way.
+  if (walk.fd < 0 && !walk.refused && QUVAEAMKDir(1, buffer) == 0) {
+    walk = WalkTail(buffer, 2, -1, false);
+  }
+  if (walk.fd < 0) {
     quvaidx::LogDirect(LOG_ERR, "%s:%d Make ea dir path error. eaDir path: %s",
                        kModule, __LINE__, buffer);
     return -1;
   }
+  close(walk.fd);
   return 0;
 }
 
 int RemoveEAFile(const char* ea_dir, const char* name1, const char* name2) {
   if (ea_dir == nullptr) return 0;
+  ScopedFd dir(WalkTail(ea_dir, 2, -1, false).fd);
+  if (dir.get() < 0) return 0;
   int removed = 0;
   for (const char* name : {name1, name2}) {
-    char path[kPathBufferSize];
-    if (name != nullptr && ComposePath(path, sizeof(path), ea_dir, "/", name) &&
-        unlink(path) == 0) {
+    struct stat st;
+    if (LookAtItem(dir.get(), ea_dir, name, &st) != Item::kAbsent &&
+        !S_ISLNK(st.st_mode) && unlinkat(dir.get(), name, 0) == 0) {
       ++removed;
     }
   }
@@ -389,14 +394,9 @@ int RemoveEAFile2(const char* file_path, const char* name1, const char* name2) {
 const char* IsEAFileExist(const char* ea_dir, int64_t* size, const char* name1,
                           const char* name2) {
   if (ea_dir == nullptr) return nullptr;
-  for (const char* name : {name1, name2}) {
-    char path[kPathBufferSize];
-    if (name != nullptr && ComposePath(path, sizeof(path), ea_dir, "/", name) &&
-        IsFileExist(path, size)) {
-      return name;
-    }
-  }
-  return nullptr;
+  ScopedFd dir(WalkTail(ea_dir, 2, -1, false).fd);
+  if (dir.get() < 0) return nullptr;
+  return FindItem(dir.get(), ea_dir, size, name1, name2);
 }
 
 int GetEAFilePath(const char* file_path, const char* name1, const char* name2,
