@@ -1,15 +1,22 @@
 // The preview daemons as real processes in a private directory:
 // quvamkthumbd on its own queue and pid file (woken by SIGUSR1, bad photos
-// skipped, stopped or killed in the middle of an entry and started again),
+// skipped, stopped or killed in the middle of an entry and started again;
+// and, run as root over folders of other users, links planted in its way,
+// photos it must not read, a photo swapped under it),
 // and quvaindexplugind on its own socket, asked with the library's typed
 // requests (pointed at it through the library's socket seam) with a
 // scripted media parser beside it.
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
+#include <stdio.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
+
+#include <chrono>
 
 #include <filesystem>
 #include <string>
@@ -31,10 +38,16 @@ namespace {
 
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
+using quvaidx::daemon_test::ColourAt;
 using quvaidx::daemon_test::DaemonProcess;
 using quvaidx::daemon_test::kBlue;
 using quvaidx::daemon_test::kRed;
+using quvaidx::daemon_test::kUserA;
+using quvaidx::daemon_test::kUserB;
+using quvaidx::daemon_test::MakeOwnedDir;
 using quvaidx::daemon_test::NamesUnder;
+using quvaidx::daemon_test::Own;
+using quvaidx::daemon_test::Rgb;
 using quvaidx::daemon_test::ThumbItem;
 using quvaidx::daemon_test::WaitUntil;
 using quvaidx::test::ReadFile;
@@ -49,7 +62,12 @@ bool Exists(const std::string& path) {
 
 class ThumbDaemonTest : public ::testing::Test {
  protected:
-  ThumbDaemonTest() { mkdir(share_.c_str(), 0755); }
+  // The share is the only one of the host stand-in's database, which the
+  // daemon reads from the test's directory (DaemonProcess).
+  ThumbDaemonTest() {
+    mkdir(share_.c_str(), 0755);
+    quvaidx::daemon_test::WriteShares(dir_.path(), {{"share", share_}});
+  }
 
   // Starts the daemon in the foreground on the private queue and pid file,
   // pausing `throttle_ms` after each photo, and waits until its loop runs.
@@ -80,6 +98,24 @@ class ThumbDaemonTest : public ::testing::Test {
     }
     return false;
   }
+  // A folder of the share owned by `uid`, and a photo in it owned by `uid`.
+  std::string UserFolder(const std::string& name, unsigned uid) {
+    EXPECT_TRUE(MakeOwnedDir(share_ + "/" + name, uid, uid));
+    return share_ + "/" + name;
+  }
+  std::string UserPhoto(const std::string& path, unsigned uid,
+                        unsigned mode = 0644, Rgb colour = kRed) {
+    EXPECT_TRUE(quvaidx::daemon_test::WritePlainPhoto(path, 900, 600, colour));
+    EXPECT_TRUE(Own(path, uid, uid, mode));
+    return path;
+  }
+  // Queues `entries`, wakes the daemon and waits until the queue is empty.
+  bool Serve(DaemonProcess& daemon, const std::vector<std::string>& entries) {
+    for (const std::string& entry : entries) {
+      if (WriteIndexQueue(entry.c_str(), queue_.c_str()) != 0) return false;
+    }
+    return daemon.Signal(SIGUSR1) && Served();
+  }
 
   TempDir dir_;
   std::string share_ = dir_.File("share");
@@ -102,7 +138,7 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon, "500")) << daemon.Errors();
   ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
-  ASSERT_EQ(WriteIndexQueue(dir_.File("deleted-while-queued").c_str(),
+  ASSERT_EQ(WriteIndexQueue((share_ + "/deleted-while-queued").c_str(),
                             queue_.c_str()),
             0);
   usleep(200 * 1000);
@@ -179,6 +215,189 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
            !daemon.Running();
   });
   EXPECT_TRUE(daemon.Running()) << daemon.Errors();
+}
+
+// Links planted by a folder's owner where the daemon writes (at the
+// metadata directory, at a photo's EA directory, at a thumbnail's name, at
+// a leftover temporary file's), to a root-only folder, to another user's
+// photos or to a folder the owner may write itself. None is followed
+// (nothing appears, changes or goes at its target) and none is removed;
+// each refusal is logged and the folder's other thumbnails are made. A
+// queued folder that is itself a link is refused.
+TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  const std::string vault = dir_.File("vault");
+  ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
+  WriteFile(vault + "/root.txt", "root's");
+  const std::string bob = UserFolder("bob", kUserB);
+  WriteFile(bob + "/IMG.jpg", "bob's");
+  const std::string spare = UserFolder("spare", kUserA);
+  struct Case {
+    const char* folder;
+    std::string link;  // in the folder
+    std::string target;
+    std::string logged;
+  } cases[] = {
+      {"m1", ".quvameta", vault, "IMG.jpg: a symbolic link is in the way"},
+      {"m2", ".quvameta", spare, "IMG.jpg: a symbolic link is in the way"},
+      {"e1", ".quvameta/IMG.jpg", bob, "IMG.jpg: a symbolic link is in the"},
+      {"e2", ".quvameta/IMG.jpg", spare, "IMG.jpg: a symbolic link is in th"},
+      {"i1", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_XL.jpg", vault + "/root.txt",
+       "cannot write QUVAPHOTO_THUMB_XL.jpg: a symbolic link is in its place"},
+      {"i2", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_B.jpg", spare + "/b.jpg",
+       "cannot write QUVAPHOTO_THUMB_B.jpg: a symbolic link is in its place"},
+      {"p1", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_S.jpg.part-AbCdEf",
+       vault + "/root.txt", "made thumbnails 0xf of " + share_ + "/p1/"},
+  };
+  std::vector<std::string> entries;
+  for (const Case& c : cases) {
+    const std::string folder = UserFolder(c.folder, kUserA);
+    UserPhoto(folder + "/IMG.jpg", kUserA);
+    // The real directories above the link, as the owner would make them.
+    for (size_t slash = c.link.find('/'); slash != std::string::npos;
+         slash = c.link.find('/', slash + 1)) {
+      ASSERT_TRUE(
+          MakeOwnedDir(folder + "/" + c.link.substr(0, slash), kUserA, kUserA));
+    }
+    ASSERT_EQ(symlink(c.target.c_str(), (folder + "/" + c.link).c_str()), 0);
+    ASSERT_TRUE(Own(folder + "/" + c.link, kUserA, kUserA, 0));
+    entries.push_back(folder);
+  }
+  ASSERT_EQ(symlink((share_ + "/m1").c_str(), (share_ + "/linked").c_str()), 0);
+  entries.push_back(share_ + "/linked");
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
+  ASSERT_TRUE(Serve(daemon, entries)) << daemon.Errors();
+  const std::string log = daemon.Errors();
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.folder);
+    char target[4096] = {};
+    const std::string link = share_ + "/" + c.folder + "/" + c.link;
+    EXPECT_GT(readlink(link.c_str(), target, sizeof(target) - 1), 0);
+    EXPECT_EQ(c.target, target);
+    EXPECT_NE(log.find(c.logged), std::string::npos) << log;
+  }
+  EXPECT_NE(log.find("'" + share_ + "/linked': a symbolic link"),
+            std::string::npos)
+      << log;
+  EXPECT_EQ(NamesUnder(vault), std::vector<std::string>{"root.txt"});
+  EXPECT_EQ(ReadFile(vault + "/root.txt"), "root's");
+  EXPECT_EQ(NamesUnder(bob), std::vector<std::string>{"IMG.jpg"});
+  EXPECT_EQ(ReadFile(bob + "/IMG.jpg"), "bob's");
+  EXPECT_TRUE(NamesUnder(spare).empty());
+  EXPECT_TRUE(Exists(ThumbItem(share_ + "/i1/IMG.jpg", "S")));
+}
+
+// The daemon reads a folder's photos as the folder's owner: a root-only
+// photo among them gets no thumbnails (the refusal logged), while the
+// owner's own photo gets thumbnails that are the owner's, as private as
+// the photo.
+TEST_F(ThumbDaemonTest, PhotosTheOwnerMayNotReadGetNoThumbnails) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  const std::string folder = UserFolder("u", kUserA);
+  const std::string secret = UserPhoto(folder + "/secret.jpg", 0, 0600);
+  const std::string own = UserPhoto(folder + "/own.jpg", kUserA, 0600);
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
+  ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
+  EXPECT_TRUE(NamesUnder(folder + "/.quvameta/secret.jpg").empty());
+  EXPECT_NE(daemon.Errors().find("skipped " + secret +
+                                 ": cannot open it: Permission denied"),
+            std::string::npos)
+      << daemon.Errors();
+  struct stat st;
+  ASSERT_EQ(stat(ThumbItem(own, "XL").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, kUserA);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+}
+
+// While the daemon works on a folder over and over, the folder's owner
+// swaps a photo's name with a link to a root-only photo, and another's with
+// a 196-megapixel photo, by rename-exchange (at most 20 million times or 15 s).
+// No thumbnail ever shows either: each photo is opened once, without
+// following a link, as the folder's owner, and its limits are checked on
+// the very bytes that are decoded.
+TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  constexpr Rgb kGreen = {20, 230, 20};
+  const std::string vault = dir_.File("vault");
+  ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
+  UserPhoto(vault + "/secret.jpg", 0, 0600, kBlue);
+  const std::string folder = UserFolder("race", kUserA);
+  UserPhoto(folder + "/p.jpg", kUserA);
+  UserPhoto(folder + "/r.jpg", kUserA);
+  ASSERT_EQ(
+      symlink((vault + "/secret.jpg").c_str(), (folder + "/q.jpg").c_str()), 0);
+  ASSERT_TRUE(Own(folder + "/q.jpg", kUserA, kUserA, 0));
+  ASSERT_TRUE(quvaidx::daemon_test::WritePlainPhoto(folder + "/big.jpg", 14000,
+                                                    14000, kGreen));
+  ASSERT_TRUE(Own(folder + "/big.jpg", kUserA, kUserA, 0644));
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
+
+  // The swapper works from a descriptor: the test's directory above is
+  // root's alone.
+  const int at = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(at, 0);
+  const pid_t swapper = fork();
+  ASSERT_GE(swapper, 0);
+  if (swapper == 0) {
+    if (setgroups(0, nullptr) != 0 || setresgid(kUserA, kUserA, kUserA) != 0 ||
+        setresuid(kUserA, kUserA, kUserA) != 0) {
+      _exit(1);
+    }
+    const auto end =
+        std::chrono::steady_clock::now() + std::chrono::seconds(15);
+    long swaps = 0;
+    for (long i = 0; i < 20000000 && std::chrono::steady_clock::now() < end;
+         ++i) {
+      swaps += renameat2(at, "p.jpg", at, "q.jpg", RENAME_EXCHANGE) == 0;
+      swaps += renameat2(at, "r.jpg", at, "big.jpg", RENAME_EXCHANGE) == 0;
+    }
+    _exit(swaps > 0 ? 0 : 1);
+  }
+  close(at);
+  int made = 0;
+  int leaked = 0;
+  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(14);
+  for (int round = 0; round < 30 && std::chrono::steady_clock::now() < end;
+       ++round) {
+    std::filesystem::remove_all(folder + "/.quvameta");
+    ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
+    for (const char* name : {"p.jpg", "q.jpg", "r.jpg", "big.jpg"}) {
+      const std::string thumb = ThumbItem(folder + "/" + name, "M");
+      if (!Exists(thumb)) continue;
+      ++made;
+      leaked += !quvaidx::daemon_test::Near(ColourAt(thumb, 0.5, 0.5), kRed);
+    }
+  }
+  int status = 0;
+  EXPECT_EQ(waitpid(swapper, &status, 0), swapper);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);  // it swapped
+  EXPECT_GT(made, 0) << daemon.Errors();
+  EXPECT_EQ(leaked, 0) << daemon.Errors();
+}
+
+// A FIFO put in a photo's place after the folder was listed is not waited
+// on: the photo is skipped, and SIGTERM still ends the daemon at once.
+TEST_F(ThumbDaemonTest, FifoSwappedInNeitherBlocksNorOutlivesSigterm) {
+  Photo("1.jpg");
+  const std::string second = Photo("2.jpg");
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon, "1000")) << daemon.Errors();
+  ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
+  ASSERT_TRUE(daemon.Signal(SIGUSR1));
+  ASSERT_TRUE(WaitUntil(20, [&] {
+    return daemon.Errors().find("of " + share_ + "/1.jpg") != std::string::npos;
+  }));
+  ASSERT_EQ(unlink(second.c_str()), 0);
+  ASSERT_EQ(mkfifo(second.c_str(), 0666), 0);
+  EXPECT_TRUE(WaitUntil(10, [&] {
+    return daemon.Errors().find("skipped " + second + ": not a regular file") !=
+           std::string::npos;
+  })) << daemon.Errors();
+  ASSERT_TRUE(daemon.Signal(SIGTERM));
+  EXPECT_TRUE(daemon.WaitExit(5));
 }
 
 // The plug-in daemon answers what the library's typed requests send, and
