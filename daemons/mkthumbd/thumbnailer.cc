@@ -243,6 +243,7 @@ DecodeFacts FactsOf(Format format, VipsImage* header,
   facts.height = header->Ysize;
   facts.bands = header->Bands;
   facts.sample_bytes = static_cast<int>(vips_format_sizeof(header->BandFmt));
+  facts.alpha = vips_image_hasalpha(header) != 0;
   facts.file_bytes = static_cast<long long>(bytes.size());
   if (format == Format::kJpeg) {
     facts.progressive = IntField(header, "jpeg-multiscan", 0) != 0;
@@ -269,14 +270,17 @@ DecodeFacts FactsOf(Format format, VipsImage* header,
 
 long long DecodePeakBytes(const DecodeFacts& facts) {
   // The factors were measured (peak resident memory of one photo's
-  // thumbnails, 9 to 36 megapixels, each format) and rounded up.
+  // thumbnails, 9 to 52 megapixels, each format) and rounded up.
   const long long pixels = facts.width * facts.height;
   const long long shrunk = pixels / (facts.shrink * facts.shrink);
   const long long sample = facts.bands * facts.sample_bytes;
   // libvips's lines between the decoder and the first reduction: about
-  // 2400 lines' worth of the loaded image, at 3 bytes a pixel or more.
-  const long long window =
-      2400LL * (facts.width / facts.shrink) * std::max(sample, 3LL);
+  // 2400 lines of the image as loaded, at 3 bytes a pixel or more; with
+  // transparency, premultiplied in floats (4 bytes a band), about 1600.
+  const long long loaded_width = facts.width / facts.shrink;
+  const long long window = facts.alpha
+                               ? 1600LL * loaded_width * facts.bands * 4
+                               : 2400LL * loaded_width * std::max(sample, 3LL);
   long long decoder = 0;
   switch (facts.format) {
     case Format::kJpeg:
@@ -550,7 +554,13 @@ PhotoResult MakePhotoThumbnails(int folder_fd, const std::string& folder,
     return result;
   }
 
-  // The bytes that are checked are the bytes that are decoded.
+  // The bytes that are checked are the bytes that are decoded. They count
+  // towards the decode's memory: a larger file is not even read.
+  if (st.st_size > limits.max_decode_bytes) {
+    return Skipped("a file of " + std::to_string(st.st_size >> 20) +
+                   " MiB, more than the decode limit of " +
+                   std::to_string(limits.max_decode_bytes >> 20) + " MiB");
+  }
   std::vector<unsigned char> bytes;
   if (!ReadWhole(photo.get(), st.st_size, &bytes, &problem)) {
     return Skipped(problem);

@@ -149,6 +149,7 @@ struct DecodeFacts {
   long long height = 0;
   int bands = 3;             // after decoding
   int sample_bytes = 1;      // per band: 1, 2 or 4
+  bool alpha = false;        // transparency: resized premultiplied, in floats
   bool progressive = false;  // JPEG: multi-scan; PNG: interlaced
   bool subsampled = false;   // JPEG: chroma 4:2:0
   bool lossless = true;      // WebP: not one lossy image

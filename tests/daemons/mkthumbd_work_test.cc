@@ -199,9 +199,10 @@ TEST_F(ThumbnailerTest, OnlyStaleOrMissingThumbnailsAreMadeAgain) {
                 "other.part-x"}));
 }
 
-// Photos libvips cannot read, bombs, and photos that are gone or are not
-// regular files (a FIFO is never waited on) are skipped with a reason and
-// leave nothing behind; a bomb is refused before it is decoded.
+// Photos libvips cannot read, bombs, files larger than a decode may take,
+// and photos that are gone or are not regular files (a FIFO is never waited
+// on) are skipped with a reason and leave nothing behind; a bomb is refused
+// before it is decoded, a huge file before it is read.
 TEST_F(ThumbnailerTest, BadPhotosAreSkippedWithAReason) {
   ASSERT_TRUE(WritePhoto(Photo("whole.jpg"), 800, 600, kRed, kBlue));
   std::string whole = ReadFile(Photo("whole.jpg"));
@@ -213,6 +214,8 @@ TEST_F(ThumbnailerTest, BadPhotosAreSkippedWithAReason) {
   ASSERT_EQ(symlink("whole.jpg", Photo("link.jpg").c_str()), 0);
   ASSERT_EQ(mkdir(Photo("folder.jpg").c_str(), 0755), 0);
   ASSERT_EQ(mkfifo(Photo("fifo.jpg").c_str(), 0644), 0);
+  WriteFile(Photo("huge.jpg"), whole);  // a JPEG header, then 16 GiB of holes
+  ASSERT_EQ(truncate(Photo("huge.jpg").c_str(), 16LL << 30), 0);
   const std::pair<const char*, const char*> cases[] = {
       {"truncated.jpg", "cannot read it"},
       {"empty.jpg", "cannot read it"},
@@ -222,6 +225,7 @@ TEST_F(ThumbnailerTest, BadPhotosAreSkippedWithAReason) {
       {"link.jpg", "not a regular file"},
       {"folder.jpg", "not a regular file"},
       {"fifo.jpg", "not a regular file"},
+      {"huge.jpg", "a file of 16384 MiB, more than the decode limit"},
   };
   for (const auto& [name, reason] : cases) {
     const auto started = std::chrono::steady_clock::now();
@@ -263,9 +267,10 @@ TEST_F(ThumbnailerTest, OneUnwritableItemDoesNotStopTheOthers) {
 
 // What a decode may take depends on the format, not on the pixels alone:
 // of photos of one size, those whose decoder holds the whole image (a
-// progressive JPEG, an interlaced PNG, a lossless WebP, a GIF, a TIFF, a
-// HEIF) are refused under a limit that the streaming ones (a baseline JPEG,
-// a plain PNG, a lossy WebP) stay within.
+// progressive JPEG, an interlaced PNG, a lossless WebP, a GIF, a TIFF) are
+// refused under a limit that the streaming ones (a baseline JPEG, a plain
+// PNG, a lossy WebP) stay within. (HEIF, held whole too, takes seconds to
+// encode: bench/thumb_rss.sh measures it.)
 TEST_F(ThumbnailerTest, DecodesThatWouldExceedTheMemoryLimitAreRefused) {
   struct Case {
     const char* write;  // name and libvips save options
@@ -280,12 +285,13 @@ TEST_F(ThumbnailerTest, DecodesThatWouldExceedTheMemoryLimitAreRefused) {
       {"lossless.webp[lossless]", "lossless.webp", false},
       {"g.gif", "g.gif", false},
       {"t.tif", "t.tif", false},
-      {"h.heic[effort=0]", "h.heic", false},
   };
   mkthumbd::PhotoLimits limits;
   limits.max_decode_bytes = 45LL << 20;
   for (const Case& c : cases) {
-    ASSERT_TRUE(WritePhoto(Photo(c.write), 3000, 2000, kRed, kBlue)) << c.name;
+    ASSERT_TRUE(
+        quvaidx::daemon_test::WritePlainPhoto(Photo(c.write), 3000, 2000, kRed))
+        << c.name;
     PhotoResult result = MakePhotoThumbnails(Photo(c.name), limits);
     EXPECT_EQ(result.made, c.made ? kAllThumbSizes : 0)
         << c.name << ": " << result.reason;
