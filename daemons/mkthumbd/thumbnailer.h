@@ -65,18 +65,21 @@
 // Memory. libvips runs with its operation cache off and one worker thread,
 // and the process with one malloc arena. What a decode takes is estimated
 // from the header, by format (DecodePeakBytes): the photo's bytes, held
-// once; libvips's window of about 2400 lines of the image as loaded; and
-// what the decoder must hold whole. A baseline JPEG (shrunk on load), a
-// lossy WebP (scaled on load), a non-interlaced PNG and a stripped TIFF
+// once; libvips's window of about 2400 lines of the image as loaded (1600
+// in floats for an image with transparency, which is resized
+// premultiplied); and what the decoder must hold whole. A baseline JPEG
+// (shrunk on load), a lossy WebP (scaled on load) and a non-interlaced PNG
 // stream; a progressive JPEG holds every DCT coefficient (2 bytes a
 // sample, 1.5 to 4 samples a pixel, however it is shrunk), an interlaced
 // PNG, a GIF, a lossless WebP and a HEIF their whole decoded image, a HEIF
-// its planes besides. The factors were measured and rounded up, with an
-// eighth more for the allocator. kMaxDecodeBytes keeps the daemon within
-// the MemoryMax=512M of its systemd unit: at the limit, a progressive JPEG
-// of about 55 megapixels (4:4:4; 100 at 4:2:0), a GIF or lossless WebP of
-// 65 to 75, a HEIF of 50, an interlaced 8-bit RGB PNG of 70 still get
-// thumbnails; what streams is bounded by the pixel limit alone.
+// its planes besides, and a TIFF counts as whole (it may be one strip).
+// The factors were measured and rounded up, with an eighth more for the
+// allocator. kMaxDecodeBytes keeps the daemon within the MemoryMax=512M of
+// its systemd unit: at the limit, a 4:4:4 progressive JPEG of 52
+// megapixels, a GIF of 41, a HEIF of 46, a lossless WebP of 70 and an
+// interlaced 8-bit PNG of 74 still get thumbnails, with a peak of 333 to
+// 357 MB (bench/thumb_rss.sh); what streams is bounded by the pixel limit
+// alone.
 #ifndef QUVAIDX_DAEMONS_MKTHUMBD_THUMBNAILER_H_
 #define QUVAIDX_DAEMONS_MKTHUMBD_THUMBNAILER_H_
 
