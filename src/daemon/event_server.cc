@@ -179,8 +179,8 @@ int QueueReply(struct bufferevent* bev, const Json::Value& reply) {
   bool too_large = false;
   int result = QueuePacket(bev, reply, &too_large);
   if (result != 0 && too_large) {
-    result = QueuePacket(bev, MakeResponse(false, "reply too large"),
-                         &too_large);
+    result =
+        QueuePacket(bev, MakeResponse(false, "reply too large"), &too_large);
   }
   return result;
 }
@@ -398,7 +398,8 @@ DeferredReply* DeferReply() {
 
 int SendDeferredReply(DeferredReply* deferred, const Json::Value* reply) {
   if (deferred == nullptr || g_handler_connection != nullptr) {
-    AppLogError(3, "%s:%d [Error] a deferred reply is sent from the loop, "
+    AppLogError(3,
+                "%s:%d [Error] a deferred reply is sent from the loop, "
                 "outside handlers",
                 kModule, __LINE__);
     return -1;

@@ -78,8 +78,7 @@ bool ParseStatusIds(const char* text, size_t length, StatusIds* ids) {
       have_gid = true;
     } else if (!have_groups &&
                StartsWith(line, end, kGroups, sizeof(kGroups) - 1)) {
-      if (!ParseIds(line + sizeof(kGroups) - 1, end, kMaxPeerGroups,
-                    &values)) {
+      if (!ParseIds(line + sizeof(kGroups) - 1, end, kMaxPeerGroups, &values)) {
         return false;
       }
       ids->groups.assign(values.begin(), values.end());
@@ -114,21 +113,20 @@ bool StatusFileGroups(const char* status_path, const struct ucred& peer,
   StatusIds ids;
   if (err != 0 || text.size() > kMaxStatusBytes ||
       !ParseStatusIds(text.data(), text.size(), &ids)) {
-    AppLogError(3, "%s:%d [Error] no groups for pid %d: %s unreadable",
-                kModule, __LINE__, static_cast<int>(peer.pid), status_path);
+    AppLogError(3, "%s:%d [Error] no groups for pid %d: %s unreadable", kModule,
+                __LINE__, static_cast<int>(peer.pid), status_path);
     return false;
   }
   // The process may have ended and its pid gone to another: its groups
   // count only while it still has the identity it connected with.
   if (ids.uid[1] != peer.uid || ids.gid[1] != peer.gid) {
-    AppLogError(3,
-                "%s:%d [Error] no groups for pid %d: it runs as %u:%u now, "
-                "not as %u:%u",
-                kModule, __LINE__, static_cast<int>(peer.pid),
-                static_cast<unsigned>(ids.uid[1]),
-                static_cast<unsigned>(ids.gid[1]),
-                static_cast<unsigned>(peer.uid),
-                static_cast<unsigned>(peer.gid));
+    AppLogError(
+        3,
+        "%s:%d [Error] no groups for pid %d: it runs as %u:%u now, "
+        "not as %u:%u",
+        kModule, __LINE__, static_cast<int>(peer.pid),
+        static_cast<unsigned>(ids.uid[1]), static_cast<unsigned>(ids.gid[1]),
+        static_cast<unsigned>(peer.uid), static_cast<unsigned>(peer.gid));
     return false;
   }
   groups->swap(ids.groups);
@@ -140,8 +138,7 @@ bool PeerSocketGroups(int fd, const struct ucred& peer,
   std::vector<gid_t> found(64);
   for (int attempt = 0; attempt < 3; ++attempt) {
     socklen_t length = static_cast<socklen_t>(found.size() * sizeof(gid_t));
-    if (getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, found.data(), &length) ==
-        0) {
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, found.data(), &length) == 0) {
       found.resize(length / sizeof(gid_t));
       groups->swap(found);
       return true;

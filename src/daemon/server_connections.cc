@@ -160,9 +160,8 @@ void CheckDeadlines(evutil_socket_t, short, void*) {
 bool TrackConnection(struct bufferevent* bev, EventArgs* args) {
   int fd = static_cast<int>(bufferevent_getfd(bev));
   if (fd < 0) return false;
-  Connection* connection = new (std::nothrow)
-      Connection{bev,     args,    Wait::kRequest, NowMs(), 0,
-                 nullptr, nullptr, false};
+  Connection* connection = new (std::nothrow) Connection{
+      bev, args, Wait::kRequest, NowMs(), 0, nullptr, nullptr, false};
   if (connection == nullptr) return false;
   try {
     if (static_cast<size_t>(fd) >= g_by_fd.size()) {

@@ -8,10 +8,10 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
-#include <grp.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -739,8 +739,8 @@ TEST_F(DeferredReplyTest, RepliesKeepTheirOrderPerConnection) {
       },
       5000);
   EXPECT_EQ(sent, requests.size());
-  EXPECT_TRUE(received == replies) << received.size() << " of "
-                                   << replies.size() << " bytes";
+  EXPECT_TRUE(received == replies)
+      << received.size() << " of " << replies.size() << " bytes";
 }
 
 // A peer that ends its stream while its reply is deferred still gets that

@@ -32,10 +32,11 @@ TEST(PeerGroupsTest, StatusTextsGiveTheirGroupsOrNone) {
     bool parsed;
     std::vector<gid_t> groups;
   } cases[] = {
-      {kIds + "FDSize:\t64\nGroups:\t4 27 4294967294 \nNSpid:\t9\n", true,
+      {kIds + "FDSize:\t64\nGroups:\t4 27 4294967294 \nNSpid:\t9\n",
+       true,
        {4, 27, 4294967294u}},
       {kIds + "Groups:\t\n", true, none},
-      {"Groups:\t5\n" + kIds, true, {5}},  // any order
+      {"Groups:\t5\n" + kIds, true, {5}},     // any order
       {kIds + "Groups:\t5 6", true, {5, 6}},  // the text's end ends the line
       {kIds + "Groups:\t5\nGroups:\t6\n", true, {5}},  // the first counts
       {kIds, false, none},                             // no groups line
@@ -84,7 +85,8 @@ TEST(PeerGroupsTest, StatusOfAnotherIdentityIsRefused) {
     EXPECT_FALSE(StatusFileGroups(status.c_str(), other, &groups));
   }
   EXPECT_FALSE(StatusFileGroups(dir.File("gone").c_str(), same, &groups));
-  WriteFile(status, kIds + "Groups:\t7 8\n" + std::string(kMaxStatusBytes, ' '));
+  WriteFile(status,
+            kIds + "Groups:\t7 8\n" + std::string(kMaxStatusBytes, ' '));
   EXPECT_FALSE(StatusFileGroups(status.c_str(), same, &groups));
   EXPECT_EQ(groups, std::vector<gid_t>{99});
   EXPECT_EQ(log.lines().size(), 4u);

@@ -103,8 +103,7 @@ TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
     const PeerIdentity* peer;
     bool readable;
   } cases[] = {
-      {"open/public", &kStranger, true},
-      {"open/private", &kStranger, false},
+      {"open/public", &kStranger, true},    {"open/private", &kStranger, false},
       {"closed/public", &kStranger, false},  // the folder cannot be searched
       {"open/theirs", &kStranger, true},  // its owner's, though others may not
       {"open/shared", &kStranger, true},  // by a group the peer holds
@@ -153,17 +152,17 @@ TEST_F(PeerFileTest, DaemonAnswersEachPeerByTheGroupsItHolds) {
       << daemon.Errors();
   for (const PeerIdentity* peer : {&kStranger, &kOutsider}) {
     // Exit status: 0 answered, 1 refused, 2 no exchange.
-    int status = quvaidx::test::RunAsUser(
-        peer->uid, peer->gid, peer->groups, [&] {
+    int status =
+        quvaidx::test::RunAsUser(peer->uid, peer->gid, peer->groups, [&] {
           Json::Value request(Json::objectValue);
           request["command"] = "GET_MEDIA_RESOLUTION";
           request["path"] = photo;
           if (AutoSendRecvPacketBySocketPath(socket.c_str(), request, 1) != 0) {
             return 2;
           }
-          return request["success"] == true && request["width"] == 640
-                     ? 0
-                     : request["reason"] == "Permission denied" ? 1 : 3;
+          return request["success"] == true && request["width"] == 640 ? 0
+                 : request["reason"] == "Permission denied"            ? 1
+                                                                       : 3;
         });
     EXPECT_EQ(status, peer == &kStranger ? 0 : 1) << daemon.Errors();
   }
