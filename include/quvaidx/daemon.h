@@ -26,7 +26,9 @@
 // - a reply too large for a packet is replaced by
 //   {"success":false,"reason":"reply too large"};
 // - every complete request in a connection's input buffer is answered, in
-//   order, in the same callback;
+//   order, in the same callback, unless a handler defers a reply: then the
+//   connection's later requests wait (64 KiB of them at most are read) until
+//   that reply has been sent, and other connections are served meanwhile;
 // - a peer that shuts down its sending side still gets every reply queued
 //   for it before the server closes the connection;
 // - a connection stops being read while more than kMaxPendingOutput bytes of
