@@ -381,31 +381,33 @@ TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
     waiting.push_back(std::make_unique<Client>(socket_));
     ASSERT_TRUE(waiting.back()->Send(convert));
   }
-  Client ordered(socket_);  // the fifth; its HANDSHAKE waits behind it
-  ASSERT_TRUE(ordered.Send(convert) && ordered.Send(Request("HANDSHAKE")));
-  usleep(200 * 1000);  // all five taken
-  Client refused(socket_);
-  ASSERT_TRUE(refused.Send(convert));
-  const auto start = Clock::now();
-  Client asking(socket_);
-  ASSERT_TRUE(asking.Send(Request("HANDSHAKE")));
-  EXPECT_EQ(asking.Reply(1000), MakeResponse(true, nullptr));
-  EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(500));
-  EXPECT_EQ(refused.Reply(500)["reason"],
-            "busy: 5 requests are being answered; try again later");
-  EXPECT_TRUE(ordered.Reply(100).isNull());
   const std::string timed_out = "the media parser does not answer (timed out)";
-  EXPECT_EQ(ordered.Reply(5000)["reason"], timed_out);
-  EXPECT_GE(Clock::now() - start, std::chrono::milliseconds(2500));
-  EXPECT_EQ(ordered.Reply(500), MakeResponse(true, nullptr));
-  for (auto& client : waiting)
+  {
+    Client ordered(socket_);  // the fifth; its HANDSHAKE waits behind it
+    ASSERT_TRUE(ordered.Send(convert) && ordered.Send(Request("HANDSHAKE")));
+    usleep(200 * 1000);  // all five taken
+    Client refused(socket_);
+    ASSERT_TRUE(refused.Send(convert));
+    const auto start = Clock::now();
+    Client asking(socket_);
+    ASSERT_TRUE(asking.Send(Request("HANDSHAKE")));
+    EXPECT_EQ(asking.Reply(1000), MakeResponse(true, nullptr));
+    EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(500));
+    EXPECT_EQ(refused.Reply(500)["reason"],
+              "busy: 5 requests are being answered; try again later");
+    EXPECT_TRUE(ordered.Reply(100).isNull());
+    EXPECT_EQ(ordered.Reply(5000)["reason"], timed_out);
+    EXPECT_GE(Clock::now() - start, std::chrono::milliseconds(2500));
+    EXPECT_EQ(ordered.Reply(500), MakeResponse(true, nullptr));
+  }
+  for (auto& client : waiting) {
     EXPECT_EQ(client->Reply(500)["reason"], timed_out);
-
-  for (auto& client : waiting) ASSERT_TRUE(client->Send(convert));
-  usleep(100 * 1000);
+    ASSERT_TRUE(client->Send(convert));
+  }
+  usleep(100 * 1000);  // the other clients gone, these four waiting
   const auto stopping = Clock::now();
   ASSERT_TRUE(daemon_.Signal(SIGTERM));
-  EXPECT_TRUE(daemon_.WaitExit(5));
+  EXPECT_TRUE(daemon_.WaitExit(5)) << daemon_.Errors();
   EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(1500));
   close(stuck);
 }
