@@ -3,15 +3,21 @@
 #include "quvaidx/ea_file.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <functional>
+#include <set>
 #include <string>
 
 #include <gtest/gtest.h>
+
+#include "host_ops.h"
 
 #include "quvaidx/path_rules.h"
 #include "support/fake_host.h"
@@ -23,12 +29,24 @@ namespace {
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
-bool IsLink(const std::string& path) {
+// The kind of entry at `path` (S_IFMT bits of lstat), 0 when there is none.
+mode_t KindAt(const std::string& path) {
   struct stat st;
-  return lstat(path.c_str(), &st) == 0 && S_ISLNK(st.st_mode);
+  return lstat(path.c_str(), &st) == 0 ? st.st_mode & S_IFMT : 0;
+}
+
+// Names in directory `dir`.
+std::set<std::string> Entries(const std::string& dir) {
+  std::set<std::string> names;
+  std::error_code ignored;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ignored)) {
+    names.insert(entry.path().filename());
+  }
+  return names;
 }
 
 // Bad parameters never reach the host; a host failure is logged with the
@@ -105,32 +123,6 @@ TEST_F(RealTree, BothFunctionsCreateTheDirectoriesAndKeepItems) {
   }
 }
 
-// A file in the way is replaced, a link to a file too (its target survives),
-// a link to a directory is kept.
-TEST_F(RealTree, MakeEADirReplacesNonDirectoriesButNothingBeyondThem) {
-  const std::string file = outside_.File("victim");
-  const std::string dir = outside_.File("elsewhere");
-  WriteFile(file, "keep me");
-  mkdir(dir.c_str(), 0755);
-  for (const std::string& link_to : {std::string(), file, dir}) {
-    SCOPED_TRACE(link_to);
-    if (link_to.empty()) {
-      WriteFile(hidden_, "in the way");
-    } else {
-      mkdir(hidden_.c_str(), 0755);
-      ASSERT_EQ(0, symlink(link_to.c_str(), ea_.c_str()));
-    }
-    char buf[4096];
-    ASSERT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
-    EXPECT_EQ(1, IsDirExist(ea_.c_str()));
-    EXPECT_EQ(link_to == dir, IsLink(ea_));
-    EXPECT_EQ(1, IsFileExist(file.c_str(), nullptr)) << "link target lost";
-    unlink(ea_.c_str());
-    rmdir(ea_.c_str());
-    rmdir(hidden_.c_str());
-  }
-}
-
 TEST_F(RealTree, ItemsArePreferredInOrderAndNeedTwoBytesToCount) {
   char buf[4096];
   ASSERT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
@@ -196,3 +188,356 @@ TEST_F(RealTree, OverlongItemPathNeverTouchesTheFileItsCutNames) {
 }
 
 }  // namespace
+
+// What a user may plant in a photo folder, where the metadata directory
+// (.quvameta) or the EA directory (.quvameta/a.jpg) should be. `outside` is
+// a directory the walk must never reach: it holds a file "victim".
+struct Planted {
+  const char* what;
+  std::function<void(const std::string& hidden, const std::string& ea,
+                     const std::string& outside)>
+      plant;
+  int error_open;    // errno without create, 0: opened
+  int error_create;  // errno with create, 0: opened
+  bool refused;      // a refusal is logged
+};
+
+const Planted kPlanted[] = {
+    {"nothing", [](auto&, auto&, auto&) {}, ENOENT, 0, false},
+    {"both directories",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       mkdir(ea.c_str(), 0755);
+     },
+     0, 0, false},
+    {"metadata dir links to a directory elsewhere",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink(outside.c_str(), hidden.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"EA dir links to a directory elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink(outside.c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"EA dir links to a file elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink((outside + "/victim").c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"dangling link at the metadata dir",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink((outside + "/new").c_str(), hidden.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"dangling link at the EA dir",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink((outside + "/new").c_str(), ea.c_str());
+     },
+     ELOOP, ELOOP, true},
+    {"FIFO at the metadata dir",
+     [](auto& hidden, auto&, auto&) { mkfifo(hidden.c_str(), 0666); }, ENOTDIR,
+     ENOTDIR, true},
+    {"FIFO at the EA dir",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       mkfifo(ea.c_str(), 0666);
+     },
+     ENOTDIR, ENOTDIR, true},
+    {"regular file at the metadata dir",
+     [](auto& hidden, auto&, auto&) { WriteFile(hidden, "in the way"); },
+     ENOTDIR, 0, false},
+    {"regular file at the EA dir",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       WriteFile(ea, "in the way");
+     },
+     ENOTDIR, 0, false},
+};
+
+// Every planted entry, without and with create, from the folder's path and
+// from a descriptor of the folder: a link or special file is refused,
+// logged and left in place, and nothing outside the folder changes.
+TEST(OpenEADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
+  for (const Planted& c : kPlanted) {
+    for (int create : {0, 1}) {
+      for (bool by_fd : {false, true}) {
+        SCOPED_TRACE(std::string(c.what) + (create ? ", create" : "") +
+                     (by_fd ? ", folder fd" : ""));
+        TempDir dir, outside;
+        WriteFile(outside.File("victim"), "root's");
+        const std::string hidden = dir.File(".quvameta");
+        const std::string ea = hidden + "/a.jpg";
+        c.plant(hidden, ea, outside.path());
+        const mode_t hidden_kind = KindAt(hidden), ea_kind = KindAt(ea);
+        const int folder = by_fd ? open(dir.path().c_str(), O_RDONLY) : -1;
+        quvaidx::test::FdLeakCheck leaks;
+        LogCapture log;
+        errno = 0;
+        const int fd = OpenEADir(dir.File("a.jpg").c_str(), folder, create);
+        const int error = fd < 0 ? errno : 0;
+        const int expected = create ? c.error_create : c.error_open;
+        EXPECT_EQ(expected, error) << strerror(error);
+        EXPECT_EQ(c.refused ? 1u : 0u, log.lines().size());
+        if (fd >= 0) {
+          struct stat opened, named;
+          ASSERT_EQ(0, fstat(fd, &opened));
+          ASSERT_EQ(0, lstat(ea.c_str(), &named));
+          EXPECT_TRUE(S_ISDIR(named.st_mode));
+          EXPECT_EQ(named.st_ino, opened.st_ino);
+          EXPECT_EQ(FD_CLOEXEC, fcntl(fd, F_GETFD) & FD_CLOEXEC);
+          close(fd);
+        } else if (c.refused) {
+          EXPECT_EQ(hidden_kind, KindAt(hidden)) << "removed";
+          EXPECT_EQ(ea_kind, KindAt(ea)) << "removed";
+        }
+        EXPECT_TRUE(leaks.NoLeak());
+        EXPECT_EQ(std::set<std::string>{"victim"}, Entries(outside.path()));
+        EXPECT_EQ("root's", ReadFile(outside.File("victim")));
+        if (folder >= 0) close(folder);
+      }
+    }
+  }
+}
+
+// The walk starts at the descriptor: the folder's path in file_path is not
+// opened then. Made directories take 0777 less the umask.
+TEST(OpenEADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
+  TempDir dir;
+  const int folder = open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+  ASSERT_GE(folder, 0);
+  const mode_t old_umask = umask(027);
+  const int fd = OpenEADir("/no-such-folder/a.jpg", folder, 1);
+  umask(old_umask);
+  ASSERT_GE(fd, 0) << strerror(errno);
+  close(fd);
+  close(folder);
+  for (const char* made : {".quvameta", ".quvameta/a.jpg"}) {
+    struct stat st;
+    ASSERT_EQ(0, lstat(dir.File(made).c_str(), &st));
+    EXPECT_EQ(0750u, st.st_mode & 07777) << made;
+  }
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir("/no-such-folder/a.jpg", -1, 1));
+  EXPECT_EQ(ENOENT, errno);
+}
+
+// What the host answers for every file, set per case.
+const char* g_host_answer = "";
+
+int AnswerHostPath(int, const char*, char* buffer, int size) {
+  snprintf(buffer, static_cast<size_t>(size), "%s", g_host_answer);
+  return 0;
+}
+
+TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
+  TempDir dir, outside;
+  LogCapture log;
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(nullptr, -1, 1));
+  EXPECT_EQ(EINVAL, errno);
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -2, 1));
+  EXPECT_EQ(EINVAL, errno);
+  {
+    FakeHost host;
+    host.Fail(HostOp::kEADirPath, ENAMETOOLONG);
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1));
+    EXPECT_EQ(EINVAL, errno);
+  }
+  const std::string answers[] = {
+      outside.File(".quvameta/a.jpg"),  // another folder
+      dir.File(".quvameta/sub/a.jpg"),  // deeper than two levels
+      dir.File(".quvameta"),            // one level
+      dir.File("../" + std::string(outside.path().substr(5)) + "/a.jpg"),
+  };
+  quvahost::HostOps ops{};
+  ops.EADirPath = AnswerHostPath;
+  const quvahost::HostOps previous = quvahost::SetHostOps(&ops);
+  for (const std::string& answer : answers) {
+    g_host_answer = answer.c_str();
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1)) << answer;
+    EXPECT_EQ(EINVAL, errno) << answer;
+  }
+  quvahost::SetHostOps(&previous);
+  EXPECT_TRUE(Entries(dir.path()).empty());
+  EXPECT_TRUE(Entries(outside.path()).empty());
+  EXPECT_EQ(5u, log.lines().size());  // the host failure and four answers
+}
+
+// MakeEADir and GetEADirPath on every planted entry: MakeEADir makes what
+// OpenEADir with create would; GetEADirPath hands the host only what is
+// missing, never a refused link or special file.
+TEST(EADirMakingWalk, PlantedEntriesAreNeverFollowedByEitherMaker) {
+  for (const Planted& c : kPlanted) {
+    for (bool by_host : {false, true}) {
+      SCOPED_TRACE(std::string(c.what) + (by_host ? ", GetEADirPath" : ""));
+      TempDir dir, outside;
+      WriteFile(outside.File("victim"), "root's");
+      const std::string hidden = dir.File(".quvameta");
+      const std::string ea = hidden + "/a.jpg";
+      c.plant(hidden, ea, outside.path());
+      const mode_t hidden_kind = KindAt(hidden), ea_kind = KindAt(ea);
+      LogCapture log;
+      FakeHost host;
+      char buf[4096];
+      const int result =
+          by_host ? GetEADirPath(dir.File("a.jpg").c_str(), buf, sizeof(buf))
+                  : MakeEADir(dir.File("a.jpg").c_str(), buf, sizeof(buf));
+      // The host makes what is missing but replaces nothing in the way.
+      const bool made = by_host ? c.error_open == 0 || c.error_open == ENOENT
+                                : c.error_create == 0;
+      EXPECT_EQ(made ? 0 : -1, result);
+      EXPECT_EQ(ea, buf);
+      if (made) {
+        EXPECT_EQ(S_IFDIR, KindAt(ea));
+      }
+      if (c.refused) {
+        EXPECT_EQ(hidden_kind, KindAt(hidden)) << "removed";
+        EXPECT_EQ(ea_kind, KindAt(ea)) << "removed";
+        EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
+        EXPECT_EQ(2u, log.lines().size());  // the refusal, then the failure
+        const std::string failure =
+            by_host ? "Make ea dir path error. eaDir path: " + ea
+                    : ", error:" + std::to_string(c.error_create);
+        EXPECT_NE(std::string::npos, log.lines().back().text.find(failure))
+            << log.lines().back().text;
+      }
+      EXPECT_EQ(std::set<std::string>{"victim"}, Entries(outside.path()));
+      EXPECT_EQ("root's", ReadFile(outside.File("victim")));
+    }
+  }
+}
+
+// The item functions where the metadata or EA directory, or an item, is
+// planted. Items "x" and "y" (5 bytes) wait in the EA directory and in
+// every place a followed link would lead; what is outside must stay unseen
+// and unremoved.
+struct ItemPlant {
+  const char* what;
+  // Plants in the folder; `outside` already holds x, y, a.jpg/x, a.jpg/y.
+  std::function<void(const std::string& hidden, const std::string& ea,
+                     const std::string& outside)>
+      plant;
+  int removed;        // RemoveEAFile(ea, "x", "y")
+  const char* found;  // IsEAFileExist(ea, "x", "y"): "x", "y" or null
+};
+
+void MakeRealDirs(const std::string& hidden, const std::string& ea) {
+  mkdir(hidden.c_str(), 0755);
+  mkdir(ea.c_str(), 0755);
+}
+
+const ItemPlant kItemPlants[] = {
+    {"real items",
+     [](auto& hidden, auto& ea, auto&) {
+       MakeRealDirs(hidden, ea);
+       WriteFile(ea + "/x", "12345");
+       WriteFile(ea + "/y", "12345");
+     },
+     2, "x"},
+    {"metadata dir links elsewhere",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink(outside.c_str(), hidden.c_str());
+     },
+     0, nullptr},
+    {"EA dir links elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       mkdir(hidden.c_str(), 0755);
+       symlink(outside.c_str(), ea.c_str());
+     },
+     0, nullptr},
+    {"dangling link at the metadata dir",
+     [](auto& hidden, auto&, auto& outside) {
+       symlink((outside + "/none").c_str(), hidden.c_str());
+     },
+     0, nullptr},
+    {"FIFO at the EA dir",
+     [](auto& hidden, auto& ea, auto&) {
+       mkdir(hidden.c_str(), 0755);
+       mkfifo(ea.c_str(), 0666);
+     },
+     0, nullptr},
+    {"x links to a file elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       MakeRealDirs(hidden, ea);
+       symlink((outside + "/x").c_str(), (ea + "/x").c_str());
+       WriteFile(ea + "/y", "12345");
+     },
+     1, "y"},
+    {"x dangles, y links to a directory elsewhere",
+     [](auto& hidden, auto& ea, auto& outside) {
+       MakeRealDirs(hidden, ea);
+       symlink((outside + "/none").c_str(), (ea + "/x").c_str());
+       symlink((outside + "/a.jpg").c_str(), (ea + "/y").c_str());
+     },
+     0, nullptr},
+};
+
+TEST(EAItemsWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
+  using Call = std::function<int(const char* media, const char* ea)>;
+  const struct {
+    const char* name;
+    Call call;
+    bool counts_removed;  // else: 1 when found, 0 when not
+  } calls[] = {
+      {"RemoveEAFile", [](auto, auto ea) { return RemoveEAFile(ea, "x", "y"); },
+       true},
+      {"RemoveEAFile2",
+       [](auto media, auto) { return RemoveEAFile2(media, "x", "y"); }, true},
+      {"IsEAFileExist",
+       [](auto, auto ea) {
+         return IsEAFileExist(ea, nullptr, "x", "y") != nullptr ? 1 : 0;
+       },
+       false},
+      {"IsEAFileExist2",
+       [](auto media, auto) { return IsEAFileExist2(media, "x", "y"); }, false},
+      {"GetEAFilePath",
+       [](auto media, auto) {
+         char out[4096];
+         return GetEAFilePath(media, "x", "y", out, sizeof(out)) == 0 ? 1 : 0;
+       },
+       false},
+  };
+  for (const ItemPlant& c : kItemPlants) {
+    for (const auto& fn : calls) {
+      SCOPED_TRACE(std::string(c.what) + ", " + fn.name);
+      TempDir dir, outside;
+      for (const char* name : {"x", "y", "a.jpg/x", "a.jpg/y"}) {
+        mkdir(outside.File("a.jpg").c_str(), 0755);
+        WriteFile(outside.File(name), "root's");
+      }
+      const std::string hidden = dir.File(".quvameta");
+      const std::string ea = hidden + "/a.jpg";
+      c.plant(hidden, ea, outside.path());
+      const mode_t planted_x = KindAt(ea + "/x");
+      LogCapture log;
+      const int result = fn.call(dir.File("a.jpg").c_str(), ea.c_str());
+      EXPECT_EQ(fn.counts_removed ? c.removed : c.found != nullptr, result);
+      const bool refused = c.removed < 2;  // every other plant is refused
+      EXPECT_EQ(refused, !log.lines().empty());
+      for (const char* name : {"x", "y", "a.jpg/x", "a.jpg/y"}) {
+        EXPECT_EQ("root's", ReadFile(outside.File(name))) << name;
+      }
+      if (S_ISLNK(planted_x)) {
+        EXPECT_EQ(planted_x, KindAt(ea + "/x")) << "link removed";
+      }
+    }
+    TempDir dir, outside;
+    c.plant(dir.File(".quvameta"), dir.File(".quvameta/a.jpg"), outside.path());
+    const std::string ea = dir.File(".quvameta/a.jpg");
+    const char* x = "x";
+    const char* y = "y";
+    const char* found = IsEAFileExist(ea.c_str(), nullptr, x, y);
+    EXPECT_EQ(c.found == nullptr ? nullptr
+              : *c.found == 'x'  ? x
+                                 : y,
+              found)
+        << c.what;
+  }
+}
