@@ -23,6 +23,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include <event2/event.h>
 #include <json/json.h>
@@ -97,7 +98,7 @@ quvaidx_tools::CommandLine MakeLine(Options* o) {
                "(printing \"Daemon alive. No need to\nstart\"); else write "
                "this process's id into\nFILE and remove FILE on exit"),
           quvaidx_tools::Flag(
-              "daemon", 'd', &o->detach,
+              "daemon", 0, &o->detach,
               "with --pidfile: detach into the background\nafter the "
               "checks and print nothing more; wait\nfor FILE and the "
               "socket, stop it with\nkill -TERM \"$(cat FILE)\""),
@@ -281,13 +282,10 @@ bool TakePidFile(const std::string& pid_file, bool detach) {
 
 int RunServe(int argc, char** argv) {
   Options options;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&options), argc, argv, &first);
+  std::vector<std::string> none;
+  int status =
+      ParseCommand(MakeLine(&options), {"", 0, 0, nullptr}, argc, argv, &none);
   if (status != kContinue) return status;
-  if (first < argc) {
-    return UsageError(kName,
-                      std::string("unexpected argument '") + argv[first] + "'");
-  }
   std::string& path = options.socket;
   std::string& pid_file = options.pid_file;
   bool detach = options.detach;
