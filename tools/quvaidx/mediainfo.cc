@@ -258,6 +258,7 @@ int RunMediaInfo(int argc, char** argv) {
   std::vector<std::string> files;
   int status = ParseOptions(argc, argv, &options, &files);
   if (status != kContinue) return status;
+  status = kExitOk;
   Json::Value records(Json::arrayValue);
   for (size_t i = 0; i < files.size(); ++i) {
     const std::string& file = files[i];
