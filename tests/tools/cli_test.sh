@@ -514,7 +514,7 @@ quvaidx thumb: $WORK/none: No such file or directory" ] || fail "stderr '$ERR'"
   expect 1
   json 'd["thumbnails"] == {"photos": 3, "folders": 3, "queued": 1, "not_queued": 2}'
   [ "$ERR" = "quvaidx scan: not queued: $share/new\\nline: the name holds a line feed, which a queue line cannot carry
-quvaidx scan: not queued: $out: $out is outside every share" ] || fail "stderr '$ERR'"
+quvaidx scan: not queued: $out: outside every share" ] || fail "stderr '$ERR'"
   expect_file "$WORK/q" "$share/a\n"
 }
 

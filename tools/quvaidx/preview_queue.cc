@@ -132,7 +132,8 @@ PreviewQueuer::Outcome PreviewQueuer::Queue(const std::string& path,
     return kRefused;
   }
   if (!InsideAShare(entry)) {
-    *report = entry + " is outside every share";
+    *report = entry == path ? "outside every share"
+                            : entry + " is outside every share";
     return kRefused;
   }
   if (WriteIndexQueue(entry.c_str(), queue_.c_str()) != 0) {

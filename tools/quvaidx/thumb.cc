@@ -81,6 +81,7 @@ int RunThumb(int argc, char** argv) {
     }
     if (outcome == PreviewQueuer::kQueued) {
       printf("queued %s for %s\n", report.c_str(), queuer.daemon());
+      fflush(stdout);  // in step with the refusals on stderr
       continue;
     }
     status = kExitFalse;
