@@ -103,12 +103,13 @@ std::string DaemonNameList() {
 }
 
 bool ReadJsonObject(const char* command, const std::string& text,
-                    const char* what, const char* example, Json::Value* out) {
-  std::string input;
-  if (text == "-" && !ReadStandardInput(command, what, kMaxJsonInput, &input)) {
+                    const JsonInput& input, Json::Value* out) {
+  const char* what = input.what;
+  std::string read;
+  if (text == "-" && !ReadStandardInput(command, what, kMaxJsonInput, &read)) {
     return false;
   }
-  const std::string& json = text == "-" ? input : text;
+  const std::string& json = text == "-" ? read : text;
   // Any value is read, so that one that is not an object gets its own
   // message below.
   Json::CharReaderBuilder builder;
@@ -129,8 +130,16 @@ bool ReadJsonObject(const char* command, const std::string& text,
   }
   if (!out->isObject()) {
     PrintError(command, std::string("the ") + what +
-                            " must be a JSON object, such as '" + example +
-                            "'");
+                            " must be a JSON object, such as '" +
+                            input.example + "'");
+    return false;
+  }
+  size_t size = Json::FastWriter().write(*out).size();
+  if (size > input.max_size) {
+    PrintError(command, std::string("the ") + what + " is " +
+                            std::to_string(size) + " bytes long; " +
+                            input.carrier + " carries at most " +
+                            std::to_string(input.max_size));
     return false;
   }
   return true;

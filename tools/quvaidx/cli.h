@@ -84,14 +84,23 @@ bool IsDaemonName(const std::string& name);
 // "controld, scand, workerd, plugind, mediad", for error messages.
 std::string DaemonNameList();
 
+// What a JSON value read by ReadJsonObject is and where it goes.
+struct JsonInput {
+  const char* what;     // "request", for messages
+  const char* example;  // a valid value, shown when another kind is given
+  size_t max_size;      // longest compact text (line end included) taken
+  const char* carrier;  // what holds it: "a packet"
+};
+
 // The JSON object given as `text`, or read from standard input when `text`
 // is "-": standard JSON (no comments, trailing commas, duplicate keys or
-// trailing text). On failure prints one line, "invalid JSON WHAT: <first
-// error>", "the WHAT must be a JSON object, such as EXAMPLE" or why standard
-// input could not be read, and returns false. Deep nesting counts as a
-// syntax error, never as a crash.
+// trailing text) whose compact text fits `input.max_size`. On failure
+// prints one line ("invalid JSON WHAT: <first error>", "the WHAT must be a
+// JSON object, such as EXAMPLE", "the WHAT is N bytes long; CARRIER carries
+// at most M", or why standard input could not be read) and returns false.
+// Deep nesting counts as a syntax error, never as a crash.
 bool ReadJsonObject(const char* command, const std::string& text,
-                    const char* what, const char* example, Json::Value* out);
+                    const JsonInput& input, Json::Value* out);
 
 // Writes `value` and a line feed to stdout, indented by two spaces or, with
 // `compact`, on one line (see json_text.h: raw UTF-8, shortest numbers);

@@ -111,9 +111,11 @@ void PrintTable(const std::vector<Row>& rows) {
 int RunDaemons(int argc, char** argv) {
   bool json = false;
   std::vector<std::string> names;
-  int status = ParseCommand(MakeLine(&json), {"NAME", 0, -1, nullptr}, argc,
-                            argv, &names);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&json), {"NAME", 0, -1, nullptr}, argc,
+                                argv, &names);
+      status != kContinue) {
+    return status;
+  }
   for (const std::string& name : names) {
     if (!IsDaemonName(name)) {
       PrintError(kName, "unknown daemon '" + name +

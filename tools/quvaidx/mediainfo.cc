@@ -256,9 +256,11 @@ int ParseOptions(int argc, char** argv, Options* options,
 int RunMediaInfo(int argc, char** argv) {
   Options options;
   std::vector<std::string> files;
-  int status = ParseOptions(argc, argv, &options, &files);
-  if (status != kContinue) return status;
-  status = kExitOk;
+  if (int status = ParseOptions(argc, argv, &options, &files);
+      status != kContinue) {
+    return status;
+  }
+  int status = kExitOk;
   Json::Value records(Json::arrayValue);
   for (size_t i = 0; i < files.size(); ++i) {
     const std::string& file = files[i];
@@ -311,10 +313,12 @@ int RunMediaInfo(int argc, char** argv) {
 int RunResolution(int argc, char** argv) {
   Options options;
   std::vector<std::string> file;
-  int status = ParseOptions(argc, argv, &options, &file);
-  if (status != kContinue) return status;
+  if (int status = ParseOptions(argc, argv, &options, &file);
+      status != kContinue) {
+    return status;
+  }
   Json::Value reply;
-  status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", file[0], &reply);
+  int status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", file[0], &reply);
   if (status != kExitOk) return status;
   int32_t width = ReadInt32(reply, "width");
   int32_t height = ReadInt32(reply, "height");

@@ -36,17 +36,46 @@ struct Options {
   bool null_list = false;  // PATH "-": NUL-separated names on stdin
 };
 
-// The command line of `name` with the options both commands share.
-quvaidx_tools::CommandLine MakeLine(const char* name, const char* usage,
-                                    std::string description, Options* options,
-                                    std::string epilog) {
+// What the --help of each command says.
+struct PreviewCommand {
+  const char* name;
+  const char* usage;
+  const char* description;
+  const char* epilog;
+};
+
+constexpr PreviewCommand kSizeMap = {
+    "sizemap", "[OPTIONS] PATH...|-",
+    "Asks the plug-in daemon which thumbnails each PATH has: for a file,\n"
+    "GET_THUMB_SIZE_MAP; for a directory, GET_DIR_THUMB_SIZE_MAP, which\n"
+    "answers for the directory's first photo by name. Prints one line per\n"
+    "PATH: the size map in hex, the sizes present and the path (and the\n"
+    "photo that stood for a directory). A relative PATH is sent as an\n"
+    "absolute path. With -, the PATHs are read from standard input,\n"
+    "one per line.\n",
+    "Size map bits: XL (1280 pixels) 0x8, B (640) 0x4, M (320) 0x2,\n"
+    "S (120) 0x1.\n\n"
+    "Exit status: 0 when the daemon answered for every PATH, 1 when it\n"
+    "refused one (its reason is printed), 2 on a usage error, a missing\n"
+    "PATH or no answer.\n"};
+
+constexpr PreviewCommand kPlugins = {
+    "plugins", "[OPTIONS]",
+    "Asks the plug-in daemon which preview plug-ins run\n"
+    "(GET_ALL_PLUGIN_NAME) and prints one name per line. As\n"
+    "QUVAIDX_GetAllPluginName does, it asks only while the index daemon\n"
+    "is alive by its pid file (" QUVAIDX_INDEX_PID_FILE ").\n",
+    "Exit status: 0 when the daemon answered, 1 when it refused, 2 on a\n"
+    "usage error, when the index daemon is not running or on no answer.\n"};
+
+// The command line of `command` with the options both commands share.
+quvaidx_tools::CommandLine MakeLine(const PreviewCommand& command,
+                                    Options* options) {
   options->client.daemon = "quvaindexplugind";
   options->client.socket = DaemonInfo().get("plugind", "sock");
   std::vector<quvaidx_tools::Option> flags = {
       JsonOption(&options->json, "print JSON")};
-  if (strcmp(name, "sizemap") == 0) {
-    flags.push_back(NullOption(&options->null_list));
-  }
+  if (&command == &kSizeMap) flags.push_back(NullOption(&options->null_list));
   for (quvaidx_tools::Option& option :
        DaemonOptions(&options->client,
                      "the plug-in daemon's socket\n"
@@ -54,8 +83,8 @@ quvaidx_tools::CommandLine MakeLine(const char* name, const char* usage,
                          options->client.socket + ")")) {
     flags.push_back(std::move(option));
   }
-  return Subcommand(name, {usage}, std::move(description), std::move(flags),
-                    std::move(epilog));
+  return Subcommand(command.name, {command.usage}, command.description,
+                    std::move(flags), command.epilog);
 }
 
 // One exchange with the daemon. Returns kExitOk with the reply in *value,
@@ -90,23 +119,12 @@ std::string SizeNames(int map) {
 int RunSizeMap(int argc, char** argv) {
   Options options;
   std::vector<std::string> paths;
-  int status = ParseCommand(
-      MakeLine("sizemap", "[OPTIONS] PATH...|-",
-               "Asks the plug-in daemon which thumbnails each PATH has: for a "
-               "file,\nGET_THUMB_SIZE_MAP; for a directory, "
-               "GET_DIR_THUMB_SIZE_MAP, which\nanswers for the directory's "
-               "first photo by name. Prints one line per\nPATH: the size map "
-               "in hex, the sizes present and the path (and the\nphoto that "
-               "stood for a directory). A relative PATH is sent as an\n"
-               "absolute path. With -, the PATHs are read from standard "
-               "input,\none per line.\n",
-               &options,
-               "Size map bits: XL (1280 pixels) 0x8, B (640) 0x4, M (320) "
-               "0x2,\nS (120) 0x1.\n\nExit status: 0 when the daemon answered "
-               "for every PATH, 1 when it\nrefused one (its reason is "
-               "printed), 2 on a usage error, a missing\nPATH or no answer.\n"),
-      {"PATH", 1, -1, &options.null_list}, argc, argv, &paths);
-  if (status != kContinue) return status;
+  if (int status =
+          ParseCommand(MakeLine(kSizeMap, &options),
+                       {"PATH", 1, -1, &options.null_list}, argc, argv, &paths);
+      status != kContinue) {
+    return status;
+  }
   Json::Value all(Json::arrayValue);
   int result = kExitOk;
   for (const std::string& given : paths) {
@@ -152,19 +170,11 @@ int RunSizeMap(int argc, char** argv) {
 int RunPlugins(int argc, char** argv) {
   Options options;
   std::vector<std::string> none;
-  int status = ParseCommand(
-      MakeLine("plugins", "[OPTIONS]",
-               "Asks the plug-in daemon which preview plug-ins run\n"
-               "(GET_ALL_PLUGIN_NAME) and prints one name per line. As\n"
-               "QUVAIDX_GetAllPluginName does, it asks only while the index "
-               "daemon\nis alive by its pid file (" QUVAIDX_INDEX_PID_FILE
-               ").\n",
-               &options,
-               "Exit status: 0 when the daemon answered, 1 when it refused, 2 "
-               "on a\nusage error, when the index daemon is not running or on "
-               "no answer.\n"),
-      {"", 0, 0, nullptr}, argc, argv, &none);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(kPlugins, &options),
+                                {"", 0, 0, nullptr}, argc, argv, &none);
+      status != kContinue) {
+    return status;
+  }
   if (IsQuvaindexAlive() != 1) {
     PrintError("plugins", "the index daemon is not running (" +
                               std::string(QUVAIDX_INDEX_PID_FILE) +

@@ -354,10 +354,12 @@ bool ResolveRoots(const std::vector<std::string>& dirs, Options* options) {
 int RunScan(int argc, char** argv) {
   Options options;
   std::vector<std::string> dirs;
-  int status = ParseCommand(MakeLine(&options),
-                            {"the folder DIR", 1, -1, &options.null_list}, argc,
-                            argv, &dirs);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&options),
+                                {"the folder DIR", 1, -1, &options.null_list},
+                                argc, argv, &dirs);
+      status != kContinue) {
+    return status;
+  }
   if (!ResolveRoots(dirs, &options)) return kExitError;
   PreviewQueuer queuer(kName, options.thumbs);
   if (options.queue_thumbs && !queuer.Ready()) return kExitError;

@@ -98,23 +98,20 @@ bool ChooseSocket(Options* o) {
 int RunSend(int argc, char** argv) {
   Options o;
   std::vector<std::string> request;
-  int status =
-      ParseCommand(MakeLine(&o), {"JSON", 0, 1, nullptr}, argc, argv, &request);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&o), {"JSON", 0, 1, nullptr}, argc,
+                                argv, &request);
+      status != kContinue) {
+    return status;
+  }
   if (!ChooseSocket(&o)) return kExitError;
   Json::Value value;
-  if (!ReadJsonObject(kName, request.empty() ? "-" : request[0], "request",
-                      "{\"command\":\"HANDSHAKE\"}", &value)) {
+  const JsonInput input = {"request", "{\"command\":\"HANDSHAKE\"}",
+                           kMaxSendBody, "a packet"};
+  if (!ReadJsonObject(kName, request.empty() ? "-" : request[0], input,
+                      &value) ||
+      Exchange(kName, o.client, &value) != kExitOk) {
     return kExitError;
   }
-  size_t size = Json::FastWriter().write(value).size();
-  if (size > kMaxSendBody) {
-    PrintError(kName, "the request is " + std::to_string(size) +
-                          " bytes long; a packet carries at most " +
-                          std::to_string(kMaxSendBody));
-    return kExitError;
-  }
-  if (Exchange(kName, o.client, &value) != kExitOk) return kExitError;
   PrintJson(value, o.compact);
   // Only a boolean true counts: a script asks the daemon's own verdict.
   const Json::Value& reply = value;

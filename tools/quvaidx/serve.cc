@@ -283,9 +283,11 @@ bool TakePidFile(const std::string& pid_file, bool detach) {
 int RunServe(int argc, char** argv) {
   Options options;
   std::vector<std::string> none;
-  int status =
-      ParseCommand(MakeLine(&options), {"", 0, 0, nullptr}, argc, argv, &none);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&options), {"", 0, 0, nullptr}, argc,
+                                argv, &none);
+      status != kContinue) {
+    return status;
+  }
   std::string& path = options.socket;
   std::string& pid_file = options.pid_file;
   bool detach = options.detach;
@@ -303,7 +305,7 @@ int RunServe(int argc, char** argv) {
   WaitForBoot();
   if (pid_file.empty()) return Serve(path);
   if (!TakePidFile(pid_file, detach)) return kExitError;
-  status = Serve(path);
+  int status = Serve(path);
   DeletePidFile(pid_file.c_str());
   return status;
 }

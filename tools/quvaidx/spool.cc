@@ -131,10 +131,12 @@ int Trim(const std::vector<std::string>& args) {
 int RunSpool(int argc, char** argv) {
   bool null_list = false;
   std::vector<std::string> args;
-  int status = ParseCommand(MakeLine(&null_list),
-                            {"the operation: add or trim", 1, -1, &null_list},
-                            argc, argv, &args);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(
+          MakeLine(&null_list),
+          {"the operation: add or trim", 1, -1, &null_list}, argc, argv, &args);
+      status != kContinue) {
+    return status;
+  }
   const std::string op = args[0];
   args.erase(args.begin());
   if (op == "add") return Add(args);

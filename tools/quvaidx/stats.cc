@@ -66,9 +66,11 @@ Json::Value JsonNumber(long value) {
 int RunStats(int argc, char** argv) {
   bool json = false;
   std::vector<std::string> pid;
-  int status =
-      ParseCommand(MakeLine(&json), {"PID", 0, 1, nullptr}, argc, argv, &pid);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&json), {"PID", 0, 1, nullptr}, argc,
+                                argv, &pid);
+      status != kContinue) {
+    return status;
+  }
   Figures figures = {static_cast<int>(getpid()), -1, -1, -1, -1};
   if (!pid.empty() && !ParseInt(pid[0].c_str(), 1, INT_MAX, &figures.pid)) {
     return UsageError(kName, "PID needs a whole number from 1 to " +

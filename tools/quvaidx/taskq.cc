@@ -120,17 +120,9 @@ int Create(const Request& request) {
 
 int Push(const Request& request) {
   Json::Value task;
-  if (!ReadJsonObject(kName, request.json, "task",
-                      "{\"path\":\"/share/a.jpg\"}", &task)) {
-    return kExitError;
-  }
-  size_t size = Json::FastWriter().write(task).size();
-  if (size > kMaxTaskText) {
-    PrintError(kName, "the task is " + std::to_string(size) +
-                          " bytes long; a queue carries at most " +
-                          std::to_string(kMaxTaskText));
-    return kExitError;
-  }
+  const JsonInput input = {"task", "{\"path\":\"/share/a.jpg\"}", kMaxTaskText,
+                           "a queue"};
+  if (!ReadJsonObject(kName, request.json, input, &task)) return kExitError;
   int id = OpenQueue(request);
   if (id < 0) return kExitError;
   if (PushTaskToQueue(id, task, request.type_given ? request.type : 1) != 0) {
@@ -280,9 +272,11 @@ bool CheckRequest(Request* request, const std::vector<std::string>& args) {
 int RunTaskq(int argc, char** argv) {
   Request request;
   std::vector<std::string> args;
-  int status =
-      ParseCommand(MakeLine(&request), {"", 0, -1, nullptr}, argc, argv, &args);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&request), {"", 0, -1, nullptr}, argc,
+                                argv, &args);
+      status != kContinue) {
+    return status;
+  }
   if (!CheckRequest(&request, args)) return kExitError;
   const std::string& op = request.operation;
   if (op == "create") return Create(request);

@@ -67,12 +67,14 @@ quvaidx_tools::CommandLine MakeLine(Options* o) {
 int RunThumb(int argc, char** argv) {
   Options o;
   std::vector<std::string> paths;
-  int status = ParseCommand(MakeLine(&o), {"PATH", 1, -1, &o.null_list}, argc,
-                            argv, &paths);
-  if (status != kContinue) return status;
+  if (int status = ParseCommand(MakeLine(&o), {"PATH", 1, -1, &o.null_list},
+                                argc, argv, &paths);
+      status != kContinue) {
+    return status;
+  }
   PreviewQueuer queuer(kName, o.target);
   if (!queuer.Ready()) return kExitError;
-  status = kExitOk;
+  int status = kExitOk;
   for (const std::string& path : paths) {
     std::string resolved, report;
     PreviewQueuer::Outcome outcome = PreviewQueuer::kRefused;
