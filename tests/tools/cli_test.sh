@@ -295,7 +295,7 @@ case_daemons() {
   t 2 "quvaidx send: $UNKNOWN" send --daemon nosuchd '{"command":"HANDSHAKE"}'
   # A known name resolves to the directory's socket.
   if [ ! -e /tmp/quvaindexd_sock ]; then
-    t 2 "quvaidx send: cannot reach controld on /tmp/quvaindexd_sock: no such socket" \
+    t 2 "quvaidx send: cannot reach quvaindexd on /tmp/quvaindexd_sock: no such socket" \
       send --daemon controld --attempts 1 '{"command":"HANDSHAKE"}'
   fi
 }

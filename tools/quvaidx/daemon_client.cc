@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include "cli.h"
+#include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 
 namespace quvaidx_cli {
@@ -140,6 +141,15 @@ int Connect(const char* command, const DaemonClient& client, double start,
 }
 
 }  // namespace
+
+DaemonClient IndexDaemonClient(const std::string& name) {
+  DaemonInfo info;
+  DaemonClient client;
+  client.daemon = info.get(name, "bin");
+  client.daemon.erase(0, client.daemon.rfind('/') + 1);  // npos + 1 == 0
+  client.socket = info.get(name, "sock");
+  return client;
+}
 
 std::vector<quvaidx_tools::Option> DaemonOptions(DaemonClient* client,
                                                  std::string socket_help) {

@@ -39,6 +39,11 @@ struct DaemonClient {
   bool handshake = false;  // a HANDSHAKE must be answered before the request
 };
 
+// The client of the index daemon `name` (quvaidx/paths.h: "mediad"): its
+// socket from the daemon directory, named in messages by its program
+// ("quvamediaparserd").
+DaemonClient IndexDaemonClient(const std::string& name);
+
 // -s/--socket PATH (described as `socket_help`), -a/--attempts N and
 // -t/--timeout SECONDS, setting *client.
 std::vector<quvaidx_tools::Option> DaemonOptions(DaemonClient* client,

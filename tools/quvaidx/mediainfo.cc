@@ -26,7 +26,6 @@
 #include "commands.h"
 #include "daemon_client.h"
 #include "media_view.h"
-#include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/media_type.h"
 #include "quvaidx/mediainfo.h"
@@ -216,8 +215,7 @@ quvaidx_tools::CommandLine MakeLine(const char* name, Options* options) {
         "as --raw, with the fields that are 0 or\nempty"));
     flags.push_back(NullOption(&options->null_list));
   }
-  options->client.daemon = "quvamediaparserd";
-  options->client.socket = QUVAIDX_MEDIAD_SOCKET;
+  options->client = IndexDaemonClient("mediad");
   for (Option& option : DaemonOptions(
            &options->client, std::string("the daemon's socket (default\n") +
                                  QUVAIDX_MEDIAD_SOCKET + ")")) {

@@ -22,7 +22,6 @@
 #include "commands.h"
 #include "daemon_client.h"
 #include "preview_names.h"
-#include "quvaidx/daemon_info.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/paths.h"
 
@@ -71,8 +70,7 @@ constexpr PreviewCommand kPlugins = {
 // The command line of `command` with the options both commands share.
 quvaidx_tools::CommandLine MakeLine(const PreviewCommand& command,
                                     Options* options) {
-  options->client.daemon = "quvaindexplugind";
-  options->client.socket = DaemonInfo().get("plugind", "sock");
+  options->client = IndexDaemonClient("plugind");
   std::vector<quvaidx_tools::Option> flags = {
       JsonOption(&options->json, "print JSON")};
   if (&command == &kSizeMap) flags.push_back(NullOption(&options->null_list));

@@ -13,7 +13,6 @@
 #include "cli.h"
 #include "commands.h"
 #include "daemon_client.h"
-#include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 
 namespace quvaidx_cli {
@@ -87,8 +86,9 @@ bool ChooseSocket(Options* o) {
                             "'; known daemons: " + DaemonNameList());
       return false;
     }
-    o->client.socket = DaemonInfo().get(o->daemon, "sock");
-    o->client.daemon = o->daemon;
+    const DaemonClient known = IndexDaemonClient(o->daemon);
+    o->client.socket = known.socket;
+    o->client.daemon = known.daemon;
   }
   return CheckSocketPath(kName, o->client.socket);
 }
