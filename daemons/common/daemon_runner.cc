@@ -81,6 +81,17 @@ quvaidx_tools::CommandLine MakeCommandLine(const DaemonSpec& spec,
   line.description = summary + ".\n\n" + spec.description;
   line.version = VersionLine(spec.program);
   line.epilog = spec.epilog;
+  if (!line.epilog.empty()) line.epilog += "\n";
+  if (spec.default_socket != nullptr) {
+    line.epilog +=
+        "Started by a service manager that hands over a listening socket\n"
+        "(LISTEN_PID naming this process, LISTEN_FDS: descriptor 3, bound "
+        "to\nthe --socket path), the daemon serves that socket and leaves its "
+        "file\nto the manager.\n\n";
+  }
+  line.epilog +=
+      "Exit status: 0 after SIGTERM or SIGINT, 1 when the daemon cannot "
+      "start\n(why is printed on stderr), 2 on a usage error.\n";
   if (spec.default_socket != nullptr) {
     line.options.push_back(
         Text("socket", 's', "PATH", &settings->socket,
