@@ -200,6 +200,8 @@ case_serve_send() {
   echo keep >"$WORK/file"
   t 2 "quvaidx serve: a daemon is already listening on $sock" serve -s "$sock"
   t 2 "quvaidx serve: $WORK/file exists and is not a socket" serve -s "$WORK/file"
+  t 2 "quvaidx serve: cannot listen on $WORK/none/d.sock: No such file or directory" \
+    serve -s "$WORK/none/d.sock"
   [ "$(cat "$WORK/file")" = keep ] || fail "the file was changed"
   stop TERM "$sock"
   # --verbose: the library's debug lines reach stderr.

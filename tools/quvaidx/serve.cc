@@ -139,20 +139,17 @@ void OnStopSignal(evutil_socket_t signal_number, short, void* arg) {
   event_base_loopexit(stop->base, nullptr);
 }
 
-// Explains why the server could not listen on `path`. BuildServer has
-// decided and logged why; this only puts it in the user's words.
-std::string ListenFailure(const std::string& path) {
-  struct stat info;
-  if (lstat(path.c_str(), &info) != 0) {
-    return "cannot listen on " + path +
-           " (is its directory there and writable? --verbose shows the "
-           "library's report)";
+// Why the server could not listen on `path`, in the user's words, from the
+// errno BuildServer left.
+std::string ListenFailure(const std::string& path, int error) {
+  switch (error) {
+    case EADDRINUSE:  // the library removes only a socket nobody answers on
+      return "a daemon is already listening on " + path;
+    case EEXIST:
+      return path + " exists and is not a socket; not replacing it";
+    default:
+      return "cannot listen on " + path + ": " + strerror(error);
   }
-  if (!S_ISSOCK(info.st_mode)) {
-    return path + " exists and is not a socket; not replacing it";
-  }
-  // The library removes a socket nobody answers on: this one answered.
-  return "a daemon is already listening on " + path;
 }
 
 // True when another process holds the lock of `pid_file`, as a daemon that
@@ -183,7 +180,7 @@ int Serve(const std::string& path) {
       evsignal_add(sigint, nullptr) || evsignal_add(sigterm, nullptr)) {
     Fail("cannot watch for SIGINT and SIGTERM");
   } else if (BuildServer(base, path.c_str(), &args) != 0) {
-    Fail(ListenFailure(path));
+    Fail(ListenFailure(path, errno));
   } else {
     if (!g_detached) {
       printf("quvaidx serve: listening on %s\n", path.c_str());
