@@ -2,14 +2,14 @@
 // answers about files, as the library's callers receive them.
 //
 // Both send exactly the requests of QUVAIDX_GetMediaInfo and
-// QUVAIDX_GetMediaResolution ({"command": ..., "path": FILE}, one exchange
-// with AutoSendRecvPacket, descriptor -1, no handshake) and read the reply
-// the same way: it counts only when "success" is a boolean true or a
-// nonzero number; the record comes from "media" through
+// QUVAIDX_GetMediaResolution ({"command": ..., "path": FILE}, no handshake)
+// and read the reply the same way: it counts only when "success" is a boolean
+// true or a nonzero number; the record comes from "media" through
 // MediaInfoJson2Object, and "width" and "height" are read as 32-bit
-// integers (0 when missing or out of range). Only the waiting differs: the
-// library's calls wait up to half an hour for a daemon, the tool's exchange
-// (daemon_client.h) --attempts (default 3) seconds and --timeout in all. For
+// integers (0 when missing or out of range). Only the exchange differs: the
+// library's calls wait up to half an hour for a daemon and repeat a request
+// whose connection was closed, the tool's exchange (daemon_client.h) tries
+// --attempts (default 3) times within --timeout and sends it once. For
 // a video, the readable view also asks GET_VIDEO_METADATA, for its rotation
 // and pixel aspect.
 #include <errno.h>
