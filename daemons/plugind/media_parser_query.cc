@@ -2,9 +2,13 @@
 
 #include <errno.h>
 #include <poll.h>
+#include <stdlib.h>
 #include <string.h>
+#include <sys/syscall.h>
 #include <time.h>
 #include <unistd.h>
+
+#include <vector>
 
 #include <memory>
 
@@ -68,15 +72,64 @@ std::string ReceiveWithin(int fd, int stop_fd, long long deadline_ms,
   return "";
 }
 
+// The calling thread's effective ids and groups. The raw calls change this
+// thread alone; glibc's wrappers would change every thread of the process.
+bool SetThreadGroups(const std::vector<gid_t>& groups) {
+  return syscall(SYS_setgroups, groups.size(), groups.data()) == 0;
+}
+bool SetThreadEgid(gid_t gid) {
+  return syscall(SYS_setresgid, static_cast<gid_t>(-1), gid,
+                 static_cast<gid_t>(-1)) == 0;
+}
+bool SetThreadEuid(uid_t uid) {
+  return syscall(SYS_setresuid, static_cast<uid_t>(-1), uid,
+                 static_cast<uid_t>(-1)) == 0;
+}
+
 }  // namespace
 
-std::string AskMediaInfo(const PluginConfig& config, const std::string& path,
-                         Json::Value* media) {
+int ConnectAs(const quvaidx_daemons::FsUser& peer, const std::string& path,
+              int timeout_ms) {
+  const uid_t own_uid = geteuid();
+  if (peer.uid == 0 || peer.uid == own_uid) {
+    return ConnectDaemon(path.c_str(), timeout_ms);
+  }
+  const gid_t own_gid = getegid();
+  std::vector<gid_t> own_groups(static_cast<size_t>(getgroups(0, nullptr)));
+  if (getgroups(static_cast<int>(own_groups.size()), own_groups.data()) !=
+      static_cast<int>(own_groups.size())) {
+    return -2;
+  }
+  // Groups and group first: changing the user clears the privileges that
+  // both need.
+  int fd = -2;
+  int err = 0;
+  if (SetThreadGroups(peer.groups)) {
+    if (SetThreadEgid(peer.gid)) {
+      if (SetThreadEuid(peer.uid)) {
+        fd = ConnectDaemon(path.c_str(), timeout_ms);
+        err = errno;
+        // The saved user is still the daemon's: this cannot fail, and the
+        // thread must never go on as the peer.
+        if (!SetThreadEuid(own_uid)) abort();
+      }
+      if (!SetThreadEgid(own_gid)) abort();
+    }
+    if (!SetThreadGroups(own_groups)) abort();
+  }
+  if (fd == -1) errno = err;
+  return fd;
+}
+
+std::string AskMediaInfo(const PluginConfig& config,
+                         const quvaidx_daemons::FsUser& peer,
+                         const std::string& path, Json::Value* media) {
   const long long deadline =
       NowMs() + static_cast<long long>(config.media_parser_timeout_s) * 1000;
   const std::string no_answer = "the media parser does not answer";
-  int fd = ConnectDaemon(config.media_parser_socket.c_str(),
-                         config.media_parser_timeout_s * 1000);
+  int fd = ConnectAs(peer, config.media_parser_socket,
+                     config.media_parser_timeout_s * 1000);
+  if (fd == -2) return "cannot take the rights of the asking process";
   if (fd < 0) return no_answer + " (" + strerror(errno) + ")";
   Json::Value request(Json::objectValue);
   request["command"] = "GET_MEDIA_INFO";

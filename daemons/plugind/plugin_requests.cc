@@ -263,22 +263,22 @@ bool WebPlayable(const std::string& video, const std::string& audio,
          EqualsAny(container, {"mov", "m4v"});
 }
 
-// Opens `path` for reading as the peer, never waiting on a FIFO or device,
-// and checks that it is a regular file. Returns the descriptor, or -1 with
-// *reason set.
-int OpenVideo(const std::string& path, std::string* reason) {
-  int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
-  if (fd < 0) {
+// True when `path` is a regular file that the calling thread may open for
+// reading (opened without waiting on a FIFO or device, and closed again);
+// else false with *reason set.
+bool ReadableFile(const std::string& path, std::string* reason) {
+  Descriptor file(
+      open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (file.get() < 0) {
     *reason = errno == ENOENT ? "no such file" : strerror(errno);
-    return -1;
+    return false;
   }
   struct stat st;
-  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+  if (fstat(file.get(), &st) != 0 || !S_ISREG(st.st_mode)) {
     *reason = "not a regular file";
-    close(fd);  // only opened
-    return -1;
+    return false;
   }
-  return fd;
+  return true;
 }
 
 int VideoNeedConvert(const PluginConfig& config,
@@ -290,15 +290,12 @@ int VideoNeedConvert(const PluginConfig& config,
   answer["result"] = 0;
   std::string problem;
   std::string converted;
-  int fd = -1;
   {
     AsPeer as_peer(peer);
     if (!as_peer.ok()) return Fail(reply, kNoRights);
-    fd = OpenVideo(path, &problem);
-    if (fd < 0) return Fail(reply, problem);
+    if (!ReadableFile(path, &problem)) return Fail(reply, problem);
     if (BlQUVAIndexIsVideoFile(path.c_str())) converted = ConvertedCopy(path);
   }
-  Descriptor video(fd);
   if (!BlQUVAIndexIsVideoFile(path.c_str())) {
     *reply = answer;
     return 0;
@@ -308,13 +305,11 @@ int VideoNeedConvert(const PluginConfig& config,
     *reply = answer;
     return 0;
   }
-  // The media parser answers this daemon about any file; it is shown the
-  // very file the peer opened, never a path that could be swapped.
-  char opened[64];
-  snprintf(opened, sizeof(opened), "/proc/%d/fd/%d", static_cast<int>(getpid()),
-           video.get());
+  // The media parser is asked with the peer's credentials, so it opens the
+  // file as the peer: whatever is at the path by then, it reads only what
+  // the peer could.
   Json::Value media;
-  problem = AskMediaInfo(config, opened, &media);
+  problem = AskMediaInfo(config, peer, path, &media);
   if (!problem.empty()) return Fail(reply, problem);
   // About 13 KB, so not on a worker's stack.
   auto record = std::make_unique<__tag_QUVA_MEDIA_INFO>();

@@ -69,13 +69,11 @@
 // created and renamed relative to it: a link planted at the metadata
 // directory or below is refused, never followed.
 //
-// The media parser usually runs as root and answers root for any path. So
-// the daemon never sends it the peer's path: it opens the video as the peer
-// and names to the media parser that open descriptor
-// ("/proc/<daemon's pid>/fd/<n>"), which reaches exactly the file the peer
-// could open, whatever is renamed or swapped at the path meanwhile. The
-// media parser must therefore be able to open the daemon's descriptors
-// through /proc: root, or the daemon's own user.
+// The media parser runs as root and would answer the daemon about any file.
+// So the daemon asks it on a connection made with the peer's credentials
+// (media_parser_query.h): the media parser then opens the file as the peer,
+// and whatever is renamed or swapped at the path after the daemon's own
+// check, it reads only what the peer could read itself.
 //
 // Threads: HandlePluginRequest may run on several threads at once; the
 // identity it takes is that of the calling thread alone.

@@ -25,6 +25,7 @@
 #include <gtest/gtest.h>
 
 #include "daemon_process.h"
+#include "fs_identity.h"
 #include "quvaidx/daemon.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"
@@ -145,23 +146,38 @@ class PluginDaemonTest : public ::testing::Test {
     return reply;
   }
 
-  // A media parser that reports the first line of the file it is shown as
-  // the video codec, having first run `meanwhile` (as the swap of a path
-  // under the daemon's feet); it counts the questions.
+  // A media parser that, as the real one, reads a file only as the process
+  // that asks could (its credentials and groups from the connection), and
+  // reports the file's first line as the video codec, having first run
+  // `meanwhile` (as a swap of the path); it counts the questions.
   void ScriptParser(std::function<void()> meanwhile = nullptr) {
-    parser_ =
-        std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd, int) {
-          Json::Value request;
-          if (RecvPacket(fd, request) != 0) return;
-          ++asked_;
-          if (meanwhile) meanwhile();
-          std::string content = ReadFile(request["path"].asString());
-          Json::Value reply(Json::objectValue);
-          reply["success"] = true;
-          reply["media"]["szVideoCodec"] =
-              content.substr(0, content.find('\n'));
-          SendPacket(fd, reply);
-        });
+    parser_ = std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd,
+                                                                       int) {
+      Json::Value request;
+      if (RecvPacket(fd, request) != 0) return;
+      ++asked_;
+      if (meanwhile) meanwhile();
+      struct ucred peer;
+      socklen_t length = sizeof(peer);
+      quvaidx_daemons::FsUser user;
+      user.groups.resize(64);
+      socklen_t groups = 64 * sizeof(gid_t);
+      getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length);
+      getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, user.groups.data(), &groups);
+      user.groups.resize(groups / sizeof(gid_t));
+      user.uid = peer.uid;
+      user.gid = peer.gid;
+      std::string content;
+      {
+        quvaidx_daemons::FsIdentity as_peer(user);
+        if (as_peer.taken()) content = ReadFile(request["path"].asString());
+      }
+      Json::Value reply = MakeResponse(!content.empty(), nullptr);
+      if (content.empty()) reply["reason"] = "Permission denied";
+      reply["media"]["szVideoCodec"] = content.substr(0, content.find('\n'));
+      SendPacket(fd, reply);
+    });
+    chmod(media_.c_str(), 0666);  // as its socket unit leaves it
   }
 
   // Makes `path` (and its folders) with `content`, owned by `uid`, mode
@@ -263,8 +279,9 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
 // whether files in a 0700 folder exist, not the names of the photos there,
 // not the thumbnails behind a link planted towards them, not the codecs of
 // a root-only video (the media parser is not even asked), nor those of one
-// swapped in by name while the media parser is asked. What it may read is
-// answered, by the groups its process holds; root as before.
+// swapped in by name while the media parser is asked (it is asked as the
+// user). What it may read is answered, by the groups its process holds;
+// root as before.
 TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
   const std::string jpeg(64, 'j');
   const std::string mine = dir_.File("share/mallory/clip.mkv");
@@ -307,7 +324,9 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
       Request("GET_THUMB_SIZE_MAP", dir_.File("share/mallory/secret.jpg")));
   EXPECT_EQ(reply["size_map"], 0) << reply;
   reply = AskAs(kMallory, Request("IS_VIDEO_NEED_CONVERT", mine));
-  EXPECT_EQ(reply["video_codec"], "mallory's codec") << reply;
+  EXPECT_EQ(reply, MakeResponse(false,
+                                "the media parser cannot read the "
+                                "file: Permission denied"));
   reply = AskAs(kMallory,
                 Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/group.mkv")),
                 {48300});
