@@ -128,8 +128,8 @@ timeout 10 "$TOOL" plugins >/dev/null 2>&1 &&
 echo $$ >/var/run/quvaindexd.pid
 out=$(timeout 10 "$TOOL" plugins) || fail "plugins failed"
 [ "$out" = photo_thumbnail ] || fail "plugin names: '$out'"
-timeout 10 "$TOOL" daemons | grep -q '^plugind.*yes' ||
-  fail "quvaidx daemons does not show plugind alive"
+timeout 10 "$TOOL" daemons plugind | grep -q '^plugind.*yes' ||
+  fail "quvaidx daemons plugind does not show it alive, or exits non-zero"
 
 # Both daemons end on SIGTERM and take their files with them.
 kill -TERM "${PIDS[@]}"
