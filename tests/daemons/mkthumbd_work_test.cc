@@ -17,7 +17,6 @@
 
 #include <gtest/gtest.h>
 
-#include "fs_identity.h"
 #include "photo_fixtures.h"
 #include "preview_names.h"
 #include "quvaidx/system.h"
@@ -61,7 +60,6 @@ void Touch(const std::string& path) {
 class ThumbnailerTest : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
-    umask(022);  // thumbnails' modes below are read with this umask
     std::string error;
     ASSERT_TRUE(mkthumbd::InitThumbnailer("mkthumbd_work_test", &error))
         << error;
@@ -301,62 +299,6 @@ TEST_F(ThumbnailerTest, DecodesThatWouldExceedTheMemoryLimitAreRefused) {
           << c.name << ": " << result.reason;
     }
   }
-}
-
-// Run as root with the file-system identity of the folder's owner, as the
-// worker does: each thumbnail gets its photo's owner, group and read bits
-// (plus the owner's write bit), and a photo the owner cannot read gets
-// none, although root could read it.
-TEST_F(ThumbnailerTest, ThumbnailIsNeverMoreReadableThanItsPhoto) {
-  if (geteuid() != 0) GTEST_SKIP() << "needs root to own files as others";
-  const std::string folder = dir_.File("f");
-  ASSERT_TRUE(MakeOwnedDir(folder, kUserA, kUserA));
-  struct Case {
-    const char* name;
-    unsigned uid, gid, mode;
-    bool made;
-    unsigned thumb_mode;  // owner and group as the photo's
-  } cases[] = {
-      {"own.jpg", kUserA, kUserA, 0640, true, 0640},
-      {"private.jpg", kUserA, kUserA, 0400, true, 0600},
-      {"others.jpg", kUserB, kUserB, 0644, true, 0644},
-      {"root.jpg", 0, 0, 0600, false, 0},
-  };
-  for (const Case& c : cases) {
-    ASSERT_TRUE(WritePhoto(folder + "/" + c.name, 300, 200, kRed, kBlue));
-    ASSERT_TRUE(Own(folder + "/" + c.name, c.uid, c.gid, c.mode));
-  }
-  const int folder_fd = open(folder.c_str(), O_RDONLY | O_DIRECTORY);
-  ASSERT_GE(folder_fd, 0);
-  {
-    quvaidx_daemons::FsIdentity as_owner({kUserA, kUserA, {}});
-    ASSERT_TRUE(as_owner.taken());
-    for (const Case& c : cases) {
-      PhotoResult result = MakePhotoThumbnails(folder_fd, folder, c.name);
-      EXPECT_EQ(result.made, c.made ? kAllThumbSizes : 0)
-          << c.name << ": " << result.reason;
-      if (!c.made) {
-        EXPECT_NE(result.reason.find("Permission denied"), std::string::npos)
-            << result.reason;
-      }
-    }
-  }
-  close(folder_fd);
-  for (const Case& c : cases) {
-    for (const char* label : {"XL", "S"}) {
-      struct stat st;
-      const bool exists =
-          lstat(ThumbItem(folder + "/" + c.name, label).c_str(), &st) == 0;
-      ASSERT_EQ(exists, c.made) << c.name;
-      if (!exists) continue;
-      EXPECT_EQ(st.st_uid, c.uid) << c.name;
-      EXPECT_EQ(st.st_gid, c.gid) << c.name;
-      EXPECT_EQ(st.st_mode & 07777, c.thumb_mode) << c.name;
-    }
-  }
-  struct stat ea;
-  ASSERT_EQ(stat(dir_.File("f/.quvameta/own.jpg").c_str(), &ea), 0);
-  EXPECT_EQ(ea.st_uid, kUserA);  // made by the owner, not by root
 }
 
 // The queue walk, with a "thumbnail making" that records the photo and the
