@@ -286,7 +286,7 @@ TEST_F(ThumbWorkerTest, MakesTheFoldersOwnPhotosAndRefusesOtherEntries) {
   twice.insert(twice.end(), once.begin(), once.end());
   EXPECT_EQ(made_, twice);
   EXPECT_EQ(ReadFile(queue_), "");
-  EXPECT_EQ(worker.counts().entries_refused, 4);
+  EXPECT_EQ(worker.counts().entries_refused, 3);  // an empty line is none
   EXPECT_EQ(worker.counts().photos_made, 8);
 }
 
@@ -314,7 +314,9 @@ TEST_F(ThumbWorkerTest, FolderChangedDuringTheWorkGoesToTheBack) {
     ThumbWorker worker = Worker();
     for (int i = 0; i < 100 && worker.Step() != Did::kEntry; ++i) {
     }
-    EXPECT_EQ(ReadFile(queue_),
+    std::string entries = ReadFile(queue_);  // done entries become blank
+    entries.erase(0, entries.find_first_not_of('\n'));
+    EXPECT_EQ(entries,
               c.requeued ? "/other\n" + folder + "\n" : std::string("/other\n"))
         << c.change;
     EXPECT_EQ(worker.counts().entries_requeued, c.requeued ? 1 : 0) << c.change;
