@@ -36,7 +36,10 @@
 //   waited longest, and only when none has waited kAcceptPauseMs pauses
 //   accepting for that long, instead of ending the loop;
 // - BuildServer never removes anything at its socket path but a stale
-//   socket: it takes no socket away from a daemon that still answers on it.
+//   socket: it takes no socket away from a daemon that still answers on it;
+// - a daemon started by a service manager may instead serve the listening
+//   socket the manager bound for it (BuildServerOnSocket), which then stays
+//   the manager's: StopServer leaves its file in place.
 //
 // Log lines carry the module name "quvaidx_daemon" and go through
 // AppLogError.
@@ -135,8 +138,11 @@ QUVAIDX_API int BuildServer(struct event_base* base, const char* path,
 // - A socket on which a daemon still takes connections: left alone; -1, and
 //   a level-3 line saying it is in use.
 // - A regular file, directory, link or anything else, or a path that cannot
-//   be examined or removed: left alone; -1 and the level-3 line
-//   "remove <path>".
+//   be examined or probed: left alone; -1, and a level-3 line naming the
+//   path, what was found and "left alone" ("<path> is not a socket; left
+//   alone").
+// - A stale socket that cannot be removed: -1 and the level-3 line
+//   "remove <path> (<system error>)".
 // With `access` null the socket file gets the process's file-creation mask.
 // Otherwise it is created for the owner alone (0600 at most, where the
 // system allows setting a socket's mode before binding it), then given
@@ -148,11 +154,34 @@ QUVAIDX_API int BuildServer(struct event_base* base, const char* path,
 // must not end the daemon.
 // Returns 0 with g_listener set. Returns -1, with g_listener unchanged, on
 // the refusals above, when a server already runs, when the listener cannot
-// be created, or when the path is longer than kMaxSocketPath bytes (nothing
-// is examined or created then). Each failure is logged at level 3.
+// be created ("Could not create a listener: <path> (<system error>)"), or
+// when the path is longer than kMaxSocketPath bytes (nothing is examined or
+// created then). Each failure is logged at level 3, and errno says why, for
+// a daemon to tell whoever started it: EADDRINUSE (a daemon answers at the
+// path), EEXIST (something other than a socket is there, or it changed
+// while examined), ENAMETOOLONG, EBUSY (a server already runs), or the
+// system's error (EACCES, ENOENT, ...) of examining, removing, binding or
+// listening.
 QUVAIDX_API int BuildServerWithAccess(struct event_base* base, const char* path,
                                       EventArgs* args,
                                       const ServerSocketAccess* access);
+
+// Serves connections on `fd`, a socket that a service manager (systemd's
+// socket activation, say) has bound and set listening for this daemon, so
+// that nobody else could take its path while the daemon was not running.
+// `fd` must be a listening Unix-domain stream socket bound to `path`, when
+// `path` is not null; it is made non-blocking and close-on-exec, and keeps
+// the backlog, mode and owner its manager gave it. On success the server
+// owns the descriptor and closes it when it stops, while the socket file
+// stays the manager's: StopServer does not remove it. Otherwise as
+// BuildServerWithAccess after the socket is made.
+// Returns 0 with g_listener set. Returns -1, with `fd` still the caller's
+// and g_listener unchanged, when a server already runs (EBUSY), or when
+// `fd` is not a socket (ENOTSOCK), is another kind of socket or does not
+// listen (EINVAL), or is bound to another path (EADDRNOTAVAIL); each
+// logged at level 3 ("the socket handed over (fd N) ...; not used").
+QUVAIDX_API int BuildServerOnSocket(struct event_base* base, int fd,
+                                    const char* path, EventArgs* args);
 
 // Sets the limits of the running server and of later ones; null restores
 // the defaults (kPacketDeadlineMs, kIdleDeadlineMs, kMaxTotalPendingOutput).
@@ -170,8 +199,9 @@ QUVAIDX_API void SetServerLimits(const ServerLimits* limits);
 QUVAIDX_API int GetPeerCredentials(PeerCredentials* peer);
 
 // When a server runs: frees its listener (closing the listening socket),
-// sets g_listener to null and removes the file at `path`. Otherwise does
-// nothing. Open connections are left alone. Always returns 0.
+// sets g_listener to null and removes the file at `path`, unless the socket
+// was handed over (BuildServerOnSocket). Otherwise does nothing. Open
+// connections are left alone. Always returns 0.
 QUVAIDX_API int StopServer(const char* path);
 
 // Returns g_conn_count.

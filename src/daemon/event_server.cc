@@ -49,6 +49,9 @@ struct event* g_accept_resume = nullptr;
 // The connection whose request the handler is answering; null outside
 // handler calls (GetPeerCredentials).
 struct bufferevent* g_handler_connection = nullptr;
+// Whether the running server made its socket file (BuildServerWithAccess)
+// and so removes it when it stops.
+bool g_owns_socket_file = false;
 
 const char* DaemonName(void* args) {
   const EventArgs* event_args = static_cast<const EventArgs*>(args);
@@ -215,11 +218,13 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
   if (!quvaidx::BuildUnixAddress(path, &address)) {
     AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
                 path != nullptr ? path : "(null)");
+    errno = ENAMETOOLONG;
     return -1;
   }
   if (g_listener != nullptr) {
     AppLogError(3, "%s:%d [Error] a server is already running, not at %s",
                 kModule, __LINE__, path);
+    errno = EBUSY;
     return -1;
   }
   int fd = quvaidx::BindServerSocket(path, address, access);
@@ -230,8 +235,9 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
       LEV_OPT_CLOSE_ON_FREE | LEV_OPT_REUSEABLE | LEV_OPT_CLOSE_ON_EXEC;
   g_listener = evconnlistener_new(base, OnAccept, args, flags, 16, fd);
   if (g_listener == nullptr || !quvaidx::StartDeadlines(base, args)) {
-    AppLogError(3, "%s:%d [Error] Could not create a listener: %s", kModule,
-                __LINE__, path);
+    int err = g_listener == nullptr ? errno : ENOMEM;
+    AppLogError(3, "%s:%d [Error] Could not create a listener: %s (%s)",
+                kModule, __LINE__, path, strerror(err));
     if (g_listener != nullptr) {
       evconnlistener_free(g_listener);  // closes fd
       g_listener = nullptr;
@@ -239,10 +245,44 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
       close(fd);
     }
     unlink(path);  // ours, made just now
+    errno = err;
     return -1;
   }
   evconnlistener_set_error_cb(g_listener, OnAcceptError);
   IgnoreBrokenPipes();
+  g_owns_socket_file = true;
+  return 0;
+}
+
+int BuildServerOnSocket(struct event_base* base, int fd, const char* path,
+                        EventArgs* args) {
+  if (g_listener != nullptr) {
+    AppLogError(3, "%s:%d [Error] a server is already running, not on fd %d",
+                kModule, __LINE__, fd);
+    errno = EBUSY;
+    return -1;
+  }
+  if (quvaidx::AdoptListeningSocket(fd, path) != 0) return -1;
+  // The deadlines first: once the listener exists it owns fd, which stays
+  // the caller's on failure.
+  int err = ENOMEM;
+  if (quvaidx::StartDeadlines(base, args)) {
+    // Backlog 0: the socket listens already, with its owner's backlog.
+    g_listener = evconnlistener_new(
+        base, OnAccept, args, LEV_OPT_CLOSE_ON_FREE | LEV_OPT_CLOSE_ON_EXEC, 0,
+        fd);
+    err = errno;
+  }
+  if (g_listener == nullptr) {
+    quvaidx::StopDeadlines();
+    AppLogError(3, "%s:%d [Error] Could not create a listener: fd %d (%s)",
+                kModule, __LINE__, fd, strerror(err));
+    errno = err;
+    return -1;
+  }
+  evconnlistener_set_error_cb(g_listener, OnAcceptError);
+  IgnoreBrokenPipes();
+  g_owns_socket_file = false;
   return 0;
 }
 
@@ -255,7 +295,9 @@ int StopServer(const char* path) {
   quvaidx::StopDeadlines();
   evconnlistener_free(g_listener);
   g_listener = nullptr;
-  if (path != nullptr) unlink(path);  // don't care if this fails
+  // A socket handed over belongs to whoever bound it. The removal's
+  // outcome is not examined.
+  if (path != nullptr && g_owns_socket_file) unlink(path);
   return 0;
 }
 

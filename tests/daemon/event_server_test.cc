@@ -303,15 +303,20 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   mkdir(dir_.File("dir").c_str(), 0700);
   symlink(dir_.File("stale.sock").c_str(), dir_.File("link").c_str());
   const std::string in_use = " is in use: a daemon listens there";
+  const std::string other = " is not a socket; left alone";
   struct Case {
     const char* name;
     int result;
     std::string line;  // after "quvaidx_daemon:N [Error] " and the path
+    int error;         // errno after a refusal
     mode_t type;       // what is at the path afterwards
   } cases[] = {
-      {"absent.sock", 0, "", S_IFSOCK},    {"stale.sock", 0, "", S_IFSOCK},
-      {"live.sock", -1, in_use, S_IFSOCK}, {"file", -1, "remove", S_IFREG},
-      {"dir", -1, "remove", S_IFDIR},      {"link", -1, "remove", S_IFLNK},
+      {"absent.sock", 0, "", 0, S_IFSOCK},
+      {"stale.sock", 0, "", 0, S_IFSOCK},
+      {"live.sock", -1, in_use, EADDRINUSE, S_IFSOCK},
+      {"file", -1, other, EEXIST, S_IFREG},
+      {"dir", -1, other, EEXIST, S_IFDIR},
+      {"link", -1, other, EEXIST, S_IFLNK},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -319,6 +324,7 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
     struct stat before = {};
     lstat(path.c_str(), &before);
     LogCapture log;
+    errno = 0;
     EXPECT_EQ(BuildServer(base_, path.c_str(), &args_), c.result);
     EXPECT_EQ(g_listener != nullptr, c.result == 0);
     struct stat after = {};
@@ -329,13 +335,59 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
       StopServer(path.c_str());
       continue;
     }
+    EXPECT_EQ(errno, c.error);
     EXPECT_EQ(after.st_ino, before.st_ino);
-    const std::string line =
-        c.line == in_use ? path + c.line : c.line + " " + path;
-    EXPECT_EQ(log.Normalized(),
-              std::vector<std::string>{"quvaidx_daemon:N [Error] " + line});
+    EXPECT_EQ(
+        log.Normalized(),
+        std::vector<std::string>{"quvaidx_daemon:N [Error] " + path + c.line});
   }
   close(live);
+}
+
+// A socket handed over is served only when it is a listening Unix stream
+// socket bound to the expected path; the server closes its descriptor when
+// it stops but never removes the file, which belongs to whoever bound it.
+TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
+  int datagram = socket(AF_UNIX, SOCK_DGRAM, 0);
+  int unbound = socket(AF_UNIX, SOCK_STREAM, 0);
+  int elsewhere = ListenUnix(dir_.File("elsewhere.sock"), 4);
+  int pipe_ends[2];
+  ASSERT_EQ(pipe(pipe_ends), 0);
+  struct Case {
+    const char* name;
+    int fd;
+    int error;
+  } refused[] = {{"pipe", pipe_ends[0], ENOTSOCK},
+                 {"datagram", datagram, EINVAL},
+                 {"not listening", unbound, EINVAL},
+                 {"other path", elsewhere, EADDRNOTAVAIL}};
+  for (const Case& c : refused) {
+    SCOPED_TRACE(c.name);
+    LogCapture log;
+    errno = 0;
+    EXPECT_EQ(BuildServerOnSocket(base_, c.fd, path_.c_str(), &args_), -1);
+    EXPECT_EQ(errno, c.error);
+    EXPECT_EQ(g_listener, nullptr);
+    EXPECT_EQ(fcntl(c.fd, F_GETFL) & O_NONBLOCK, 0) << "the descriptor changed";
+    EXPECT_EQ(log.lines().size(), 1u);
+    close(c.fd);
+  }
+  close(pipe_ends[1]);
+  int handed = ListenUnix(path_, 4);
+  ASSERT_EQ(BuildServerOnSocket(base_, handed, path_.c_str(), &args_), 0);
+  EXPECT_NE(fcntl(handed, F_GETFL) & O_NONBLOCK, 0);
+  int fd = Connect();
+  Send(fd, Request("HANDSHAKE"));
+  EXPECT_EQ(ReceiveBody(fd), "{}\n");
+  StopServer(path_.c_str());
+  struct stat st;
+  EXPECT_EQ(lstat(path_.c_str(), &st), 0) << "the manager's socket was removed";
+  EXPECT_EQ(fcntl(handed, F_GETFD), -1) << "the descriptor was not closed";
+  // A server built later on its own socket removes it again.
+  unlink(path_.c_str());
+  Start();
+  StopServer(path_.c_str());
+  EXPECT_NE(lstat(path_.c_str(), &st), 0);
 }
 
 // An overlong path is refused, not cut: the file at the cut path stays. A
