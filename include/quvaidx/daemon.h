@@ -13,7 +13,9 @@
 // Threads: single-threaded. Every function and callback here runs on the
 // thread that runs the daemon's event loop; g_listener and g_conn_count are
 // plain variables without locking. A slow handler holds up every connection
-// of the daemon.
+// of the daemon; a handler whose answer takes long takes the reply away
+// (DeferReply), has the work done elsewhere, and sends the reply later from
+// the loop (SendDeferredReply), while the server answers other connections.
 //
 // Robustness:
 // - a handler that throws is logged and its connection closed;
@@ -24,7 +26,9 @@
 // - a reply too large for a packet is replaced by
 //   {"success":false,"reason":"reply too large"};
 // - every complete request in a connection's input buffer is answered, in
-//   order, in the same callback;
+//   order, in the same callback, unless a handler defers a reply: then the
+//   connection's later requests wait (64 KiB of them at most are read) until
+//   that reply has been sent, and other connections are served meanwhile;
 // - a peer that shuts down its sending side still gets every reply queued
 //   for it before the server closes the connection;
 // - a connection stops being read while more than kMaxPendingOutput bytes of
@@ -50,6 +54,8 @@
 #include <stdint.h>
 #include <sys/socket.h>
 #include <sys/types.h>
+
+#include <vector>
 
 #include <json/json.h>
 
@@ -87,12 +93,15 @@ struct ServerLimits {
 };
 
 struct EventArgs;
+// A request whose reply a handler took away to send later (DeferReply).
+struct DeferredReply;
 
 // A daemon's request handler. It fills `reply` (see MakeResponse) and
 // returns 0 to have the reply sent; any other result ends the connection
 // without a reply and without reading further requests (replies already
 // queued for earlier requests of the same connection are still delivered
-// before it closes). GetPeerCredentials tells it who is asking.
+// before it closes). GetPeerCredentials and GetPeerGroups tell it who is
+// asking; DeferReply lets it answer later.
 typedef int (*EventHandler)(Json::Value& request, Json::Value& reply,
                             EventArgs* args);
 
@@ -197,6 +206,56 @@ QUVAIDX_API void SetServerLimits(const ServerLimits* limits);
 // returns 0. Returns -1, leaving *peer unchanged, outside a handler call (or
 // when peer is null or the system does not tell).
 QUVAIDX_API int GetPeerCredentials(PeerCredentials* peer);
+
+// During a handler call: stores in *groups the supplementary groups of the
+// process on the other end of the connection whose request is being
+// handled, as the kernel holds them (which may differ from what the group
+// database lists for its user): those the process had when it connected
+// (SO_PEERGROUPS), or, where the system does not record them, those its
+// /proc/PID/status lists, used only while that process still runs with the
+// effective user and group it connected with. The primary group is the gid
+// of GetPeerCredentials and may or may not be among them.
+// Returns 0. Returns -1, leaving *groups unchanged, outside a handler call,
+// when groups is null, or when the groups cannot be told (logged at level 3
+// when the process's status text refused them); a caller that decides
+// access by them then refuses.
+QUVAIDX_API int GetPeerGroups(std::vector<gid_t>* groups);
+
+// During a handler call: takes the reply of the request being handled away
+// from the server, so that the daemon can send it later with
+// SendDeferredReply, for example when another thread has done the work.
+// The handler then returns 0 (its `reply` is not sent). Until the deferred
+// reply is sent, the connection's later requests wait unanswered (at most
+// 64 KiB of them are read meanwhile), so the replies of one connection keep
+// the order of its requests; other connections are answered as usual. The
+// server's bounds hold throughout: a connection may wait for its deferred
+// reply as long as the idle deadline (ServerLimits) allows, and a peer that
+// ends its stream meanwhile still gets the reply and the answers to the
+// requests it sent before, as for any reply.
+// Returns the request's handle, owned by the daemon until it passes it to
+// SendDeferredReply. Returns null (logged at level 3) outside a handler
+// call, for a second deferral in the same call, for a connection the server
+// did not accept itself (one a daemon serves with these callbacks on a
+// listener of its own), or when memory runs out; the handler then answers
+// as usual.
+QUVAIDX_API DeferredReply* DeferReply();
+
+// Sends `reply` as the answer to the deferred request `deferred` and frees
+// the handle; then answers the connection's waiting requests. With `reply`
+// null, ends the connection without an answer instead, as a handler's
+// non-zero result does. When the connection closed meanwhile (its peer went,
+// a deadline or a bound of the server ended it), only frees the handle.
+// A reply too large for a packet is replaced as a handler's is.
+// REQUIRES: on the loop's thread, outside handler calls (from an event
+// callback of the daemon's own), with a handle from DeferReply not yet
+// passed here.
+// Returns 0 when the reply was queued (or, with `reply` null, the connection
+// ended); -1 when the connection had closed, when the reply could not be
+// queued, when the server's bound on unsent replies closed the connection
+// at once, or, with the handle untouched, when called inside a handler call
+// or with a null handle.
+QUVAIDX_API int SendDeferredReply(DeferredReply* deferred,
+                                  const Json::Value* reply);
 
 // When a server runs: frees its listener (closing the listening socket),
 // sets g_listener to null and removes the file at `path`, unless the socket

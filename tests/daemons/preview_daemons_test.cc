@@ -1,9 +1,7 @@
-// The preview daemons as real processes in a private directory:
+// The thumbnail daemon as a real process in a private directory:
 // quvamkthumbd on its own queue and pid file (woken by SIGUSR1, bad photos
-// skipped, stopped or killed in the middle of an entry and started again),
-// and quvaindexplugind on its own socket, asked with the library's typed
-// requests (pointed at it through the library's socket seam) with a
-// scripted media parser beside it.
+// skipped, stopped or killed in the middle of an entry and started again).
+// The plug-in daemon's process tests are in plugind_daemon_test.cc.
 #include <fcntl.h>
 #include <signal.h>
 #include <string.h>
@@ -11,7 +9,6 @@
 #include <time.h>
 #include <unistd.h>
 
-#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -19,18 +16,11 @@
 
 #include "daemon_process.h"
 #include "photo_fixtures.h"
-#include "quvaidx/index_requests.h"
-#include "quvaidx/ipc.h"
 #include "quvaidx/system.h"
-#include "requests/index_requests_internal.h"
-#include "support/fake_host.h"
 #include "support/fd_check.h"
-#include "support/scripted_peer.h"
 
 namespace {
 
-using quvahost::test::FakeHost;
-using quvahost::test::HostOp;
 using quvaidx::daemon_test::DaemonProcess;
 using quvaidx::daemon_test::kBlue;
 using quvaidx::daemon_test::kRed;
@@ -38,7 +28,6 @@ using quvaidx::daemon_test::NamesUnder;
 using quvaidx::daemon_test::ThumbItem;
 using quvaidx::daemon_test::WaitUntil;
 using quvaidx::test::ReadFile;
-using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
@@ -179,87 +168,6 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
            !daemon.Running();
   });
   EXPECT_TRUE(daemon.Running()) << daemon.Errors();
-}
-
-// The plug-in daemon answers what the library's typed requests send, and
-// the library reads its answers; SIGTERM ends it with its socket and pid
-// file gone.
-TEST(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
-  TempDir dir;
-  const std::string socket = dir.File("plugind.sock");
-  const std::string media = dir.File("mediaparser.sock");
-  const std::string pid_file = dir.File("plugind.pid");
-  const std::string photo = dir.File("share/a.jpg");
-  const std::string video = dir.File("share/clip.mkv");
-  const std::string copy =
-      dir.File("share/.quvameta/clip.mkv/QUVAPHOTO_FILM_M.mp4");
-  std::filesystem::create_directories(dir.File("share/.quvameta/a.jpg"));
-  std::filesystem::create_directories(dir.File("share/.quvameta/clip.mkv"));
-  for (const std::string& file : {photo, video}) WriteFile(file, "media");
-  const quvaidx::IndexSockets previous =
-      quvaidx::SetIndexSockets({media.c_str(), socket.c_str()});
-  // Plug-ins are named only while their pid file names a live process:
-  // not when it is missing (web_video) or names a dead one.
-  WriteFile(dir.File("quvamkthumbd.pid"), std::to_string(getpid()));
-  WriteFile(dir.File("dead.pid"), "999999999");
-  DaemonProcess daemon;
-  ASSERT_TRUE(
-      daemon.Start(PLUGIND_PATH,
-                   {"--foreground", "--socket", socket, "--pidfile", pid_file,
-                    "--media-parser", media, "--plugin",
-                    "photo_thumbnail=" + dir.File("quvamkthumbd.pid"),
-                    "--plugin", "web_video=" + dir.File("quvamkflvd.pid"),
-                    "--plugin", "other=" + dir.File("dead.pid")},
-                   dir.path(), "plugind", "listening"))
-      << daemon.Errors();
-
-  const std::string jpeg(64, 'j');
-  WriteFile(dir.File("share/.quvameta/a.jpg/QUVAPHOTO_THUMB_XL.jpg"), jpeg);
-  WriteFile(dir.File("share/.quvameta/a.jpg/QUVAPHOTO:THUMB_S.jpg"), jpeg);
-  int map = -1;
-  EXPECT_EQ(QUVAIDX_GetThumbSizeMap(photo.c_str(), THUMB_TYPE_PHOTO, &map), 0);
-  EXPECT_EQ(map, 0x9);
-  map = -1;
-  EXPECT_EQ(QUVAIDX_GetDirThumbSizeMap(dir.File("share").c_str(),
-                                       THUMB_TYPE_PHOTO, &map),
-            0);
-  EXPECT_EQ(map, 0x9);
-
-  ScriptedPeer parser(media, [](int& fd, int) {
-    Json::Value request;
-    if (RecvPacket(fd, request) != 0) return;
-    Json::Value reply(Json::objectValue);
-    reply["success"] = true;
-    reply["media"]["szVideoCodec"] = "hevc";
-    SendPacket(fd, reply);
-  });
-  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 1);
-  WriteFile(copy, "converted video");
-  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 0);
-  static __tag_QUVA_MEDIA_INFO source;
-  static __tag_QUVA_MEDIA_INFO converted;
-  snprintf(source.szPath, sizeof(source.szPath), "%s", video.c_str());
-  snprintf(converted.szPath, sizeof(converted.szPath), "%s", copy.c_str());
-  EXPECT_EQ(QUVAIDX_IndexConvertAdd(&source, &converted, Json::Value("job 7")),
-            0);
-  Json::Value record;
-  ASSERT_TRUE(Json::Reader().parse(ReadFile(copy + ".json"), record));
-  EXPECT_EQ(record["conversion_type"], "CONVERTA_MEDIUM");
-  EXPECT_EQ(record["package"], "job 7");
-
-  FakeHost host;  // the index daemon counts as alive for this process
-  host.Answer(HostOp::kProcAliveByPidFile, {1});
-  Json::Value names;
-  EXPECT_EQ(QUVAIDX_GetAllPluginName(names), 0);
-  Json::Value expected(Json::arrayValue);
-  expected.append("photo_thumbnail");
-  EXPECT_EQ(names, expected);
-
-  ASSERT_TRUE(daemon.Signal(SIGTERM));
-  EXPECT_TRUE(daemon.WaitExit(10));
-  EXPECT_FALSE(Exists(socket));
-  EXPECT_FALSE(Exists(pid_file));
-  quvaidx::SetIndexSockets(previous);
 }
 
 }  // namespace

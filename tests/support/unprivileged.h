@@ -6,6 +6,7 @@
 #define QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 
 #include <functional>
+#include <vector>
 
 namespace quvaidx::test {
 
@@ -16,6 +17,13 @@ constexpr unsigned kNobody = 65534;
 // becomes user and group kNobody. Returns the value `check` returned, or -1
 // when the child could not run it.
 int RunUnprivileged(const std::function<int()>& check);
+
+// Runs `check` in a child process that first becomes user `uid` with
+// primary group `gid` and supplementary groups `groups` (real, effective and
+// saved ids alike), which needs root. Returns the value `check` returned, or
+// -1 when the child could not become that user or did not finish.
+int RunAsUser(unsigned uid, unsigned gid, const std::vector<unsigned>& groups,
+              const std::function<int()>& check);
 
 // Runs `check` in a child process whose files cannot grow beyond `bytes`
 // (RLIMIT_FSIZE, with SIGXFSZ ignored): a write that crosses the limit
