@@ -187,116 +187,143 @@ TEST_F(RealTree, OverlongItemPathNeverTouchesTheFileItsCutNames) {
                IsEAFileExist(ea_dir.c_str(), nullptr, "victim", nullptr));
 }
 
-}  // namespace
+// What a user may plant where a directory or an item should be.
+enum class Plant {
+  kNone,
+  kDir,
+  kFile,
+  kLinkToDir,
+  kLinkToFile,
+  kDangling,
+  kFifo
+};
 
-// What a user may plant in a photo folder, where the metadata directory
-// (.quvameta) or the EA directory (.quvameta/a.jpg) should be. `outside` is
-// a directory the walk must never reach: it holds a file "victim".
-struct Planted {
+// A photo folder with its metadata directory, EA directory and items x and
+// y planted, and beside it `outside`, where a followed link would lead: the
+// file "victim" and the directory "d" with items x, y, a.jpg/x, a.jpg/y,
+// none of which may be seen, changed or removed.
+class PlantedTree {
+ public:
+  PlantedTree(Plant hidden, Plant ea, Plant x = Plant::kNone,
+              Plant y = Plant::kNone) {
+    mkdir(outside_.File("d").c_str(), 0755);
+    mkdir(outside_.File("d/a.jpg").c_str(), 0755);
+    for (const char* name : kOutsideFiles)
+      WriteFile(outside_.File(name), "root's");
+    PlantAt(hidden_, hidden);
+    PlantAt(ea_, ea);
+    PlantAt(ea_ + "/x", x);
+    PlantAt(ea_ + "/y", y);
+  }
+
+  bool OutsideUntouched() const {
+    std::set<std::string> found;
+    for (const auto& entry :
+         std::filesystem::recursive_directory_iterator(outside_.path())) {
+      found.insert(entry.path().lexically_relative(outside_.path()));
+    }
+    std::set<std::string> expected = {"d", "d/a.jpg"};
+    for (const char* name : kOutsideFiles) {
+      expected.insert(name);
+      if (ReadFile(outside_.File(name)) != "root's") return false;
+    }
+    return found == expected;
+  }
+
+  TempDir dir_, outside_;  // first: the paths below are made from them
+  std::string media_ = dir_.File("a.jpg"), hidden_ = dir_.File(".quvameta"),
+              ea_ = hidden_ + "/a.jpg";
+
+ private:
+  static constexpr const char* kOutsideFiles[] = {"victim", "d/x", "d/y",
+                                                  "d/a.jpg/x", "d/a.jpg/y"};
+
+  void PlantAt(const std::string& path, Plant kind) const {
+    const std::string to = outside_.File(kind == Plant::kLinkToDir    ? "d"
+                                         : kind == Plant::kLinkToFile ? "victim"
+                                                                      : "none");
+    switch (kind) {
+      case Plant::kNone:
+        break;
+      case Plant::kDir:
+        mkdir(path.c_str(), 0755);
+        break;
+      case Plant::kFile:
+        WriteFile(path, "12345");
+        break;
+      case Plant::kFifo:
+        mkfifo(path.c_str(), 0666);
+        break;
+      default:
+        symlink(to.c_str(), path.c_str());
+        break;
+    }
+  }
+};
+
+// The metadata directory (.quvameta) and the EA directory (.quvameta/a.jpg)
+// as a user may plant them.
+struct DirCase {
   const char* what;
-  std::function<void(const std::string& hidden, const std::string& ea,
-                     const std::string& outside)>
-      plant;
-  int error_open;    // errno without create, 0: opened
-  int error_create;  // errno with create, 0: opened
+  Plant hidden, ea;
+  int error_open;    // errno of OpenEADir without create, 0: opened
+  int error_create;  // and with create
   bool refused;      // a refusal is logged
 };
 
-const Planted kPlanted[] = {
-    {"nothing", [](auto&, auto&, auto&) {}, ENOENT, 0, false},
-    {"both directories",
-     [](auto& hidden, auto& ea, auto&) {
-       mkdir(hidden.c_str(), 0755);
-       mkdir(ea.c_str(), 0755);
-     },
-     0, 0, false},
-    {"metadata dir links to a directory elsewhere",
-     [](auto& hidden, auto&, auto& outside) {
-       symlink(outside.c_str(), hidden.c_str());
-     },
-     ELOOP, ELOOP, true},
-    {"EA dir links to a directory elsewhere",
-     [](auto& hidden, auto& ea, auto& outside) {
-       mkdir(hidden.c_str(), 0755);
-       symlink(outside.c_str(), ea.c_str());
-     },
-     ELOOP, ELOOP, true},
-    {"EA dir links to a file elsewhere",
-     [](auto& hidden, auto& ea, auto& outside) {
-       mkdir(hidden.c_str(), 0755);
-       symlink((outside + "/victim").c_str(), ea.c_str());
-     },
-     ELOOP, ELOOP, true},
-    {"dangling link at the metadata dir",
-     [](auto& hidden, auto&, auto& outside) {
-       symlink((outside + "/new").c_str(), hidden.c_str());
-     },
-     ELOOP, ELOOP, true},
-    {"dangling link at the EA dir",
-     [](auto& hidden, auto& ea, auto& outside) {
-       mkdir(hidden.c_str(), 0755);
-       symlink((outside + "/new").c_str(), ea.c_str());
-     },
-     ELOOP, ELOOP, true},
-    {"FIFO at the metadata dir",
-     [](auto& hidden, auto&, auto&) { mkfifo(hidden.c_str(), 0666); }, ENOTDIR,
-     ENOTDIR, true},
-    {"FIFO at the EA dir",
-     [](auto& hidden, auto& ea, auto&) {
-       mkdir(hidden.c_str(), 0755);
-       mkfifo(ea.c_str(), 0666);
-     },
-     ENOTDIR, ENOTDIR, true},
-    {"regular file at the metadata dir",
-     [](auto& hidden, auto&, auto&) { WriteFile(hidden, "in the way"); },
-     ENOTDIR, 0, false},
-    {"regular file at the EA dir",
-     [](auto& hidden, auto& ea, auto&) {
-       mkdir(hidden.c_str(), 0755);
-       WriteFile(ea, "in the way");
-     },
-     ENOTDIR, 0, false},
+const DirCase kDirCases[] = {
+    {"nothing", Plant::kNone, Plant::kNone, ENOENT, 0, false},
+    {"both directories", Plant::kDir, Plant::kDir, 0, 0, false},
+    {"metadata dir links elsewhere", Plant::kLinkToDir, Plant::kNone, ELOOP,
+     ELOOP, true},
+    {"EA dir links elsewhere", Plant::kDir, Plant::kLinkToDir, ELOOP, ELOOP,
+     true},
+    {"EA dir links to a file", Plant::kDir, Plant::kLinkToFile, ELOOP, ELOOP,
+     true},
+    {"dangling link at the metadata dir", Plant::kDangling, Plant::kNone, ELOOP,
+     ELOOP, true},
+    {"dangling link at the EA dir", Plant::kDir, Plant::kDangling, ELOOP, ELOOP,
+     true},
+    {"FIFO at the metadata dir", Plant::kFifo, Plant::kNone, ENOTDIR, ENOTDIR,
+     true},
+    {"FIFO at the EA dir", Plant::kDir, Plant::kFifo, ENOTDIR, ENOTDIR, true},
+    {"file at the metadata dir", Plant::kFile, Plant::kNone, ENOTDIR, 0, false},
+    {"file at the EA dir", Plant::kDir, Plant::kFile, ENOTDIR, 0, false},
 };
 
 // Every planted entry, without and with create, from the folder's path and
 // from a descriptor of the folder: a link or special file is refused,
-// logged and left in place, and nothing outside the folder changes.
+// logged and left in place, a regular file is replaced only when creating.
 TEST(OpenEADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
-  for (const Planted& c : kPlanted) {
+  for (const DirCase& c : kDirCases) {
     for (int create : {0, 1}) {
       for (bool by_fd : {false, true}) {
         SCOPED_TRACE(std::string(c.what) + (create ? ", create" : "") +
                      (by_fd ? ", folder fd" : ""));
-        TempDir dir, outside;
-        WriteFile(outside.File("victim"), "root's");
-        const std::string hidden = dir.File(".quvameta");
-        const std::string ea = hidden + "/a.jpg";
-        c.plant(hidden, ea, outside.path());
-        const mode_t hidden_kind = KindAt(hidden), ea_kind = KindAt(ea);
-        const int folder = by_fd ? open(dir.path().c_str(), O_RDONLY) : -1;
+        PlantedTree tree(c.hidden, c.ea);
+        const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
+        const int folder =
+            by_fd ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
         quvaidx::test::FdLeakCheck leaks;
         LogCapture log;
         errno = 0;
-        const int fd = OpenEADir(dir.File("a.jpg").c_str(), folder, create);
-        const int error = fd < 0 ? errno : 0;
-        const int expected = create ? c.error_create : c.error_open;
-        EXPECT_EQ(expected, error) << strerror(error);
+        const int fd = OpenEADir(tree.media_.c_str(), folder, create);
+        EXPECT_EQ(create ? c.error_create : c.error_open, fd < 0 ? errno : 0);
         EXPECT_EQ(c.refused ? 1u : 0u, log.lines().size());
         if (fd >= 0) {
           struct stat opened, named;
           ASSERT_EQ(0, fstat(fd, &opened));
-          ASSERT_EQ(0, lstat(ea.c_str(), &named));
+          ASSERT_EQ(0, lstat(tree.ea_.c_str(), &named));
           EXPECT_TRUE(S_ISDIR(named.st_mode));
           EXPECT_EQ(named.st_ino, opened.st_ino);
           EXPECT_EQ(FD_CLOEXEC, fcntl(fd, F_GETFD) & FD_CLOEXEC);
           close(fd);
         } else if (c.refused) {
-          EXPECT_EQ(hidden_kind, KindAt(hidden)) << "removed";
-          EXPECT_EQ(ea_kind, KindAt(ea)) << "removed";
+          EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
+          EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
         }
         EXPECT_TRUE(leaks.NoLeak());
-        EXPECT_EQ(std::set<std::string>{"victim"}, Entries(outside.path()));
-        EXPECT_EQ("root's", ReadFile(outside.File("victim")));
+        EXPECT_TRUE(tree.OutsideUntouched());
         if (folder >= 0) close(folder);
       }
     }
@@ -370,174 +397,110 @@ TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
   EXPECT_EQ(5u, log.lines().size());  // the host failure and four answers
 }
 
-// MakeEADir and GetEADirPath on every planted entry: MakeEADir makes what
-// OpenEADir with create would; GetEADirPath hands the host only what is
-// missing, never a refused link or special file.
+// MakeEADir makes what OpenEADir with create would; GetEADirPath hands the
+// host only what is missing, never a refused link or special file, and
+// logs the refusal and its failure.
 TEST(EADirMakingWalk, PlantedEntriesAreNeverFollowedByEitherMaker) {
-  for (const Planted& c : kPlanted) {
+  for (const DirCase& c : kDirCases) {
     for (bool by_host : {false, true}) {
       SCOPED_TRACE(std::string(c.what) + (by_host ? ", GetEADirPath" : ""));
-      TempDir dir, outside;
-      WriteFile(outside.File("victim"), "root's");
-      const std::string hidden = dir.File(".quvameta");
-      const std::string ea = hidden + "/a.jpg";
-      c.plant(hidden, ea, outside.path());
-      const mode_t hidden_kind = KindAt(hidden), ea_kind = KindAt(ea);
+      PlantedTree tree(c.hidden, c.ea);
+      const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
       LogCapture log;
       FakeHost host;
       char buf[4096];
-      const int result =
-          by_host ? GetEADirPath(dir.File("a.jpg").c_str(), buf, sizeof(buf))
-                  : MakeEADir(dir.File("a.jpg").c_str(), buf, sizeof(buf));
-      // The host makes what is missing but replaces nothing in the way.
+      const char* media = tree.media_.c_str();
+      const int result = by_host ? GetEADirPath(media, buf, sizeof(buf))
+                                 : MakeEADir(media, buf, sizeof(buf));
       const bool made = by_host ? c.error_open == 0 || c.error_open == ENOENT
                                 : c.error_create == 0;
       EXPECT_EQ(made ? 0 : -1, result);
-      EXPECT_EQ(ea, buf);
+      EXPECT_EQ(tree.ea_, buf);
       if (made) {
-        EXPECT_EQ(S_IFDIR, KindAt(ea));
+        EXPECT_EQ(S_IFDIR, KindAt(tree.ea_));
       }
       if (c.refused) {
-        EXPECT_EQ(hidden_kind, KindAt(hidden)) << "removed";
-        EXPECT_EQ(ea_kind, KindAt(ea)) << "removed";
+        EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
+        EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
         EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
-        EXPECT_EQ(2u, log.lines().size());  // the refusal, then the failure
+        ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
         const std::string failure =
-            by_host ? "Make ea dir path error. eaDir path: " + ea
+            by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
                     : ", error:" + std::to_string(c.error_create);
-        EXPECT_NE(std::string::npos, log.lines().back().text.find(failure))
-            << log.lines().back().text;
+        EXPECT_NE(std::string::npos, log.lines()[1].text.find(failure));
       }
-      EXPECT_EQ(std::set<std::string>{"victim"}, Entries(outside.path()));
-      EXPECT_EQ("root's", ReadFile(outside.File("victim")));
+      EXPECT_TRUE(tree.OutsideUntouched());
     }
   }
 }
 
-// The item functions where the metadata or EA directory, or an item, is
-// planted. Items "x" and "y" (5 bytes) wait in the EA directory and in
-// every place a followed link would lead; what is outside must stay unseen
-// and unremoved.
-struct ItemPlant {
-  const char* what;
-  // Plants in the folder; `outside` already holds x, y, a.jpg/x, a.jpg/y.
-  std::function<void(const std::string& hidden, const std::string& ea,
-                     const std::string& outside)>
-      plant;
-  int removed;        // RemoveEAFile(ea, "x", "y")
-  const char* found;  // IsEAFileExist(ea, "x", "y"): "x", "y" or null
-};
-
-void MakeRealDirs(const std::string& hidden, const std::string& ea) {
-  mkdir(hidden.c_str(), 0755);
-  mkdir(ea.c_str(), 0755);
-}
-
-const ItemPlant kItemPlants[] = {
-    {"real items",
-     [](auto& hidden, auto& ea, auto&) {
-       MakeRealDirs(hidden, ea);
-       WriteFile(ea + "/x", "12345");
-       WriteFile(ea + "/y", "12345");
-     },
-     2, "x"},
-    {"metadata dir links elsewhere",
-     [](auto& hidden, auto&, auto& outside) {
-       symlink(outside.c_str(), hidden.c_str());
-     },
-     0, nullptr},
-    {"EA dir links elsewhere",
-     [](auto& hidden, auto& ea, auto& outside) {
-       mkdir(hidden.c_str(), 0755);
-       symlink(outside.c_str(), ea.c_str());
-     },
-     0, nullptr},
-    {"dangling link at the metadata dir",
-     [](auto& hidden, auto&, auto& outside) {
-       symlink((outside + "/none").c_str(), hidden.c_str());
-     },
-     0, nullptr},
-    {"FIFO at the EA dir",
-     [](auto& hidden, auto& ea, auto&) {
-       mkdir(hidden.c_str(), 0755);
-       mkfifo(ea.c_str(), 0666);
-     },
-     0, nullptr},
-    {"x links to a file elsewhere",
-     [](auto& hidden, auto& ea, auto& outside) {
-       MakeRealDirs(hidden, ea);
-       symlink((outside + "/x").c_str(), (ea + "/x").c_str());
-       WriteFile(ea + "/y", "12345");
-     },
-     1, "y"},
-    {"x dangles, y links to a directory elsewhere",
-     [](auto& hidden, auto& ea, auto& outside) {
-       MakeRealDirs(hidden, ea);
-       symlink((outside + "/none").c_str(), (ea + "/x").c_str());
-       symlink((outside + "/a.jpg").c_str(), (ea + "/y").c_str());
-     },
-     0, nullptr},
-};
-
+// The item functions where the metadata or EA directory, or an item x or y,
+// is planted: a link is neither an item nor removed nor followed.
 TEST(EAItemsWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
-  using Call = std::function<int(const char* media, const char* ea)>;
+  const struct {
+    const char* what;
+    Plant hidden, ea, x, y;
+    int removed;        // by RemoveEAFile(ea, "x", "y")
+    const char* found;  // by IsEAFileExist(ea, "x", "y")
+  } cases[] = {
+      {"real items", Plant::kDir, Plant::kDir, Plant::kFile, Plant::kFile, 2,
+       "x"},
+      {"metadata dir links elsewhere", Plant::kLinkToDir, Plant::kNone,
+       Plant::kNone, Plant::kNone, 0, nullptr},
+      {"EA dir links elsewhere", Plant::kDir, Plant::kLinkToDir, Plant::kNone,
+       Plant::kNone, 0, nullptr},
+      {"dangling link at the metadata dir", Plant::kDangling, Plant::kNone,
+       Plant::kNone, Plant::kNone, 0, nullptr},
+      {"FIFO at the EA dir", Plant::kDir, Plant::kFifo, Plant::kNone,
+       Plant::kNone, 0, nullptr},
+      {"x links to a file elsewhere", Plant::kDir, Plant::kDir,
+       Plant::kLinkToFile, Plant::kFile, 1, "y"},
+      {"x dangles, y links to a directory", Plant::kDir, Plant::kDir,
+       Plant::kDangling, Plant::kLinkToDir, 0, nullptr},
+  };
   const struct {
     const char* name;
-    Call call;
+    std::function<int(const char* media, const char* ea)> call;
     bool counts_removed;  // else: 1 when found, 0 when not
   } calls[] = {
       {"RemoveEAFile", [](auto, auto ea) { return RemoveEAFile(ea, "x", "y"); },
        true},
-      {"RemoveEAFile2",
-       [](auto media, auto) { return RemoveEAFile2(media, "x", "y"); }, true},
+      {"RemoveEAFile2", [](auto m, auto) { return RemoveEAFile2(m, "x", "y"); },
+       true},
       {"IsEAFileExist",
-       [](auto, auto ea) {
-         return IsEAFileExist(ea, nullptr, "x", "y") != nullptr ? 1 : 0;
-       },
+       [](auto, auto ea) { return !!IsEAFileExist(ea, nullptr, "x", "y"); },
        false},
       {"IsEAFileExist2",
-       [](auto media, auto) { return IsEAFileExist2(media, "x", "y"); }, false},
+       [](auto m, auto) { return IsEAFileExist2(m, "x", "y"); }, false},
       {"GetEAFilePath",
-       [](auto media, auto) {
+       [](auto m, auto) {
          char out[4096];
-         return GetEAFilePath(media, "x", "y", out, sizeof(out)) == 0 ? 1 : 0;
+         return GetEAFilePath(m, "x", "y", out, sizeof(out)) == 0 ? 1 : 0;
        },
        false},
   };
-  for (const ItemPlant& c : kItemPlants) {
+  for (const auto& c : cases) {
     for (const auto& fn : calls) {
       SCOPED_TRACE(std::string(c.what) + ", " + fn.name);
-      TempDir dir, outside;
-      for (const char* name : {"x", "y", "a.jpg/x", "a.jpg/y"}) {
-        mkdir(outside.File("a.jpg").c_str(), 0755);
-        WriteFile(outside.File(name), "root's");
-      }
-      const std::string hidden = dir.File(".quvameta");
-      const std::string ea = hidden + "/a.jpg";
-      c.plant(hidden, ea, outside.path());
-      const mode_t planted_x = KindAt(ea + "/x");
+      PlantedTree tree(c.hidden, c.ea, c.x, c.y);
+      const mode_t x = KindAt(tree.ea_ + "/x");
       LogCapture log;
-      const int result = fn.call(dir.File("a.jpg").c_str(), ea.c_str());
-      EXPECT_EQ(fn.counts_removed ? c.removed : c.found != nullptr, result);
-      const bool refused = c.removed < 2;  // every other plant is refused
-      EXPECT_EQ(refused, !log.lines().empty());
-      for (const char* name : {"x", "y", "a.jpg/x", "a.jpg/y"}) {
-        EXPECT_EQ("root's", ReadFile(outside.File(name))) << name;
-      }
-      if (S_ISLNK(planted_x)) {
-        EXPECT_EQ(planted_x, KindAt(ea + "/x")) << "link removed";
+      EXPECT_EQ(fn.counts_removed ? c.removed : c.found != nullptr,
+                fn.call(tree.media_.c_str(), tree.ea_.c_str()));
+      EXPECT_EQ(c.removed < 2, !log.lines().empty());  // refusals logged
+      EXPECT_TRUE(tree.OutsideUntouched());
+      if (S_ISLNK(x)) {
+        EXPECT_EQ(x, KindAt(tree.ea_ + "/x")) << "link removed";
       }
     }
-    TempDir dir, outside;
-    c.plant(dir.File(".quvameta"), dir.File(".quvameta/a.jpg"), outside.path());
-    const std::string ea = dir.File(".quvameta/a.jpg");
-    const char* x = "x";
-    const char* y = "y";
-    const char* found = IsEAFileExist(ea.c_str(), nullptr, x, y);
+    PlantedTree tree(c.hidden, c.ea, c.x, c.y);
+    const char *x = "x", *y = "y";
     EXPECT_EQ(c.found == nullptr ? nullptr
               : *c.found == 'x'  ? x
                                  : y,
-              found)
+              IsEAFileExist(tree.ea_.c_str(), nullptr, x, y))
         << c.what;
   }
 }
+
+}  // namespace
