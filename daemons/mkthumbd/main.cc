@@ -7,7 +7,8 @@
 // has grown, then works through the queue one photo per loop turn, so a
 // SIGTERM or SIGINT ends it after the photo at hand, with that photo's
 // thumbnails complete and its entry still queued. At start it looks at the
-// queue once, for entries left from before.
+// queue once, for entries left from before, after removing the copies of
+// the queue that a rewrite killed half-way may have left.
 #include <signal.h>
 #include <stdio.h>
 #include <sys/time.h>
@@ -16,6 +17,7 @@
 
 #include <event2/event.h>
 #include <quvaidx/log.h>
+#include <quvaidx/spool_consumer.h>
 
 #include "daemon_runner.h"
 #include "preview_names.h"
@@ -79,6 +81,9 @@ int Start(event_base* base, void* context) {
     fprintf(stderr, "%s: cannot watch SIGUSR1\n", kProgram);
     return 1;
   }
+  // Copies of the queue that a rewrite killed half-way left; logged by the
+  // library, and nothing else is touched, so the result does not matter.
+  RemoveStaleQueueCopies(daemon->queue.c_str());
   Schedule(daemon, 0);  // entries queued before we started
   return 0;
 }
@@ -137,7 +142,8 @@ int main(int argc, char** argv) {
       "Photos larger than 100 million pixels, photos whose decoding would\n"
       "take more than 384 MiB (large progressive JPEGs, GIFs, lossless WebPs,\n"
       "HEIFs), photos the folder's owner cannot read and photos libvips\n"
-      "cannot read are logged and skipped.\n";
+      "cannot read are logged and skipped. A queue entry that ended the\n"
+      "daemon 3 times is logged and dropped at the next start.\n";
   spec.start = Start;
   spec.stop = Stop;
   return quvaidx_daemons::RunDaemon(spec, argc, argv);

@@ -224,8 +224,10 @@ void ThumbWorker::StartEntry(const std::string& entry) {
   stamps_.clear();
   photo_ = 0;
   refused_ = true;
-  // The queue's durable count of the attempts at its head entry.
-  const int attempt = 1;
+  // The queue's durable count of the attempts at its head entry, this one
+  // included. A count that cannot be kept (logged by the library) costs
+  // the protection, not the entry.
+  const int attempt = CountQueueAttempt(queue_.c_str(), entry.c_str());
   if (attempt > kMaxAttempts) {
     ++counts_.entries_given_up;
     AppLogError(3,

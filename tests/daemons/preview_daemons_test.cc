@@ -216,6 +216,40 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
   EXPECT_TRUE(daemon.Running()) << daemon.Errors();
 }
 
+// An entry during which the daemon died (killed here, as the memory limit
+// or a crash would end it) is tried again at the next start, but not a
+// fourth time: then it is logged and dropped, and the entry behind it is
+// served.
+TEST_F(ThumbDaemonTest, EntryThatEndedTheDaemonThreeTimesIsDropped) {
+  const std::string bad = share_ + "/bad";
+  ASSERT_EQ(mkdir(bad.c_str(), 0755), 0);
+  ASSERT_EQ(mkdir((share_ + "/good").c_str(), 0755), 0);
+  Photo("bad/1.jpg");
+  Photo("bad/2.jpg");
+  Photo("good/g.jpg");
+  ASSERT_EQ(WriteIndexQueue(bad.c_str(), queue_.c_str()), 0);
+  ASSERT_EQ(WriteIndexQueue((share_ + "/good").c_str(), queue_.c_str()), 0);
+  for (int attempt = 1; attempt <= 3; ++attempt) {
+    SCOPED_TRACE("attempt " + std::to_string(attempt));
+    std::filesystem::remove_all(bad + "/.quvameta");  // 1.jpg is made anew
+    DaemonProcess daemon;
+    ASSERT_TRUE(Start(daemon, "60000")) << daemon.Errors();
+    ASSERT_TRUE(WaitUntil(20, [&] {
+      return daemon.Errors().find("of " + bad + "/1.jpg") != std::string::npos;
+    }));
+    ASSERT_TRUE(daemon.Signal(SIGKILL));
+    EXPECT_TRUE(daemon.WaitExit(5, false));
+  }
+  DaemonProcess last;
+  ASSERT_TRUE(Start(last)) << last.Errors();
+  ASSERT_TRUE(Served()) << last.Errors();
+  EXPECT_NE(last.Errors().find("gave up queue entry '" + bad + "'"),
+            std::string::npos)
+      << last.Errors();
+  EXPECT_FALSE(Exists(ThumbItem(bad + "/2.jpg", "S")));
+  EXPECT_TRUE(AllThumbs("good/g.jpg"));
+}
+
 // Links planted by a folder's owner where the daemon writes (at the
 // metadata directory, at a photo's EA directory, at a thumbnail's name, at
 // a leftover temporary file's), to a root-only folder, to another user's
