@@ -277,10 +277,13 @@ long long DecodePeakBytes(const DecodeFacts& facts) {
   // libvips's lines between the decoder and the first reduction: about
   // 2400 lines of the image as loaded, at 3 bytes a pixel or more; with
   // transparency, premultiplied in floats (4 bytes a band), about 1600.
-  const long long loaded_width = facts.width / facts.shrink;
-  const long long window = facts.alpha
-                               ? 1600LL * loaded_width * facts.bands * 4
-                               : 2400LL * loaded_width * std::max(sample, 3LL);
+  const long long loaded_width = facts.width / facts.shrink + 1;
+  const long long loaded_height = facts.height / facts.shrink + 1;
+  const long long window =
+      facts.alpha
+          ? std::min(1600LL, loaded_height) * loaded_width * facts.bands * 4
+          : std::min(2400LL, loaded_height) * loaded_width *
+                std::max(sample, 3LL);
   long long decoder = 0;
   switch (facts.format) {
     case Format::kJpeg:

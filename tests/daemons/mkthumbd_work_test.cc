@@ -273,22 +273,24 @@ TEST_F(ThumbnailerTest, DecodesThatWouldExceedTheMemoryLimitAreRefused) {
   struct Case {
     const char* write;  // name and libvips save options
     const char* name;
+    int width, height;
     bool made;
   } cases[] = {
-      {"base.jpg", "base.jpg", true},
-      {"prog.jpg[interlace,Q=95]", "prog.jpg", false},
-      {"plain.png", "plain.png", true},
-      {"inter.png[interlace]", "inter.png", false},
-      {"lossy.webp", "lossy.webp", true},
-      {"lossless.webp[lossless]", "lossless.webp", false},
-      {"g.gif", "g.gif", false},
-      {"t.tif", "t.tif", false},
+      {"base.jpg", "base.jpg", 3000, 2000, true},
+      {"prog.jpg[interlace,Q=95]", "prog.jpg", 3000, 2000, false},
+      {"plain.png", "plain.png", 3000, 2000, true},
+      {"pano.png", "pano.png", 30000, 200, true},  // a few lines: streams
+      {"inter.png[interlace]", "inter.png", 3000, 2000, false},
+      {"lossy.webp", "lossy.webp", 3000, 2000, true},
+      {"lossless.webp[lossless]", "lossless.webp", 3000, 2000, false},
+      {"g.gif", "g.gif", 3000, 2000, false},
+      {"t.tif", "t.tif", 3000, 2000, false},
   };
   mkthumbd::PhotoLimits limits;
   limits.max_decode_bytes = 45LL << 20;
   for (const Case& c : cases) {
-    ASSERT_TRUE(
-        quvaidx::daemon_test::WritePlainPhoto(Photo(c.write), 3000, 2000, kRed))
+    ASSERT_TRUE(quvaidx::daemon_test::WritePlainPhoto(Photo(c.write), c.width,
+                                                      c.height, kRed))
         << c.name;
     PhotoResult result = MakePhotoThumbnails(Photo(c.name), limits);
     EXPECT_EQ(result.made, c.made ? kAllThumbSizes : 0)
