@@ -2,9 +2,10 @@
 //
 // `add` goes through WriteIndexQueue, so an entry already queued is not
 // queued twice. `trim` goes through TrimQueueHead, the library's consumer
-// side: it takes the queue's exclusive flock, removes the head with
-// FileRemoveHeadingLine and lets go. Every entry is checked before the first is
-// written, so a bad one leaves the queue as it was. An ENTRY "-" reads the
+// side: under the queue's exclusive flock it blanks the first N entries in
+// place, as the queue's daemon does with the entries it finished. Every
+// entry is checked before the first is written, so a bad one leaves the
+// queue as it was. An ENTRY "-" reads the
 // entries from standard input, one per line (or NUL-terminated, with -0).
 #include <errno.h>
 #include <limits.h>
@@ -119,8 +120,7 @@ int Trim(const std::vector<std::string>& args) {
   // while this one waited.
   if (TrimQueueHead(queue, lines) != 0) {
     PrintError(kName, std::string("cannot trim ") + queue +
-                          ": the queue is unchanged, or a temporary file "
-                          "beside it was left behind");
+                          " (--verbose shows the library's report)");
     return kExitError;
   }
   return kExitOk;
