@@ -1,6 +1,7 @@
-// Non-replacing renames and head trimming on real files.
+// Canonical paths, non-replacing renames and head trimming on real files.
 #include <dirent.h>
-#include <fcntl.h>
+#include <limits.h>
+#include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -16,14 +17,10 @@
 
 namespace {
 
-using quvaidx::test::FakeSleep;
-using quvaidx::test::kNobody;
 using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
 using quvaidx::test::RunUnprivileged;
 using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::TempDir;
-
-using quvaidx::test::ReadFile;
 using quvaidx::test::WriteFile;
 
 int EntriesIn(const std::string& dir) {
@@ -36,14 +33,41 @@ int EntriesIn(const std::string& dir) {
 
 class FileTest : public ::testing::Test {
  protected:
-  TempDir dir_;
+  quvaidx::test::TempDir dir_;
   std::string source_ = dir_.File("source");
   std::string destination_ = dir_.File("destination");
 };
 
+// Links and dots are resolved; a path that does not resolve is handed back
+// as it came; only null fails, with a line. The caller frees the result.
+TEST_F(FileTest, RealPathResolvesOrKeepsThePath) {
+  char real_dir[PATH_MAX];
+  ASSERT_NE(realpath(dir_.path().c_str(), real_dir), nullptr);
+  ASSERT_EQ(symlink(".", dir_.File("here").c_str()), 0);
+  const std::pair<std::string, std::string> cases[] = {
+      {dir_.File("here/./here/"), real_dir},
+      {dir_.File("missing/../x"), dir_.File("missing/../x")}};
+  for (const auto& [path, expected] : cases) {
+    char* got = GetRealPath(path.c_str());
+    ASSERT_NE(got, nullptr) << path;
+    EXPECT_EQ(got, expected);
+    free(got);
+  }
+  LogCapture log;
+  EXPECT_EQ(GetRealPath(nullptr), nullptr);
+  EXPECT_EQ(log.Count("quvaidx_system:N [Error] GetRealPath: (null)"), 1);
+}
+
 // The source moves unless the destination exists, also when the existence
-// test cannot see it (a dangling link, like one created just after it).
+// test cannot see it (a dangling link, like one created just after it). A
+// missing source fails quietly, a missing folder at once, a persistent
+// failure (a folder into itself: EINVAL) after sixteen tries, each followed
+// by a yield through the sleep seam.
 TEST_F(FileTest, RenameNeverReplacesTheDestination) {
+  LogCapture log;
+  quvaidx::test::FakeSleep sleep;
+  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
+  EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
   EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
   EXPECT_EQ(ReadFile(destination_), "s");
@@ -59,20 +83,9 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
   char target[64] = "";
   ASSERT_GT(readlink(destination_.c_str(), target, sizeof(target) - 1), 0);
   EXPECT_STREQ(target, "nowhere");
-}
-
-// A missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries, each followed
-// by a yield through the sleep seam.
-TEST_F(FileTest, RenameFailures) {
-  LogCapture log;
-  FakeSleep sleep;
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
-  EXPECT_TRUE(log.lines().empty());
-  WriteFile(source_, "s");
   std::string nowhere = dir_.File("no/such/dir");
   EXPECT_EQ(RenameFile(source_.c_str(), nowhere.c_str()), -1);
-  EXPECT_EQ(ReadFile(source_), "s");
+  EXPECT_EQ(ReadFile(source_), "t");
   EXPECT_EQ(sleep.yields(), 0);
   ASSERT_EQ(mkdir(dir_.File("d").c_str(), 0755), 0);
   std::string inside = dir_.File("d/sub");
@@ -106,9 +119,9 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
                  std::string(70000, 's')}};  // across copy blocks
   WriteFile(source_, "");
   ASSERT_EQ(chmod(source_.c_str(), 02640), 0);
-  if (getuid() == 0) {
-    ASSERT_EQ(chown(source_.c_str(), kNobody, kNobody), 0);
-  }
+  ASSERT_EQ(
+      chown(source_.c_str(), quvaidx::test::kNobody, quvaidx::test::kNobody),
+      0);
   struct stat before, after;
   ASSERT_EQ(stat(source_.c_str(), &before), 0);
   for (const auto& c : kCases) {
@@ -123,18 +136,21 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   EXPECT_EQ(EntriesIn(dir_.path()), 1);
   const std::string fifo = dir_.File("fifo");
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  ASSERT_EQ(symlink(source_.c_str(), dir_.File("link").c_str()), 0);
   alarm(5);  // a trim that waits on the FIFO ends the test here
-  for (const std::string& odd : {destination_, dir_.path(), fifo}) {
+  for (const std::string& odd :
+       {destination_, dir_.path(), fifo, dir_.File("link")}) {
     EXPECT_EQ(FileRemoveHeadingLine(odd.c_str(), 1), -1) << odd;
   }
   alarm(0);
   EXPECT_EQ(FileRemoveHeadingLine(nullptr, 1), -1);
-  EXPECT_EQ(EntriesIn(dir_.path()), 2);  // the source and the FIFO
+  EXPECT_EQ(EntriesIn(dir_.path()), 3);  // the source, the FIFO, the link
 }
 
-// A disk that fills while the copy is written must fail the trim and keep
-// every line: reporting success would replace the queue by a cut copy.
-// The failed write must not be retried for ever either.
+// A disk that fills while the copy is written, or a file of another user,
+// must fail the trim and keep every line: reporting success would replace
+// the queue by a cut copy. The failed write must not be retried for ever
+// either, and the temporary file goes.
 TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
   std::string text;
   for (int i = 0; i < 300; ++i)
@@ -144,21 +160,12 @@ TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
     return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
   };
   EXPECT_EQ(RunWithFileSizeLimit(1000, trim_fails), 0);
-  EXPECT_EQ(ReadFile(source_), text);
-  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
-}
-
-TEST_F(FileTest, TrimLeavesAnotherUsersFileUnchanged) {
-  if (getuid() != 0) GTEST_SKIP() << "needs root to own a file as another user";
-  WriteFile(source_, "a\nb\n");
-  chmod(source_.c_str(), 0644);
   chmod(dir_.path().c_str(), 0777);  // the trimmer may create its copy
-  EXPECT_EQ(RunUnprivileged([&] {
-              return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
-            }),
-            0);
-  EXPECT_EQ(ReadFile(source_), "a\nb\n");
-  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
+  if (getuid() == 0) {
+    EXPECT_EQ(RunUnprivileged(trim_fails), 0);
+  }
+  EXPECT_EQ(ReadFile(source_), text);
+  EXPECT_EQ(EntriesIn(dir_.path()), 1);
 }
 
 }  // namespace
