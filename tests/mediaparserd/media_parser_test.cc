@@ -99,18 +99,37 @@ bool HeadLooksLikePhoto(const std::string& path) {
                         static_cast<int64_t>(head.size()));
 }
 
+// The UUID of the file system holding `path` by the oracle: blkid probing
+// the device node behind its st_dev (nothing where the device cannot be
+// read, as in some containers, or where there is none, as for a tmpfs).
+std::string BlkidUuid(const std::string& path) {
+  struct stat status;
+  if (stat(path.c_str(), &status) != 0) return "?";
+  std::string node = CommandOutput("sed -n 's/^DEVNAME=//p' /sys/dev/block/" +
+                                   std::to_string(major(status.st_dev)) + ":" +
+                                   std::to_string(minor(status.st_dev)) +
+                                   "/uevent 2>/dev/null");
+  if (node.empty()) return "";
+  node.pop_back();
+  std::string uuid = CommandOutput("blkid -p -s UUID -o value " +
+                                   Quoted("/dev/" + node) + " 2>/dev/null");
+  if (!uuid.empty()) uuid.pop_back();
+  return uuid;
+}
+
 // Every technical field against `ffprobe -of json`, and the tags that
-// libavformat reads correctly (UTF-8 and UTF-16 ones) against its tags.
-// exiv2 as Debian builds it also reads QuickTime, RIFF, Matroska and ASF:
-// only still images may look like photos, so that those go to libavformat.
+// libavformat reads correctly (UTF-8 and UTF-16 ones) against its tags;
+// the file's own fields against its status. exiv2 as Debian builds it also
+// reads QuickTime, RIFF, Matroska and ASF: only still images may look like
+// photos, so that those go to libavformat.
 TEST_F(MediaParserTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
   HostCodePage host("UTF-8");
-  const char* fixtures[] = {"song_id3v24.mp3", "song_id3v23_utf16.mp3",
-                            "song.flac",       "song.ogg",
-                            "song_lc.m4a",     "song_he.m4a",
-                            "song.wav",        "video_rot90.mp4",
-                            "video.mkv",       "photo.png"};
-  for (const char* name : fixtures) {
+  const std::string uuid = BlkidUuid(Fixture("song.ogg"));
+  for (const char* name :
+       {"song_id3v24.mp3", "song_id3v23_utf16.mp3", "song.flac", "song.ogg",
+        "song_lc.m4a", "song_he.m4a", "song.wav", "song.aiff", "song.wma",
+        "song.wv", "song.tta", "song.opus", "song.oga", "video_rot90.mp4",
+        "video.mkv", "photo.png"}) {
     SCOPED_TRACE(name);
     std::string path = Fixture(name);
     const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
@@ -121,7 +140,16 @@ TEST_F(MediaParserTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
     EXPECT_EQ(r.szContainerType,
               ContainerTypeName(format["format_name"].asString()));
     EXPECT_EQ(r.fileSize, static_cast<uint64_t>(Number(format["size"])));
-    EXPECT_TRUE(IsValidUTF8(r.szFsUUID));
+    EXPECT_EQ(r.szPath, path);
+    EXPECT_STREQ(r.szName, name);
+    struct stat status;
+    ASSERT_EQ(stat(path.c_str(), &status), 0);
+    char date[32];
+    strftime(date, sizeof(date), "%Y-%m-%d %H:%M:%S",
+             localtime(&status.st_mtime));
+    EXPECT_STREQ(r.szDate, date);
+    EXPECT_STREQ(r.szMDate, date);
+    EXPECT_EQ(r.szFsUUID, uuid);
     int covers = 0;
     for (const Json::Value& stream : probe["streams"]) {
       covers += Number(stream["disposition"]["attached_pic"]) != 0;
@@ -204,6 +232,17 @@ TEST_F(MediaParserTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
     EXPECT_EQ(r.disc, atoi(tag("disc").c_str()));
     EXPECT_EQ(r.year, atoi(tag("date").c_str()));
   }
+  // A file system without a superblock (a tmpfs) has no UUID.
+  if (access("/dev/shm", W_OK) != 0) return;
+  char dir[] = "/dev/shm/quvaidx-test-XXXXXX";
+  ASSERT_NE(mkdtemp(dir), nullptr);
+  std::string copy = std::string(dir) + "/song.ogg";
+  WriteFile(copy, ReadFile(Fixture("song.ogg")));
+  bool parsed = Parse(copy);
+  unlink(copy.c_str());
+  rmdir(dir);
+  ASSERT_TRUE(parsed) << reason_;
+  EXPECT_STREQ(media_.record.szFsUUID, "");
 }
 
 // The camera's fields of a JPEG against exiftool; its orientation is kept
@@ -228,46 +267,6 @@ TEST_F(MediaParserTest, PhotoFieldsAgreeWithExiftool) {
   EXPECT_STREQ(r.szContainerType, "image2");
   EXPECT_EQ(media_.orientation, 6);  // "Rotate 90 CW"
   EXPECT_EQ(media_.video.rotation, 0);
-}
-
-// The file's own fields, and the UUID of its file system against the
-// oracle: blkid probing the device node behind the file's st_dev (nothing
-// where the device cannot be read, as in some containers, or where there is
-// no device, as for a tmpfs).
-TEST_F(MediaParserTest, FileFieldsComeFromTheFileAndItsFileSystem) {
-  std::string path = Fixture("song.ogg");
-  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
-  struct stat status;
-  ASSERT_EQ(stat(path.c_str(), &status), 0);
-  EXPECT_EQ(r.szPath, path);
-  EXPECT_STREQ(r.szName, "song.ogg");
-  char date[32];
-  strftime(date, sizeof(date), "%Y-%m-%d %H:%M:%S",
-           localtime(&status.st_mtime));
-  EXPECT_STREQ(r.szDate, date);
-  EXPECT_STREQ(r.szMDate, date);
-  std::string node = CommandOutput("sed -n 's/^DEVNAME=//p' /sys/dev/block/" +
-                                   std::to_string(major(status.st_dev)) + ":" +
-                                   std::to_string(minor(status.st_dev)) +
-                                   "/uevent 2>/dev/null");
-  std::string uuid;
-  if (!node.empty()) {
-    node.pop_back();
-    uuid = CommandOutput("blkid -p -s UUID -o value " + Quoted("/dev/" + node) +
-                         " 2>/dev/null");
-    if (!uuid.empty()) uuid.pop_back();
-  }
-  EXPECT_EQ(r.szFsUUID, uuid);
-  if (access("/dev/shm", W_OK) != 0) GTEST_SKIP() << "no /dev/shm";
-  char dir[] = "/dev/shm/quvaidx-test-XXXXXX";
-  ASSERT_NE(mkdtemp(dir), nullptr);
-  std::string copy = std::string(dir) + "/song.ogg";
-  WriteFile(copy, ReadFile(path));
-  bool parsed = Parse(copy);
-  unlink(copy.c_str());
-  rmdir(dir);
-  ASSERT_TRUE(parsed) << reason_;
-  EXPECT_STREQ(media_.record.szFsUUID, "");
 }
 
 // The texts of ID3v1 tags and of ID3v2 frames declared Latin-1 are decoded
@@ -311,61 +310,68 @@ TEST_F(MediaParserTest, LegacyTagsAreReadInTheHostCodePage) {
   }
 }
 
-// An ID3v2.3 text frame: `id`, its encoding byte, `text`.
-std::string Id3v2Frame(const char* id, char encoding, const std::string& text) {
-  std::string body = std::string(1, encoding) + text;
+// An ID3v2.3 frame `id` holding `body`.
+std::string Id3v2Frame(const char* id, const std::string& body) {
   std::string frame = id;
-  for (int shift : {24, 16, 8, 0}) {
-    frame += static_cast<char>(body.size() >> shift);
-  }
+  for (int shift : {24, 16, 8, 0}) frame += char(body.size() >> shift);
   return frame + std::string(2, '\0') + body;
 }
 
-// An ID3v2.3 tag around `frames`.
-std::string Id3v2Tag(const std::string& frames) {
-  std::string tag = "ID3\x03" + std::string(2, '\0');
-  for (int shift : {21, 14, 7, 0}) {
-    tag += static_cast<char>((frames.size() >> shift) & 0x7F);
-  }
-  return tag + frames;
-}
-
 // Frames whose declared encoding is none of the four give a clean text or
-// none, and the rest of the tag still counts.
-TEST_F(MediaParserTest, FrameWithAnUnknownEncodingIsReadSafely) {
+// none, and the rest of the tag still counts: of the comments, the one
+// without a description (others hold player data), numbered genres by
+// their names, the leading number of the disc.
+TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
   HostCodePage host("UTF-8");
   TempDir dir;
-  std::string song = ReadFile(Fixture("song_id3v1_cp1251.mp3"));
+  const std::string frames =
+      Id3v2Frame("COMM", std::string("\0engiTunNORM\0 0001", 18)) +
+      Id3v2Frame("COMM", std::string("\0eng\0Liner notes", 16)) +
+      Id3v2Frame("TPE1", std::string("\0Kino", 5)) +
+      Id3v2Frame("TCON", std::string("\0(17)", 5)) +
+      Id3v2Frame("TPOS", std::string("\0"
+                                     "2/3",
+                                     4));
   for (char encoding : {'\x04', '\x65', '\xFF'}) {
-    std::string path = dir.File("odd.mp3");
-    WriteFile(path, Id3v2Tag(Id3v2Frame("TIT2", encoding,
-                                        std::string("AB\0CD\xFF\xFE", 7)) +
-                             Id3v2Frame("TPE1", '\0', "Kino")) +
-                        song);
-    ASSERT_TRUE(Parse(path)) << reason_;
+    std::string tag = "ID3\x03" + std::string(2, '\0');
+    std::string all =
+        Id3v2Frame("TIT2", encoding + std::string("AB\0CD\xFF\xFE", 7)) +
+        frames;
+    for (int shift : {21, 14, 7, 0}) tag += char((all.size() >> shift) & 0x7F);
+    WriteFile(dir.File("odd.mp3"),
+              tag + all + ReadFile(Fixture("song_id3v1_cp1251.mp3")));
+    ASSERT_TRUE(Parse(dir.File("odd.mp3"))) << reason_;
     EXPECT_TRUE(IsValidUTF8(media_.record.szTitle));
     EXPECT_STREQ(media_.record.szArtist, "Kino");
+    EXPECT_STREQ(media_.record.szComment, "Liner notes");
+    EXPECT_STREQ(media_.record.szGenre, "Rock");
+    EXPECT_EQ(media_.record.disc, 2);
     EXPECT_EQ(media_.record.year, 1999);  // from the ID3v1 tag
   }
 }
 
 // What a file is depends on its content: a renamed MP3 is an MP3, a text
-// named like a photo is nothing.
+// named like a photo is nothing; TagLib reads the tags of the container
+// found, whatever the name says.
 TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
   TempDir dir;
-  struct Case {
-    const char* fixture;
-    const char* name;
+  const struct {
+    const char *fixture, *name;
     MediaKind kind;
-    const char* container;
-  } cases[] = {{"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3"},
-               {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm"},
-               {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2"}};
-  for (const Case& c : cases) {
+    const char *container, *title;
+  } cases[] = {
+      {"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3",
+       "Überschrift ✓"},
+      {"song.spx", "song.flac", MediaKind::kMusic, "ogg", "Song Title"},
+      {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm",
+       "Matroska Clip"},
+      {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2", ""}};
+  for (const auto& c : cases) {
     WriteFile(dir.File(c.name), ReadFile(Fixture(c.fixture)));
     ASSERT_TRUE(Parse(dir.File(c.name))) << c.name << ": " << reason_;
     EXPECT_EQ(media_.kind, c.kind) << c.name;
     EXPECT_STREQ(media_.record.szContainerType, c.container) << c.name;
+    EXPECT_STREQ(media_.record.szTitle, c.title) << c.name;
   }
   EXPECT_STREQ(media_.record.szMake, "Canon");
 }
