@@ -82,13 +82,15 @@ for format in "wma wmav2" "wv wavpack"; do
 done
 
 # Video: H.264 High with AAC in MP4, to be shown turned by 90 degrees; H.264
-# Main with Vorbis in Matroska, anamorphic (4:3 samples).
+# Main with Vorbis in Matroska, anamorphic (4:3 samples), whose second stream
+# has a tag that is not the file's.
 job ff -f lavfi -i testsrc=size=320x240:rate=25:duration=1 -f lavfi -i "$(tone 48000)" \
   -c:v libx264 -profile:v high -preset superfast -pix_fmt yuv420p \
   -c:a aac -b:a 64k -metadata title="Rotated Clip" video_rot90.mp4
 job ff -f lavfi -i testsrc=size=320x240:rate=30:duration=1 -f lavfi -i "$(tone 44100)" \
   -c:v libx264 -profile:v main -preset superfast -pix_fmt yuv420p -aspect 16:9 \
-  -c:a libvorbis -metadata title="Matroska Clip" -metadata artist="Clip Maker" video.mkv
+  -c:a libvorbis -metadata title="Matroska Clip" -metadata artist="Clip Maker" \
+  -metadata:s:a:0 genre="Stream Genre" video.mkv
 
 # Photos: a JPEG to get EXIF, a PNG.
 job ff -f lavfi -i testsrc=size=640x480:rate=1 -frames:v 1 photo_exif.jpg
