@@ -377,26 +377,27 @@ TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
 }
 
 // Every file that is not readable media is refused with a reason a person
-// can read, never answered with a zeroed record.
+// can read, never answered with a zeroed record; a file cut after its
+// header still tells what the header tells.
 TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   TempDir dir;
   FdLeakCheck fds;
-  WriteFile(dir.File("fake.png"), "hello");
-  WriteFile(dir.File("zeros.mp3"), std::string(1 << 20, '\0'));
-  WriteFile(dir.File("empty.jpg"), "");
-  std::string mp4 = ReadFile(Fixture("video_rot90.mp4"));
-  WriteFile(dir.File("cut.mp4"), mp4.substr(0, 200));  // inside its header
-  size_t mdat = mp4.find("mdat") - 4;  // the fixture's moov comes before it
-  WriteFile(dir.File("nomoov.mp4"), mp4.substr(0, 40) + mp4.substr(mdat));
-  std::string jpeg = ReadFile(Fixture("photo_exif.jpg"));
-  WriteFile(dir.File("cut.jpg"), jpeg.substr(0, 40));
+  const std::string mp4 = ReadFile(Fixture("video_rot90.mp4"));
+  const size_t mdat = mp4.find("mdat") - 4;  // the fixture's moov is before
+  for (const auto& [name, bytes] :
+       std::initializer_list<std::pair<const char*, std::string>>{
+           {"fake.png", "hello"},
+           {"zeros.mp3", std::string(1 << 20, '\0')},
+           {"empty.jpg", ""},
+           {"cut.mp4", mp4.substr(0, 200)},  // inside its header
+           {"nomoov.mp4", mp4.substr(0, 40) + mp4.substr(mdat)},
+           {"cut.jpg", ReadFile(Fixture("photo_exif.jpg")).substr(0, 40)}}) {
+    WriteFile(dir.File(name), bytes);
+  }
   ASSERT_EQ(mkfifo(dir.File("fifo.mp3").c_str(), 0600), 0);
   ASSERT_EQ(mkdir(dir.File("album.png").c_str(), 0700), 0);
   ASSERT_EQ(symlink("/dev/zero", dir.File("zero.mp3").c_str()), 0);
-  struct Case {
-    std::string path;
-    const char* reason;  // the start of the reason
-  } cases[] = {
+  const std::pair<std::string, const char*> cases[] = {
       {dir.File("fake.png"), "not a media file"},
       {dir.File("zeros.mp3"), "not a media file"},
       {dir.File("empty.jpg"), "empty file"},
@@ -409,24 +410,17 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
       {dir.File("none.mp3"), "No such file or directory"},
       {"relative/song.mp3", "path is not absolute"},
       {std::string("/tmp/a\0b.mp3", 12), "path holds a zero byte"},
-      {"/" + std::string(5000, 'a'), "path too long"},
-  };
-  for (const Case& c : cases) {
-    EXPECT_FALSE(Parse(c.path)) << c.path;
-    EXPECT_EQ(reason_.rfind(c.reason, 0), 0u) << c.path << ": " << reason_;
+      {"/" + std::string(5000, 'a'), "path too long"}};
+  for (const auto& [path, reason] : cases) {
+    EXPECT_FALSE(Parse(path)) << path;
+    EXPECT_EQ(reason_.rfind(reason, 0), 0u) << path << ": " << reason_;
   }
   EXPECT_TRUE(fds.NoLeak());
-}
-
-// A file cut after its header still tells what the header tells.
-TEST_F(MediaParserTest, TruncatedFilesTellWhatTheirHeadersTell) {
-  TempDir dir;
   HostCodePage host("UTF-8");
   for (const char* name : {"video_rot90.mp4", "song.flac", "song_id3v24.mp3"}) {
     std::string whole = ReadFile(Fixture(name));
-    std::string path = dir.File(name);
-    WriteFile(path, whole.substr(0, whole.size() / 2));
-    ASSERT_TRUE(Parse(path)) << name << ": " << reason_;
+    WriteFile(dir.File(name), whole.substr(0, whole.size() / 2));
+    ASSERT_TRUE(Parse(dir.File(name))) << name << ": " << reason_;
     EXPECT_GT(media_.record.duration, 0.5f) << name;
     EXPECT_STRNE(media_.record.szTitle, "") << name;
   }
@@ -440,15 +434,10 @@ TEST_F(MediaParserTest, UnreadableFileIsRefused) {
   WriteFile(path, ReadFile(Fixture("song_id3v24.mp3")));
   ASSERT_EQ(chmod(path.c_str(), 0), 0);
   ASSERT_EQ(chmod(dir.path().c_str(), 0755), 0);
-  int result = quvaidx::test::RunUnprivileged([&] {
-    MediaParser parser{ParserOptions()};
-    ParsedMedia media;
-    std::string reason;
-    return !parser.Parse(path, &media, &reason) && reason == "Permission denied"
-               ? 0
-               : 1;
-  });
-  EXPECT_EQ(result, 0);
+  EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
+              return !Parse(path) && reason_ == "Permission denied" ? 0 : 1;
+            }),
+            0);
 }
 
 // Sparse files of 4 GiB and more cost no disk: a real song followed by
