@@ -13,7 +13,8 @@ namespace quvahost::test {
 namespace {
 
 const char kDatabase[] =
-    "# shares of this machine\n[video]\npath = /vol1/video\nstatus = 0x20\n\n"
+    "# shares of this machine\npath = /before/any/section\n"
+    "[video]\npath = /vol1/video\nstatus = 0x20\npath = /2nd\nstatus = 2\n\n"
     "[movies]\npath = /vol1/video/movies/\n; no status: not indexed\n"
     "[music]\n  path=/vol1//music  \nstatus = 1\n"
     "[video]\npath = /elsewhere\n"  // a repeated section does not override
@@ -22,6 +23,8 @@ const char kDatabase[] =
     "[broken-status]\npath = /vol1/status\nstatus = twenty\n"
     "[no-path]\nstatus = 0x20\n"
     "[hex]\npath = /h\nstatus = 0X2a\n[max]\npath = /m\nstatus = 4294967295\n"
+    "[hexA]\npath = /h\nstatus = 0xAf\n[hexF]\npath = /h\nstatus = 0XFa\n"
+    "[hexG]\npath = /h\nstatus = 0xG\n[long]\npath = /l\nstatus = 00000000001\n"
     "[over]\npath = /o\nstatus = 4294967296\n[neg]\npath = /n\nstatus = -1\n"
     "[two]\npath = /t\nstatus = 1 2\n[empty]\npath = /e\nstatus =\n";
 
@@ -64,6 +67,10 @@ TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
                {"music", "/vol1/music", 1},
                {"hex", "/h", 0x2A},
                {"max", "/m", 0xFFFFFFFF},
+               {"hexA", "/h", 0xAF},
+               {"hexF", "/h", 0xFA},
+               {"hexG", nullptr, 0},
+               {"long", nullptr, 0},
                {"Video", nullptr, 0},
                {"broken-relative", nullptr, 0},
                {"broken-dotdot", nullptr, 0},
