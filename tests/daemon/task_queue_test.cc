@@ -142,7 +142,9 @@ TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeftAndMissingOnesFail) {
   ASSERT_EQ(msgctl(fresh, IPC_STAT, &status), 0);
   EXPECT_EQ(status.msg_qbytes, 2048u);
   id_ = fresh;
-  LogCapture log;  // calls without a queue or a key file fail
+  LogCapture log;  // only calls without a queue or a key file fail, logged
+  EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), fresh);
+  EXPECT_TRUE(log.lines().empty());
   ASSERT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), -1);
