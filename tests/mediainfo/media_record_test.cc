@@ -1,6 +1,7 @@
 // The media record's JSON form (round trips, 64-bit sizes, absent and
 // mistyped members, texts too long for their fields, video metadata) and its
 // two dumps, on standard output and in the system log.
+#include <float.h>
 #include <stdio.h>
 #include <string.h>
 #include <syslog.h>
@@ -85,13 +86,16 @@ TEST(MediaRecordTest, RoundTripKeepsEveryMemberAndItsType) {
 // member, set alone, converts to 0 (or an empty text) instead of throwing
 // out of the library; a value that is no object is left as it is.
 TEST(MediaRecordTest, AbsentAndMistypedMembersAreZeroAndFittingOnesRead) {
-  Json::Value in = Parse(R"({"track": 3.9, "ID": 4294967295, "duration": 2,
-      "year": -2147483648, "blTitleUTF16": true, "extra": "ignored"})");
+  Json::Value in = Parse(R"({"track": 3.9, "ID": 4294967295,
+      "duration": 3.4028234663852886e38, "year": -2147483648,
+      "disc": -2147483648.0, "audio_bitrate": 4294967295.0,
+      "fileSize": 1e19, "blTitleUTF16": true, "extra": "ignored"})");
   __tag_QUVA_MEDIA_INFO expected = Zero();
   expected.track = 3;  // cut toward zero
-  expected.ID = 4294967295u;
-  expected.duration = 2.0f;
-  expected.year = INT32_MIN;
+  expected.ID = expected.audio_bitrate = 4294967295u;
+  expected.duration = FLT_MAX;
+  expected.year = expected.disc = INT32_MIN;
+  expected.fileSize = 10000000000000000000u;
   expected.blTitleUTF16 = 1;
   __tag_QUVA_MEDIA_INFO r = FromJson(in);
   EXPECT_EQ(memcmp(&r, &expected, sizeof(r)), 0);
