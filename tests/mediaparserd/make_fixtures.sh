@@ -91,6 +91,13 @@ job ff -f lavfi -i testsrc=size=320x240:rate=30:duration=1 -f lavfi -i "$(tone 4
   -c:v libx264 -profile:v main -preset superfast -pix_fmt yuv420p -aspect 16:9 \
   -c:a libvorbis -metadata title="Matroska Clip" -metadata artist="Clip Maker" \
   -metadata:s:a:0 genre="Stream Genre" video.mkv
+# Profiles from the configuration record alone: H.264 Constrained Baseline
+# with AAC, and HEVC Main without sound.
+job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -f lavfi -i "$(tone 48000)" \
+  -c:v libx264 -profile:v baseline -preset superfast -pix_fmt yuv420p -c:a aac \
+  -b:a 32k video_baseline.mp4
+job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -c:v libx265 \
+  -preset superfast -x265-params log-level=error -pix_fmt yuv420p -tag:v hvc1 video_hevc.mp4
 
 # Photos: a JPEG to get EXIF, a PNG.
 job ff -f lavfi -i testsrc=size=640x480:rate=1 -frames:v 1 photo_exif.jpg
