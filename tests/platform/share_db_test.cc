@@ -172,6 +172,7 @@ TEST_F(ShareDbTest, RefusedCallsChangeNothing) {
 }
 
 TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
+  quvaidx::test::FdLeakCheck leaks;
   std::string target = etc_.File("real.conf");
   rename(Db().c_str(), target.c_str());
   ASSERT_EQ(symlink(target.c_str(), Db().c_str()), 0);
@@ -183,6 +184,7 @@ TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
   ASSERT_EQ(stat(target.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0640u);
   EXPECT_EQ(Get("music").status, 0x21u);
+  EXPECT_TRUE(leaks.NoLeak());
   std::filesystem::directory_iterator entries(etc_.path()), end;
   EXPECT_LE(std::distance(entries, end), 3) << "link, target and lock only";
 }
