@@ -99,15 +99,17 @@ job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -f lavfi -i "$(tone 4
 job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -c:v libx265 \
   -preset superfast -x265-params log-level=error -pix_fmt yuv420p -tag:v hvc1 video_hevc.mp4
 
-# Photos: a JPEG to get EXIF, a PNG.
+# Photos: a JPEG to get EXIF; PNG, GIF, TIFF (read whole), BMP, WebP.
 job ff -f lavfi -i testsrc=size=640x480:rate=1 -frames:v 1 photo_exif.jpg
-job ff -f lavfi -i testsrc=size=200x100:rate=1 -frames:v 1 photo.png
+for format in png gif tif bmp webp; do
+  job ff -f lavfi -i testsrc=size=200x100:rate=1 -frames:v 1 "photo.$format"
+done
 collect
 
 # One exiftool run writes the EXIF of the photo and the video's rotation.
 exiftool -Make="Canon" -Model="Canon EOS 5D Mark IV" -ExposureTime=1/125 \
   -FNumber=2.8 -ISO=400 -Orientation#=6 "-DateTimeOriginal=2021:05:01 12:34:56" \
-  photo_exif.jpg -execute -Rotation=90 video_rot90.mp4 \
+  photo_exif.jpg photo.tif -execute -Rotation=90 video_rot90.mp4 \
   -common_args -q -overwrite_original
 
 rm plain.mp3 lc22k.m4a cover.png

@@ -236,7 +236,8 @@ INSTANTIATE_TEST_SUITE_P(
                       "song.ogg", "song_lc.m4a", "song_he.m4a", "song.wav",
                       "song.aiff", "song.wma", "song.wv", "song.tta",
                       "song.opus", "song.oga", "video_rot90.mp4", "video.mkv",
-                      "video_baseline.mp4", "video_hevc.mp4", "photo.png"));
+                      "video_baseline.mp4", "video_hevc.mp4", "photo.png",
+                      "photo.gif", "photo.tif", "photo.bmp", "photo.webp"));
 
 // A file system without a superblock (a tmpfs) has no UUID.
 TEST_F(MediaParserTest, FileSystemWithoutSuperblockHasNoUuid) {
@@ -252,28 +253,32 @@ TEST_F(MediaParserTest, FileSystemWithoutSuperblockHasNoUuid) {
   EXPECT_STREQ(media_.record.szFsUUID, "");
 }
 
-// The camera's fields of a JPEG against exiftool; its orientation is kept
-// as the tag says, and only videos are turned.
+// The camera's fields of a JPEG and of a TIFF (which exiv2 reads whole)
+// against exiftool; the orientation is kept as the tag says, and only videos
+// are turned.
 TEST_F(MediaParserTest, PhotoFieldsAgreeWithExiftool) {
-  std::string path = Fixture("photo_exif.jpg");
-  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
-  Json::Value exif = CommandJson("exiftool -j " + Quoted(path))[0];
-  ASSERT_TRUE(exif.isObject());
-  EXPECT_EQ(media_.kind, MediaKind::kPhoto);
-  EXPECT_TRUE(HeadLooksLikePhoto(path));
-  EXPECT_EQ(r.szMake, exif["Make"].asString());
-  EXPECT_EQ(r.szModel, exif["Model"].asString());
-  EXPECT_EQ(r.szExposure, exif["ExposureTime"].asString());
-  EXPECT_DOUBLE_EQ(atof(r.szAperture), exif["FNumber"].asDouble());
-  EXPECT_EQ(r.iso, exif["ISO"].asInt());
-  std::string taken = exif["DateTimeOriginal"].asString();
-  taken[4] = taken[7] = '-';
-  EXPECT_EQ(r.szTakenTime, taken);
-  EXPECT_EQ(r.resolutionX, exif["ImageWidth"].asInt());
-  EXPECT_EQ(r.resolutionY, exif["ImageHeight"].asInt());
-  EXPECT_STREQ(r.szContainerType, "image2");
-  EXPECT_EQ(media_.orientation, 6);  // "Rotate 90 CW"
-  EXPECT_EQ(media_.video.rotation, 0);
+  for (const char* name : {"photo_exif.jpg", "photo.tif"}) {
+    SCOPED_TRACE(name);
+    std::string path = Fixture(name);
+    const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+    Json::Value exif = CommandJson("exiftool -j " + Quoted(path))[0];
+    ASSERT_TRUE(exif.isObject());
+    EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+    EXPECT_TRUE(HeadLooksLikePhoto(path));
+    EXPECT_EQ(r.szMake, exif["Make"].asString());
+    EXPECT_EQ(r.szModel, exif["Model"].asString());
+    EXPECT_EQ(r.szExposure, exif["ExposureTime"].asString());
+    EXPECT_DOUBLE_EQ(atof(r.szAperture), exif["FNumber"].asDouble());
+    EXPECT_EQ(r.iso, exif["ISO"].asInt());
+    std::string taken = exif["DateTimeOriginal"].asString();
+    taken[4] = taken[7] = '-';
+    EXPECT_EQ(r.szTakenTime, taken);
+    EXPECT_EQ(r.resolutionX, exif["ImageWidth"].asInt());
+    EXPECT_EQ(r.resolutionY, exif["ImageHeight"].asInt());
+    EXPECT_STREQ(r.szContainerType, "image2");
+    EXPECT_EQ(media_.orientation, 6);  // "Rotate 90 CW"
+    EXPECT_EQ(media_.video.rotation, 0);
+  }
 }
 
 // The texts of ID3v1 tags and of ID3v2 frames declared Latin-1 are decoded
