@@ -6,6 +6,8 @@
 #define QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 
 #include <functional>
+#include <utility>
+#include <vector>
 
 namespace quvaidx::test {
 
@@ -24,6 +26,13 @@ int RunUnprivileged(const std::function<int()>& check);
 // Returns the value `check` returned, or -1 when the child did not finish.
 int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
                          unsigned seconds = 5);
+
+// Runs `check` in a child process in which every call of each system call
+// number of `failures` fails at once with its errno value (a seccomp filter),
+// as on a filesystem or kernel without that call. Returns the value `check`
+// returned, or -1 when the child could not run it.
+int RunWithSyscallsFailing(const std::vector<std::pair<long, int>>& failures,
+                           const std::function<int()>& check);
 
 }  // namespace quvaidx::test
 

@@ -3,6 +3,7 @@
 #include <limits.h>
 #include <stdlib.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <string>
@@ -21,6 +22,7 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::ReadFile;
 using quvaidx::test::RunUnprivileged;
 using quvaidx::test::RunWithFileSizeLimit;
+using quvaidx::test::RunWithSyscallsFailing;
 using quvaidx::test::WriteFile;
 
 int EntriesIn(const std::string& dir) {
@@ -98,6 +100,35 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
           "quvaidx_system:N [Error] rename: " + source_ + " -> " + nowhere,
           "quvaidx_system:N [Error] rename reach max retry: " + dir_.File("d") +
               " -> " + inside}));
+}
+
+// Where the filesystem cannot rename without replacing, a hard link stands
+// in, failing instead of replacing; where it has no hard links either, the
+// plain rename after the existence test is all there is.
+TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
+  const std::vector<std::pair<long, int>> kinds[] = {
+      {{SYS_renameat2, EINVAL}},
+      {{SYS_renameat2, ENOSYS}, {SYS_link, EPERM}, {SYS_linkat, EPERM}}};
+  for (const auto& failures : kinds) {
+    WriteFile(source_, "s");
+    unlink(destination_.c_str());
+    EXPECT_EQ(
+        RunWithSyscallsFailing(
+            failures,
+            [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
+        0);
+    EXPECT_EQ(ReadFile(destination_), "s");
+    EXPECT_NE(access(source_.c_str(), F_OK), 0);
+  }
+  WriteFile(source_, "t");
+  ASSERT_EQ(unlink(destination_.c_str()), 0);
+  ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
+  EXPECT_EQ(
+      RunWithSyscallsFailing(
+          kinds[0],
+          [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
+      0);
+  EXPECT_EQ(ReadFile(source_), "t");
 }
 
 // The first n lines go (none for n <= 0), across copy blocks too; the file
