@@ -168,6 +168,7 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   const std::string fifo = dir_.File("fifo");
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
   ASSERT_EQ(symlink(source_.c_str(), dir_.File("link").c_str()), 0);
+  LogCapture log;
   alarm(5);  // a trim that waits on the FIFO ends the test here
   for (const std::string& odd :
        {destination_, dir_.path(), fifo, dir_.File("link")}) {
@@ -176,6 +177,10 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   alarm(0);
   EXPECT_EQ(FileRemoveHeadingLine(nullptr, 1), -1);
   EXPECT_EQ(EntriesIn(dir_.path()), 3);  // the source, the FIFO, the link
+  EXPECT_EQ(
+      log.Normalized(),
+      std::vector<std::string>{"quvaidx_system:N [Error] " + dir_.File("link") +
+                               " is a symbolic link; not trimmed"});
 }
 
 // A disk that fills while the copy is written, or a file of another user,
