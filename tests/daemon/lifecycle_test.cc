@@ -205,45 +205,49 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   EXPECT_TRUE(leaks.NoLeak());  // and its lock released
 }
 
-// A stale pid file removed, and a new one locked by another instance, while
-// a start holds the old file open unlocked: the start must see that the path
-// names another file now, and be refused by that file's lock. The start is
-// stopped at its flock by ptrace, to make the race happen every time.
+// A stale pid file removed, and a new one made, while a start holds the old
+// file open unlocked: the start must see that the path names another file
+// now and start over with it, refused while another instance holds it,
+// running in it otherwise. The start is stopped at its flock by ptrace, to
+// make the race happen every time.
 TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
-  WriteFile(pid_file_, "");
-  pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    ptrace(PTRACE_TRACEME, 0, nullptr, nullptr);
-    raise(SIGSTOP);
-    dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
-    _exit(BecomeProcess(pid_file_.c_str()) == 0 ? 1 : 0);
-  }
-  int status = 0, successor = -1;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  ptrace(PTRACE_SETOPTIONS, child, nullptr, PTRACE_O_TRACESYSGOOD);
-  for (int stops = 0; stops < 10000; ++stops) {
-    if (ptrace(PTRACE_SYSCALL, child, nullptr, nullptr) != 0 ||
-        waitpid(child, &status, 0) != child || !WIFSTOPPED(status)) {
-      break;
+  for (bool held : {true, false}) {
+    WriteFile(pid_file_, "");
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      ptrace(PTRACE_TRACEME, 0, nullptr, nullptr);
+      raise(SIGSTOP);
+      dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
+      _exit(BecomeProcess(pid_file_.c_str()) == 0 ? 1 : 0);
     }
-    struct __ptrace_syscall_info info = {};
-    if (successor < 0 &&
-        ptrace(PTRACE_GET_SYSCALL_INFO, child, sizeof(info), &info) > 0 &&
-        info.op == PTRACE_SYSCALL_INFO_ENTRY && info.entry.nr == SYS_flock) {
-      unlink(pid_file_.c_str());  // the stale file goes ...
-      successor = open(pid_file_.c_str(), O_WRONLY | O_CREAT, 0644);
-      ASSERT_EQ(flock(successor, LOCK_EX), 0);  // ... and a new one is held
+    int status = 0, successor = -1;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ptrace(PTRACE_SETOPTIONS, child, nullptr, PTRACE_O_TRACESYSGOOD);
+    for (int stops = 0; stops < 10000; ++stops) {
+      if (ptrace(PTRACE_SYSCALL, child, nullptr, nullptr) != 0 ||
+          waitpid(child, &status, 0) != child || !WIFSTOPPED(status)) {
+        break;
+      }
+      struct __ptrace_syscall_info info = {};
+      if (successor < 0 &&
+          ptrace(PTRACE_GET_SYSCALL_INFO, child, sizeof(info), &info) > 0 &&
+          info.op == PTRACE_SYSCALL_INFO_ENTRY && info.entry.nr == SYS_flock) {
+        unlink(pid_file_.c_str());  // the stale file goes, a new one comes
+        successor = open(pid_file_.c_str(), O_WRONLY | O_CREAT, 0644);
+        ASSERT_EQ(held ? flock(successor, LOCK_EX) : 0, 0);
+      }
     }
+    if (successor < 0) {
+      kill(child, SIGKILL);
+      waitpid(child, nullptr, 0);
+      GTEST_SKIP() << "no ptrace here";
+    }
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == (held ? 0 : 1))
+        << (held ? "a second instance runs" : "the start was refused");
+    EXPECT_EQ(ReadFile(pid_file_), held ? "" : std::to_string(child));
+    close(successor);
   }
-  if (successor < 0) {
-    kill(child, SIGKILL);
-    waitpid(child, nullptr, 0);
-    GTEST_SKIP() << "no ptrace here";
-  }
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0)
-      << "a second instance runs";
-  close(successor);
 }
 
 // The detached process also keeps the lock taken before detaching: a second
