@@ -336,26 +336,28 @@ std::string Id3v2Frame(const char* id, const std::string& body) {
 TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
   HostCodePage host("UTF-8");
   TempDir dir;
-  const std::string frames =
-      Id3v2Frame("COMM", std::string("\0engiTunNORM\0 0001", 18)) +
-      Id3v2Frame("COMM", std::string("\0eng\0Liner notes", 16)) +
-      Id3v2Frame("TPE1", std::string("\0Kino", 5)) +
-      Id3v2Frame("TCON", std::string("\0(17)", 5)) +
-      Id3v2Frame("TPOS", std::string("\0"
-                                     "2/3",
-                                     4));
-  for (char encoding : {'\x04', '\x65', '\xFF'}) {
+  auto latin1 = [](const char* text) { return std::string(1, '\0') + text; };
+  const std::string described =
+      Id3v2Frame("COMM", std::string("\0engiTunNORM\0 0001", 18));
+  const std::string frames = Id3v2Frame("TPE1", latin1("Kino")) +
+                             Id3v2Frame("TCON", latin1("(17)")) +
+                             Id3v2Frame("TPOS", latin1("2/3"));
+  const std::tuple<char, std::string, const char*> cases[] = {
+      {'\x04', Id3v2Frame("COMM", std::string("\0eng\0Notes", 10)), "Notes"},
+      {'\x65', Id3v2Frame("COMM", std::string("\0eng\0Notes", 10)), "Notes"},
+      {'\xFF', "", " 0001"}};  // only a described comment: that one
+  for (const auto& [encoding, comment, expected] : cases) {
     std::string tag = "ID3\x03" + std::string(2, '\0');
     std::string all =
         Id3v2Frame("TIT2", encoding + std::string("AB\0CD\xFF\xFE", 7)) +
-        frames;
+        described + comment + frames;
     for (int shift : {21, 14, 7, 0}) tag += char((all.size() >> shift) & 0x7F);
     WriteFile(dir.File("odd.mp3"),
               tag + all + ReadFile(Fixture("song_id3v1_cp1251.mp3")));
     ASSERT_TRUE(Parse(dir.File("odd.mp3"))) << reason_;
     EXPECT_TRUE(IsValidUTF8(media_.record.szTitle));
     EXPECT_STREQ(media_.record.szArtist, "Kino");
-    EXPECT_STREQ(media_.record.szComment, "Liner notes");
+    EXPECT_STREQ(media_.record.szComment, expected);
     EXPECT_STREQ(media_.record.szGenre, "Rock");
     EXPECT_EQ(media_.record.disc, 2);
     EXPECT_EQ(media_.record.year, 1999);  // from the ID3v1 tag
