@@ -49,6 +49,19 @@ TagText UTF16(const std::u16string& text) {
       std::string(reinterpret_cast<const char*>(text.data()), 2 * text.size())};
 }
 
+// Checks the members of the record named in `expected`, a JSON object, as
+// their JSON texts: many fields in one line.
+void ExpectFields(__tag_QUVA_MEDIA_INFO r, const char* expected) {
+  Json::Value all, want;
+  MediaInfoObject2Json(r, all);
+  ASSERT_TRUE(Json::Reader().parse(expected, want)) << expected;
+  for (const std::string& name : want.getMemberNames()) {
+    EXPECT_EQ(Json::FastWriter().write(all[name]),
+              Json::FastWriter().write(want[name]))
+        << name;
+  }
+}
+
 // The record of "/music/Album X/01 song.mp3" (5 GiB) under the code page
 // UTF-8 unless a test sets another.
 class RecordFillTest : public ::testing::Test {
@@ -136,32 +149,19 @@ TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
   video.level = std::numeric_limits<int64_t>::min();
   video.frame_rate_num = int64_t{1} << 35;
   video.frame_rate_den = 1;
-  __tag_QUVA_MEDIA_INFO r = Fill(kVideo, container);
-  EXPECT_EQ(r.duration, FLT_MAX);
-  EXPECT_EQ(r.frame_bitrate, UINT32_MAX);
-  EXPECT_EQ(r.audio_bitrate, 0u);
-  EXPECT_EQ(r.video_bitrate, UINT32_MAX);
-  EXPECT_EQ(r.frequency, 0);
-  EXPECT_EQ(r.channel, INT32_MAX);
-  EXPECT_STREQ(r.szAudioCodec, "aac_invalid");
-  EXPECT_EQ(r.resolutionX, INT32_MAX);
-  EXPECT_EQ(r.resolutionY, 0);
-  EXPECT_EQ(r.videoProfile, -99);  // FFmpeg's "unknown" is kept
-  EXPECT_EQ(r.videoLevel, INT32_MIN);
-  EXPECT_EQ(r.frame_rate_num, 0);
-  EXPECT_EQ(r.frame_rate_den, 0);
-  EXPECT_EQ(r.fileSize, 5ull << 32);
-  EXPECT_STREQ(r.szContainerType, "");
-  EXPECT_STREQ(r.szVideoCodec, "");
-  EXPECT_STREQ(r.szFsUUID, "");
+  ExpectFields(Fill(kVideo, container), R"({"duration": 3.4028234663852886e38,
+      "frame_bitrate": 4294967295, "audio_bitrate": 0, "frequency": 0,
+      "video_bitrate": 4294967295, "channel": 2147483647, "resolutionY": 0,
+      "szAudioCodec": "aac_invalid", "resolutionX": 2147483647,
+      "videoProfile": -99, "videoLevel": -2147483648, "frame_rate_num": 0,
+      "frame_rate_den": 0, "fileSize": 21474836480, "szContainerType": "",
+      "szVideoCodec": "", "szFsUUID": ""})");
   container.streams[0].codec = "fl\xE9";
   video.frame_rate_num = 30000;
   video.frame_rate_den = int64_t{1} << 31;
   video.level = int64_t{1} << 31;
-  r = Fill(kVideo, container);
-  EXPECT_STREQ(r.szAudioCodec, "");
-  EXPECT_EQ(r.frame_rate_num, 0);
-  EXPECT_EQ(r.videoLevel, INT32_MAX);
+  ExpectFields(Fill(kVideo, container), R"({"szAudioCodec": "",
+      "frame_rate_num": 0, "videoLevel": 2147483647})");
   for (double duration : {static_cast<double>(NAN), -3.0}) {
     container.duration = duration;
     EXPECT_EQ(Fill(kVideo, container).duration, 0.0f) << duration;
@@ -184,20 +184,13 @@ TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
 TEST_F(RecordFillTest, SongTakesTheContainerRateAndCountsItsCovers) {
   ContainerFacts container = Container("flac", "acc");
   container.bit_rate = 171960;
-  __tag_QUVA_MEDIA_INFO r = Fill(kMusic, container);
-  EXPECT_EQ(r.audio_bitrate, 171960u);
-  EXPECT_EQ(r.frame_bitrate, 171960u);
-  EXPECT_EQ(r.coverCount, 2);
-  EXPECT_EQ(r.resolutionX, 0);
-  EXPECT_STREQ(r.szVideoCodec, "");
-  EXPECT_STREQ(r.szName, "01 song.mp3");
+  ExpectFields(Fill(kMusic, container), R"({"audio_bitrate": 171960,
+      "frame_bitrate": 171960, "coverCount": 2, "resolutionX": 0,
+      "szVideoCodec": "", "szName": "01 song.mp3"})");
   container.streams.push_back(Container("", "v").streams[0]);
   EXPECT_EQ(Fill(kVideo, container).audio_bitrate, 0u);
-  r = Fill(kMusic, Container("mp3", ""));
-  EXPECT_EQ(r.duration, 0.0f);
-  EXPECT_EQ(r.audio_bitrate, 0u);
-  EXPECT_STREQ(r.szAudioCodec, "");
-  EXPECT_STREQ(r.szTitle, "");
+  ExpectFields(Fill(kMusic, Container("mp3", "")), R"({"duration": 0.0,
+      "audio_bitrate": 0, "szAudioCodec": "", "szTitle": ""})");
 }
 
 // UTF-16 of Latin letters has a zero in every code unit, and Cyrillic
@@ -303,23 +296,14 @@ TEST_F(RecordFillTest, ContainerTagsGiveTextsAndLeadingNumbers) {
                     {"track", "3/12"},      {"disc", " 2"},
                     {"date", "20210501"},   {"album_artist", "Various"},
                     {"year", "1999"},       {"title", "ignored"}};
-  __tag_QUVA_MEDIA_INFO r = Fill(kVideo, container);
-  EXPECT_STREQ(r.szTitle, "Clip");
-  EXPECT_STREQ(r.szArtist, "Maker");
-  EXPECT_STREQ(r.szAlbum, "Album");
-  EXPECT_STREQ(r.szGenre, "Genre");
-  EXPECT_STREQ(r.szComposer, "Writer");
-  EXPECT_STREQ(r.szComment, "Note");
-  EXPECT_STREQ(r.szAlbumArtist, "Various");
-  EXPECT_EQ(r.track, 3);
-  EXPECT_EQ(r.disc, 2);
-  EXPECT_EQ(r.year, 2021);
+  ExpectFields(Fill(kVideo, container), R"({"szTitle": "Clip",
+      "szArtist": "Maker", "szAlbum": "Album", "szGenre": "Genre",
+      "szComposer": "Writer", "szComment": "Note", "szAlbumArtist": "Various",
+      "track": 3, "disc": 2, "year": 2021})");
   container.tags = {
       {"track", "99999999999999999999"}, {"year", "1987-02"}, {"disc", "two"}};
-  r = Fill(kVideo, container);
-  EXPECT_EQ(r.track, 999999999);
-  EXPECT_EQ(r.year, 1987);
-  EXPECT_EQ(r.disc, 0);
+  ExpectFields(Fill(kVideo, container),
+               R"({"track": 999999999, "year": 1987, "disc": 0})");
   container.tags = {{"date", "-5"}};
   EXPECT_EQ(Fill(kVideo, container).year, 0);
 }
@@ -380,24 +364,15 @@ TEST_F(RecordFillTest, PhotoFieldsAreCleanAndSized) {
   container.streams[0].width = 3;
   container.streams[0].height = 2;
   container.duration = 0.04;
-  __tag_QUVA_MEDIA_INFO r = Fill(photo, container);
-  EXPECT_STREQ(r.szMake, "Canon");
-  EXPECT_STREQ(r.szModel, "Киев");
-  EXPECT_EQ(r.resolutionX, 3);
-  EXPECT_EQ(r.resolutionY, 2);
-  EXPECT_EQ(r.iso, 0);
-  EXPECT_EQ(r.duration, 0.0f);
-  EXPECT_STREQ(r.szVideoCodec, "");
-  EXPECT_STREQ(r.szContainerType, "image2");
+  ExpectFields(Fill(photo, container), R"({"szMake": "Canon",
+      "szModel": "Киев", "resolutionX": 3, "resolutionY": 2, "iso": 0,
+      "duration": 0.0, "szVideoCodec": "", "szContainerType": "image2"})");
   photo.height = 480;
   photo.iso = 200;
-  r = Fill(photo, container);
-  EXPECT_EQ(r.resolutionX, 640);
-  EXPECT_EQ(r.resolutionY, 480);
-  EXPECT_EQ(r.iso, 200);
-  r = Fill(kPhoto, container);  // no EXIF at all
-  EXPECT_EQ(r.resolutionX, 3);
-  EXPECT_STREQ(r.szMake, "");
+  ExpectFields(Fill(photo, container),
+               R"({"resolutionX": 640, "resolutionY": 480, "iso": 200})");
+  ExpectFields(Fill(kPhoto, container),  // no EXIF at all
+               R"({"resolutionX": 3, "szMake": ""})");
 }
 
 // The rotation is the clockwise quarter turn nearest the display matrix's
