@@ -69,17 +69,17 @@ job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a aac -b:a 96k "${tags[@]}" song_lc.
 job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a pcm_s16le \
   -metadata title="Wave Title" -metadata artist="Wave Artist" song.wav
 # The other tag readers: AIFF (ID3v2), TTA, and Ogg's Opus, Speex and FLAC;
-# ASF and WavPack (APE) with the tags whose keys ffmpeg and TagLib share.
+# ASF and WavPack (APE) with the tags whose keys ffmpeg and TagLib share, and
+# an APE album artist under the key only TagLib knows.
 for format in "aiff pcm_s16be -write_id3v2 1" "tta tta" "opus libopus" \
   "spx libspeex -ar 16000" "oga flac"; do
   set -- $format
   job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a "$2" "${@:3}" "${tags[@]}" "song.$1"
 done
-for format in "wma wmav2" "wv wavpack"; do
-  set -- $format
-  job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a "$2" "${tags[@]:0:6}" \
-    -metadata genre=Rock -metadata track=3/12 "song.$1"
-done
+job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a wmav2 "${tags[@]:0:8}" \
+  -metadata genre=Rock -metadata track=3/12 song.wma
+job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a wavpack "${tags[@]:0:6}" \
+  -metadata genre=Rock -metadata track=3/12 -metadata "Album Artist=Various Artists" song.wv
 
 # Video: H.264 High with AAC in MP4, to be shown turned by 90 degrees; H.264
 # Main with Vorbis in Matroska, anamorphic (4:3 samples), whose second stream
