@@ -162,6 +162,19 @@ TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
   video.level = int64_t{1} << 31;
   ExpectFields(Fill(kVideo, container), R"({"szAudioCodec": "",
       "frame_rate_num": 0, "videoLevel": 2147483647})");
+  // Names are strict UTF-8 at every bound of its lead bytes, or left out.
+  const std::pair<const char*, bool> names[] = {
+      {"\xC2\x80", true},          {"\xDF\xBF", true},
+      {"\xE0\xA0\x80", true},      {"\xEF\xBF\xBF", true},
+      {"\xF0\x90\x80\x80", true},  {"\xF4\x8F\xBF\xBF", true},
+      {"\xC1\xBF", false},         {"\xE0\x9F\xBF", false},
+      {"\xED\xA0\x80", false},     {"\xF0\x8F\xBF\xBF", false},
+      {"\xF4\x90\x80\x80", false}, {"\xF5\x80\x80\x80", false},
+      {"a\xE2\x82", false},        {"\xC2\x41", false}};
+  for (const auto& [name, valid] : names) {
+    file_.fs_uuid = name;
+    EXPECT_STREQ(Fill(kVideo, container).szFsUUID, valid ? name : "") << name;
+  }
   for (double duration : {static_cast<double>(NAN), -3.0}) {
     container.duration = duration;
     EXPECT_EQ(Fill(kVideo, container).duration, 0.0f) << duration;
