@@ -440,6 +440,24 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   }
 }
 
+// A header that gives no picture size does not tell all: the picture is
+// decoded for it.
+TEST_F(MediaParserTest, HeaderWithoutPictureSizeIsNotTrusted) {
+  TempDir dir;
+  const std::string video = ReadFile(Fixture("video_rot90.mp4"));
+  // The sample entry of the picture stream: its width, then its height.
+  const size_t entry = video.find("avc1", video.find("stsd"));
+  ASSERT_NE(entry, std::string::npos);
+  for (size_t at : {entry + 28, entry + 30}) {
+    std::string patched = video;
+    patched[at] = patched[at + 1] = '\0';
+    WriteFile(dir.File("zero.mp4"), patched);
+    ASSERT_TRUE(Parse(dir.File("zero.mp4"))) << reason_;
+    EXPECT_EQ(media_.record.resolutionX, 320) << at - entry;
+    EXPECT_EQ(media_.record.resolutionY, 240) << at - entry;
+  }
+}
+
 // A daemon that is not root cannot open what its user may not read. Mode 0
 // keeps even the owner out, so the check holds whoever runs the tests.
 TEST_F(MediaParserTest, UnreadableFileIsRefused) {
