@@ -162,6 +162,10 @@ TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
   video.level = int64_t{1} << 31;
   ExpectFields(Fill(kVideo, container), R"({"szAudioCodec": "",
       "frame_rate_num": 0, "videoLevel": 2147483647})");
+  video.frame_rate_num = video.frame_rate_den = INT32_MAX;  // as large as fits
+  ExpectFields(
+      Fill(kVideo, container),
+      R"({"frame_rate_num": 2147483647, "frame_rate_den": 2147483647})");
   // Names are strict UTF-8 at every bound of its lead bytes, or left out.
   const std::pair<const char*, bool> names[] = {
       {"\xC2\x80", true},          {"\xDF\xBF", true},
