@@ -440,6 +440,45 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   }
 }
 
+// A photo whose pixel size cannot be read (no frame header) is still a
+// photo when any one of its camera fields can be; with none, it is a
+// damaged image.
+TEST_F(MediaParserTest, PhotoWithoutPixelSizeIsKnownByAnyCameraField) {
+  TempDir dir;
+  const std::string jpeg = dir.File("p.jpg");
+  const std::tuple<const char*, const char*, const char*> cases[] = {
+      {"-Make=Leica", "szMake", "\"Leica\""},
+      {"-Model=M6", "szModel", "\"M6\""},
+      {"-ExposureTime=1/60", "szExposure", "\"1/60\""},
+      {"-FNumber=2", "szAperture", "\"2.0\""},
+      {"-ISO=100", "iso", "100"},
+      {"-DateTimeOriginal=2020:01:02 03:04:05", "szTakenTime",
+       "\"2020-01-02 03:04:05\""},
+      {"-Artist=nobody", "", ""}};
+  for (const auto& [tag, field, value] : cases) {
+    WriteFile(jpeg, ReadFile(Fixture("photo_exif.jpg")));
+    CommandOutput("exiftool -q -all= -overwrite_original " + Quoted(tag) + " " +
+                  Quoted(jpeg));
+    std::string bytes = ReadFile(jpeg);
+    size_t sof = bytes.find("\xFF\xC0");  // the frame header, with the size
+    ASSERT_NE(sof, std::string::npos) << tag;
+    bytes.erase(sof, 2 + (static_cast<uint8_t>(bytes[sof + 2]) << 8 |
+                          static_cast<uint8_t>(bytes[sof + 3])));
+    WriteFile(jpeg, bytes);
+    if (field[0] == '\0') {
+      EXPECT_FALSE(Parse(jpeg));
+      EXPECT_EQ(reason_, "damaged image (no pixel size)");
+      continue;
+    }
+    ASSERT_TRUE(Parse(jpeg)) << tag << ": " << reason_;
+    EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+    Json::Value json;
+    MediaInfoObject2Json(media_.record, json);
+    EXPECT_EQ(Json::FastWriter().write(json[field]), std::string(value) + "\n");
+    EXPECT_EQ(media_.record.resolutionX + media_.record.resolutionY, 0);
+  }
+}
+
 // A header that gives no picture size does not tell all: the picture is
 // decoded for it.
 TEST_F(MediaParserTest, HeaderWithoutPictureSizeIsNotTrusted) {
