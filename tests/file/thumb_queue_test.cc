@@ -70,7 +70,9 @@ TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
       {media_ + "/x.mp4", THUMB_TYPE_VIDEO},
       {media_, THUMB_TYPE_VIDEO}};
   for (const auto& [path, type] : calls) {
-    EXPECT_EQ(WriteThumbQueue(path.c_str(), _tag_THUMB_TYPE_(type)), 0) << path;
+    EXPECT_EQ(
+        WriteThumbQueue(path.c_str(), static_cast<_tag_THUMB_TYPE_>(type)), 0)
+        << path;
     EXPECT_EQ(Signals(), 1) << path;
   }
   EXPECT_EQ(ReadFile(thumb_queue_), media_ + "\n");

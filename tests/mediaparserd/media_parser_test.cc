@@ -325,7 +325,8 @@ TEST_F(MediaParserTest, LegacyTagsAreReadInTheHostCodePage) {
 // An ID3v2.3 frame `id` holding `body`.
 std::string Id3v2Frame(const char* id, const std::string& body) {
   std::string frame = id;
-  for (int shift : {24, 16, 8, 0}) frame += char(body.size() >> shift);
+  for (int shift : {24, 16, 8, 0})
+    frame += static_cast<char>(body.size() >> shift);
   return frame + std::string(2, '\0') + body;
 }
 
@@ -351,7 +352,8 @@ TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
     std::string all =
         Id3v2Frame("TIT2", encoding + std::string("AB\0CD\xFF\xFE", 7)) +
         described + comment + frames;
-    for (int shift : {21, 14, 7, 0}) tag += char((all.size() >> shift) & 0x7F);
+    for (int shift : {21, 14, 7, 0})
+      tag += static_cast<char>((all.size() >> shift) & 0x7F);
     WriteFile(dir.File("odd.mp3"),
               tag + all + ReadFile(Fixture("song_id3v1_cp1251.mp3")));
     ASSERT_TRUE(Parse(dir.File("odd.mp3"))) << reason_;
