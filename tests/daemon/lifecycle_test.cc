@@ -22,6 +22,7 @@
 #include "quvaidx/system.h"
 #include "support/fake_host.h"
 #include "support/fake_sleep.h"
+#include "support/fd_check.h"
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
@@ -175,6 +176,7 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
 // full) fails the start and leaves the file unlocked, so the next start is
 // not turned away.
 TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
+  ASSERT_EQ(BecomeProcess(dir_.File("own.pid").c_str()), 0);  // held too
   std::vector<pid_t> other;
   int hold = -1;
   ASSERT_EQ(StartTogether(pid_file_, 1, &other, &hold), "R");
@@ -291,6 +293,19 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
   EXPECT_EQ(::testing::internal::GetCapturedStdout(),
             "Daemon alive. No need to start\n");
+  int result[2];  // a second daemon reports whether it was refused
+  ASSERT_EQ(pipe(result), 0);
+  if (fork() == 0) {
+    dup2(open("/dev/null", O_WRONLY), 1);
+    (void)!write(result[1], BecomeDaemon(pid_file_.c_str()) == -1 ? "R" : "D",
+                 1);
+    _exit(0);
+  }
+  close(result[1]);
+  char refused = 0;
+  EXPECT_EQ(read(result[0], &refused, 1), 1);
+  EXPECT_EQ(refused, 'R');
+  close(result[0]);
   WriteFile(stop, "");
   // Once it ends, its lock goes with it.
   for (int i = 0; i < 2500 && !Unlocked(pid_file_); ++i) usleep(2000);
@@ -300,6 +315,7 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
 // A marker file is made (or emptied) and removed; its age is the time since
 // its status changed, 0 without one.
 TEST_F(LifecycleTest, MarkerFilesAndTheirAge) {
+  quvaidx::test::FdLeakCheck leaks;
   const std::string marker = dir_.File("marker");
   WriteFile(marker, "old");
   ASSERT_EQ(CheckIn(marker.c_str()), 0);
@@ -310,6 +326,7 @@ TEST_F(LifecycleTest, MarkerFilesAndTheirAge) {
   EXPECT_EQ(CheckOut(marker.c_str()), -1);
   EXPECT_EQ(GetExecutionTime(marker.c_str()), 0);
   EXPECT_EQ(CheckIn(dir_.File("missing/marker").c_str()), -1);
+  EXPECT_TRUE(leaks.NoLeak());
 }
 
 // Ready at once, polled every ten seconds, or given up after fifteen

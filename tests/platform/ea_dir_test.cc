@@ -57,6 +57,8 @@ TEST(EaDirTest, MakeDirCreatesOnlyWhatIsMissing) {
   std::string ea = dir.File(".quvameta/x.jpg");
   EXPECT_EQ(QUVAEAMKDir(1, (ea + "/").c_str()), 0);
   EXPECT_TRUE(IsDir(ea));
+  EXPECT_EQ(QUVAEAMKDir(1, dir.File(".quvameta/x").c_str()), 0);
+  EXPECT_TRUE(IsDir(dir.File(".quvameta/x")));
   EXPECT_EQ(QUVAEAMKDir(1, ea.c_str()), 0);
   ASSERT_EQ(chmod(dir.File(".quvameta").c_str(), 0700), 0);
   EXPECT_EQ(QUVAEAMKDir(1, dir.File(".quvameta/y.mp4").c_str()), 0);
@@ -72,8 +74,8 @@ TEST(EaDirTest, MakeDirCreatesOnlyWhatIsMissing) {
   EXPECT_EQ(ReadFile(dir.File("a/.quvameta")), "someone's data");
   for (std::string path :
        {dir.File("plain/x.jpg"), dir.File("b/.quvameta"),
-        dir.File("b/.quvameta/.."), dir.File(".quvameta/b/.quvameta/x"),
-        std::string("x.jpg")}) {
+        dir.File(".quvameta/.quvameta"), dir.File("b/.quvameta/.."),
+        dir.File(".quvameta/b/.quvameta/x"), std::string("x.jpg")}) {
     EXPECT_EQ(QUVAEAMKDir(1, path.c_str()), -1) << path;
     EXPECT_EQ(QLIBCErrGet(), EINVAL);
   }
