@@ -115,6 +115,19 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   alarm(0);
   EXPECT_EQ(ReadFile(victim), "precious");
   EXPECT_NE(access(dir_.File("nowhere").c_str(), F_OK), 0);
+  if (getuid() != 0) return;
+  chmod(dir_.path().c_str(), 0755);  // a pid file its user may not write
+  EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
+              LogCapture log;
+              return BecomeProcess(victim.c_str()) == -1 &&
+                             log.Normalized() ==
+                                 std::vector<std::string>{
+                                     "quvaidx_daemon:N [Error] create " +
+                                     victim + " (Permission denied)"}
+                         ? 0
+                         : 1;
+            }),
+            0);
 }
 
 // Starts `count` instances in child processes that run BecomeProcess on the
