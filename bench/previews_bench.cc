@@ -4,7 +4,12 @@
 //   thumbs/daemon-all-sizes    the thumbnail daemon's work on one 12-megapixel
 //                              (4000 x 3000) JPEG: all four sizes, in process
 //                              (MakePhotoThumbnails, the thumbnails removed
-//                              between iterations outside the timing);
+//                              between iterations outside the timing), with
+//                              the process's own identity;
+//   thumbs/daemon-as-owner     the same as the daemon does it for a folder of
+//                              another user: the folder owner's file-system
+//                              identity taken around each photo (as root
+//                              only; the folder and photo belong to nobody);
 //   thumbs/vipsthumbnail-xl    one `vipsthumbnail PHOTO -s 1280` process, the
 //                              largest size alone;
 //   thumbs/convert-xl          one ImageMagick `convert PHOTO -thumbnail
@@ -14,13 +19,24 @@
 //   plugind/size-map           the same with GET_THUMB_SIZE_MAP for a photo
 //                              with all four thumbnails.
 //
-//   previews_bench --plugind PATH_OF_QUVAINDEXPLUGIND [benchmark options]
+// and, before them, the thumbnail daemon's worker (ThumbWorker) draining a
+// queue of --queue-entries folders that no longer exist (default 1,000,000;
+// 0 skips it), against the consumer that rewrote the whole queue for each
+// finished entry (ReadQueueHead and FileRemoveHeadingLine), run on the same
+// queue for 10 s; each in a child process, for its own peak memory. Goals:
+// at least 100 times the old rate; the worker's peak on the full queue at
+// most 1.1 times its peak on a queue of 10,000.
+//
+//   previews_bench --plugind PATH_OF_QUVAINDEXPLUGIND [--queue-entries N]
+//                  [benchmark options]
 //
 // The photo is made at start with libvips (grey noise blurred a little and
 // saved at quality 90, about 3.6 MB, which decodes like a camera's photo),
 // in a private temporary directory removed at exit; the plug-in daemon runs
 // there on a socket of its own. Goals: all sizes in at most 0.5 times one
-// vipsthumbnail call; a size map in at most 1.3 times a handshake.
+// vipsthumbnail call; as the folder's owner no slower than with the own
+// identity, beyond noise (at most 1.05 times); a size map in at most 1.3
+// times a handshake.
 #include <fcntl.h>
 #include <signal.h>
 #include <stdio.h>
@@ -30,16 +46,22 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
 #include <quvaidx/ipc.h>
+#include <quvaidx/spool_consumer.h>
+#include <quvaidx/system.h>
 #include <vips/vips.h>
 
 #include "bench_process.h"
 #include "bench_report.h"
+#include "fs_identity.h"
 #include "preview_names.h"
+#include "thumb_worker.h"
 #include "thumbnailer.h"
 
 namespace qb = quvaidx_bench;
@@ -49,6 +71,7 @@ namespace {
 std::string g_dir;        // the private directory
 std::string g_photo;      // the 12-megapixel JPEG
 std::string g_sized;      // the same photo with its four thumbnails
+std::string g_owned;      // a folder of nobody's holding a copy of the photo
 std::string g_vipsthumb;  // vipsthumbnail, or "" when missing
 std::string g_magick;     // ImageMagick's convert, or "" when missing
 std::string g_socket;     // the plug-in daemon's
@@ -118,6 +141,36 @@ void BM_DaemonAllSizes(benchmark::State& state) {
   }
 }
 
+// As the worker does it: the folder opened, its owner's identity taken for
+// the photo, the photo made from the folder's descriptor.
+void BM_DaemonAsOwner(benchmark::State& state) {
+  if (g_owned.empty()) {
+    state.SkipWithError("needs root");
+    return;
+  }
+  const int folder = open(g_owned.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  struct stat st;
+  if (folder < 0 || fstat(folder, &st) != 0) {
+    state.SkipWithError("cannot open the folder");
+    return;
+  }
+  const quvaidx_daemons::FsUser owner = quvaidx_daemons::FileOwner(st);
+  for (auto _ : state) {
+    state.PauseTiming();
+    std::error_code ignored;
+    std::filesystem::remove_all(g_owned + "/.quvameta", ignored);
+    state.ResumeTiming();
+    quvaidx_daemons::FsIdentity as_owner(owner);
+    mkthumbd::PhotoResult result =
+        mkthumbd::MakePhotoThumbnails(folder, g_owned, "photo.jpg");
+    if (!as_owner.taken() || result.made != quvaidx_daemons::kAllThumbSizes) {
+      state.SkipWithError(("not made: " + result.reason).c_str());
+      break;
+    }
+  }
+  close(folder);
+}
+
 void BM_Program(benchmark::State& state, const std::string* program,
                 bool vips) {
   if (program->empty()) {
@@ -176,6 +229,121 @@ bool StartPlugind(const std::string& program) {
   return false;
 }
 
+// What a drain of a queue did, measured in its child process.
+struct Drain {
+  long entries = 0;    // removed from the queue
+  double seconds = 0;  // taken
+  long peak_kb = 0;    // the child's VmHWM at the end
+  bool ok = false;
+};
+
+long PeakKb() {
+  std::ifstream status("/proc/self/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmHWM:", 0) == 0) return atol(line.c_str() + 6);
+  }
+  return 0;
+}
+
+// Writes a queue of `entries` folders of the share that do not exist.
+bool WriteGoneQueue(const std::string& queue, long entries) {
+  std::ofstream out(queue, std::ios::trunc);
+  for (long i = 0; i < entries; ++i)
+    out << g_dir << "/share/gone/" << i << "\n";
+  return static_cast<bool>(out);
+}
+
+// Drains `queue` in a child: with the worker, or (`old`) as the consumer
+// did before, for at most `seconds`.
+Drain DrainQueue(const std::string& queue, bool old, double seconds) {
+  int result[2];
+  Drain drain;
+  if (pipe(result) != 0) return drain;
+  const pid_t child = fork();
+  if (child == 0) {
+    close(result[0]);
+    alarm(900);  // whatever happens, the child ends
+    const auto start = std::chrono::steady_clock::now();
+    const auto end = start + std::chrono::duration<double>(seconds);
+    Drain done;
+    if (old) {
+      Json::Value head;
+      while (std::chrono::steady_clock::now() < end &&
+             ReadQueueHead(queue.c_str(), 1, head) > 0 &&
+             FileRemoveHeadingLine(queue.c_str(), 1) == 0) {
+        ++done.entries;
+      }
+    } else {
+      mkthumbd::ThumbWorker worker(
+          queue, [](int, const std::string&, const std::string&) {
+            return mkthumbd::PhotoResult();  // never called: no folder
+          });
+      while (std::chrono::steady_clock::now() < end &&
+             worker.Step() != mkthumbd::ThumbWorker::Did::kNothing) {
+      }
+      done.entries = worker.counts().entries_done;
+    }
+    done.seconds =
+        std::chrono::duration<double>(std::chrono::steady_clock::now() - start)
+            .count();
+    done.peak_kb = PeakKb();
+    done.ok = true;
+    _exit(write(result[1], &done, sizeof(done)) == sizeof(done) ? 0 : 1);
+  }
+  close(result[1]);
+  if (child > 0 && read(result[0], &drain, sizeof(drain)) != sizeof(drain)) {
+    drain.ok = false;
+  }
+  close(result[0]);
+  int status;
+  if (child > 0) waitpid(child, &status, 0);
+  return drain;
+}
+
+// The drain figures: the worker on a small and on the full queue, the old
+// consumer on the full queue for 10 s.
+void QueueDrains(long entries) {
+  const std::string etc = g_dir + "/etc";
+  mkdir(etc.c_str(), 0755);
+  std::ofstream(etc + "/shares.conf")
+      << "[share]\npath = " << g_dir << "/share\n";
+  mkdir((g_dir + "/share").c_str(), 0755);
+  setenv("QUVA_HOST_ETC", etc.c_str(), 1);
+  const std::string queue = g_dir + "/drain.queue";
+  const long small = std::min(entries, 10000L);
+  printf("== Draining a queue of folders that are gone ==\n");
+  Drain worker_small, worker_full, old_full;
+  if (WriteGoneQueue(queue, small))
+    worker_small = DrainQueue(queue, false, 600);
+  if (WriteGoneQueue(queue, entries))
+    worker_full = DrainQueue(queue, false, 600);
+  if (WriteGoneQueue(queue, entries)) old_full = DrainQueue(queue, true, 10);
+  unlink(queue.c_str());
+  unsetenv("QUVA_HOST_ETC");
+  if (!worker_small.ok || !worker_full.ok || !old_full.ok) {
+    printf("  a drain failed\n");
+    return;
+  }
+  const double new_rate = worker_full.entries / worker_full.seconds;
+  const double old_rate = old_full.entries / old_full.seconds;
+  printf("  worker, %ld entries: %.1f s, %.0f entries/s, peak %ld kB\n",
+         worker_full.entries, worker_full.seconds, new_rate,
+         worker_full.peak_kb);
+  printf("  worker, %ld entries: %.2f s, peak %ld kB\n", worker_small.entries,
+         worker_small.seconds, worker_small.peak_kb);
+  printf(
+      "  old consumer, the same queue: %ld entries in %.1f s, %.1f "
+      "entries/s, peak %ld kB\n",
+      old_full.entries, old_full.seconds, old_rate, old_full.peak_kb);
+  qb::PrintGoal("worker rate / old consumer's rate", new_rate / old_rate, 100,
+                false);
+  qb::PrintGoal("worker peak, full queue / 10,000 entries",
+                static_cast<double>(worker_full.peak_kb) / worker_small.peak_kb,
+                1.1, true);
+  printf("\n");
+}
+
 void Cleanup() {
   if (g_plugind > 0) {
     kill(g_plugind, SIGTERM);
@@ -198,6 +366,11 @@ void Summarise(const qb::KeepingReporter& r) {
   qb::PrintRatio("daemon all sizes / vipsthumbnail XL", ours / vips, "x");
   qb::PrintRatio("daemon all sizes / convert XL", ours / magick, "x");
   qb::PrintGoal("all sizes / one vipsthumbnail call", ours / vips, 0.5, true);
+  double as_owner = r.NsPerOp("thumbs/daemon-as-owner");
+  qb::PrintRatio("daemon all sizes, as the folder's owner", as_owner / 1e6,
+                 "ms");
+  qb::PrintGoal("as the folder's owner / own identity", as_owner / ours, 1.05,
+                true);
   printf("\n== Plug-in daemon, one whole exchange ==\n");
   double handshake = r.NsPerOp("plugind/handshake");
   double size_map = r.NsPerOp("plugind/size-map");
@@ -211,10 +384,13 @@ void Summarise(const qb::KeepingReporter& r) {
 
 int main(int argc, char** argv) {
   std::string plugind;
+  long queue_entries = 1000000;
   std::vector<char*> rest = {argv[0]};
   for (int i = 1; i < argc; ++i) {
     if (strcmp(argv[i], "--plugind") == 0 && i + 1 < argc) {
       plugind = argv[++i];
+    } else if (strcmp(argv[i], "--queue-entries") == 0 && i + 1 < argc) {
+      queue_entries = atol(argv[++i]);
     } else {
       rest.push_back(argv[i]);
     }
@@ -235,6 +411,7 @@ int main(int argc, char** argv) {
   if (mkdtemp(templ.data()) == nullptr) return 1;
   g_dir = templ;
   g_photo = g_dir + "/photo.jpg";
+  if (queue_entries > 0) QueueDrains(queue_entries);
   if (!MakePhoto(g_photo) || !StartPlugind(plugind)) {
     fprintf(stderr, "cannot make the photo or start %s\n", plugind.c_str());
     Cleanup();
@@ -249,11 +426,25 @@ int main(int argc, char** argv) {
     Cleanup();
     return 1;
   }
+  // A folder and a copy of the photo that belong to nobody, for the work
+  // done as a folder's owner.
+  if (geteuid() == 0) {
+    const std::string owned = g_dir + "/nobody";
+    std::error_code error_code;
+    if (mkdir(owned.c_str(), 0755) == 0 &&
+        std::filesystem::copy_file(g_photo, owned + "/photo.jpg", error_code) &&
+        chown(owned.c_str(), 65534, 65534) == 0 &&
+        chown((owned + "/photo.jpg").c_str(), 65534, 65534) == 0) {
+      g_owned = owned;
+    }
+  }
   g_vipsthumb = FindProgram({"vipsthumbnail"});
   // The real ImageMagick program, not a wrapper that may stand before it.
   g_magick = FindProgram({"convert-im6.q16", "convert-im7.q16", "convert"});
 
   benchmark::RegisterBenchmark("thumbs/daemon-all-sizes", BM_DaemonAllSizes)
+      ->Unit(benchmark::kMillisecond);
+  benchmark::RegisterBenchmark("thumbs/daemon-as-owner", BM_DaemonAsOwner)
       ->Unit(benchmark::kMillisecond);
   benchmark::RegisterBenchmark("thumbs/vipsthumbnail-xl", BM_Program,
                                &g_vipsthumb, true)

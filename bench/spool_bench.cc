@@ -13,6 +13,9 @@
 //   append/osync     the O_APPEND | O_SYNC append under flock alone
 //   trim/library     FileRemoveHeadingLine of 1,000 lines of 100,000
 //   trim/tail        `tail -n +1001 Q > T && mv T Q` through system()
+// Then, once, a queue of 1,000,000 entries (SPOOL_DRAIN_LINES; 0 skips it)
+// is drained under /tmp through the consumer calls and, for a few entries
+// at 10,000, 100,000 and 1,000,000 lines, the old way (spool_drain.h).
 // After each append the queue is cut back to its size, so every iteration
 // sees the same queue. Before each trim the queue is made a fresh hard link
 // to an unchanging master copy, so no rewrite of 5 MB (and no writeback of
@@ -37,6 +40,7 @@
 #include "bench_support.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/system.h"
+#include "spool_drain.h"
 
 namespace qb = quvaidx_bench;
 
@@ -414,10 +418,19 @@ int main(int argc, char** argv) {
   for (const Place& place : g_places) {
     if (!CheckAgreement(place)) return 1;
   }
+  const char* drain = getenv("SPOOL_DRAIN_LINES");
+  const int drain_lines = drain != nullptr ? atoi(drain) : 1000000;
+  for (const std::string& file : spool_drain::DrainFiles(g_places[0].dir)) {
+    g_files.push_back(file);
+  }
   Register();
   qb::KeepingReporter reporter;
   int rc = qb::RunAll(argc, argv, &reporter);
   if (rc != 0) return rc;
   Summarise(reporter);
+  if (drain_lines > 0 &&
+      !spool_drain::RunDrainComparison(g_places[0].dir, drain_lines)) {
+    return 1;
+  }
   return 0;
 }

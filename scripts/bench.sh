@@ -83,6 +83,16 @@ if [ -x "$bin/quvaidx_previews_bench" ]; then
     "$build" || status=1
 fi
 
+# The plug-in daemon's HANDSHAKE while requests wait on a stopped media
+# parser, against the serial daemon it was (about 30 s, most of it the
+# serial daemon's waits).
+if [ -x "$bin/quvaidx_plugind_bench" ]; then
+  echo
+  echo "######## quvaidx_plugind_bench"
+  timeout 300 "${pin[@]}" "$bin/quvaidx_plugind_bench" ||
+    { echo "quvaidx_plugind_bench failed ($?)"; status=1; }
+fi
+
 if [ "${BENCH_NO_STRACE:-0}" = 1 ]; then exit $status; fi
 if ! command -v strace >/dev/null 2>&1; then
   echo "strace not installed: no system-call counts" >&2

@@ -82,6 +82,9 @@ show() {
 heading "The index daemons: pid file, executable, socket, and whether alive"
 show daemons
 
+heading "Asked by name, as systemctl is-active: exit status 3 when not alive"
+show daemons mediad
+
 heading "Start the sample daemon in the background, with a pid file"
 echo "\$ quvaidx serve --socket $sock --pidfile $pid_file &"
 "$tool" serve --socket "$sock" --pidfile "$pid_file" \
@@ -140,8 +143,19 @@ for path in "$sock" "$pid_file"; do
 done
 echo "The socket and the pid file are gone."
 
-heading "No daemon any more: one attempt, then exit status 2"
+heading "No daemon any more: one attempt, then exit status 2 and the reason"
 show send --socket "$sock" --attempts 1 '{"command":"HANDSHAKE"}' 2>&1
+
+heading "A daemon that accepts and never answers: --timeout bounds the wait"
+python3 -c 'import socket, sys, time
+s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
+print("up", flush=True); c = s.accept(); time.sleep(5)' "$work/mute.sock" \
+  >"$work/mute.out" &
+mute=$!
+for _ in $(seq 100); do grep -qs up "$work/mute.out" && break; sleep 0.05; done
+show send --socket "$work/mute.sock" --timeout 0.5 '{"command":"HANDSHAKE"}' 2>&1
+kill "$mute" 2>/dev/null || true
+wait "$mute" 2>/dev/null || true
 
 heading "A task queue, named by a key file and a project number"
 queue_key=$work/queue.key

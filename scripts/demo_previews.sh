@@ -91,9 +91,12 @@ wait_for 10 grep -qs listening "$work/plugind.out"
 cat "$work/mkthumbd.out" "$work/plugind.out"
 show daemons
 
-heading "A sample share: photos in two folders, a video, a song"
+heading "A sample share, declared in the host's share database: photos in two
+folders, a video, a song"
 share=$work/share
-mkdir -p "$share/Photos/2023" "$share/Video" "$share/Music"
+mkdir -p "$share/Photos/2023" "$share/Video" "$share/Music" "$QUVA_HOST_ETC"
+printf '[Multimedia]\npath = %s\n' "$share" >"$QUVA_HOST_ETC/shares.conf"
+sed 's/^/  /' "$QUVA_HOST_ETC/shares.conf"
 vips black "$share/Photos/IMG_0001.jpg" 4000 3000 --bands 3
 vips black "$share/Photos/IMG_0002.jpg" 1200 1600 --bands 3
 vips black "$share/Photos/2023/scan.png" 800 600 --bands 3
@@ -125,8 +128,9 @@ echo "\$ rm $share/Photos/.quvameta/IMG_0001.jpg/QUVAPHOTO_THUMB_B.jpg"
 rm "$share/Photos/.quvameta/IMG_0001.jpg/QUVAPHOTO_THUMB_B.jpg"
 show sizemap "$share/Photos/IMG_0001.jpg"
 
-heading "Queue the photo again (quvaidx thumb): only the missing size is made"
-show thumb "$share/Photos/IMG_0001.jpg"
+heading "Queue the photo again (quvaidx thumb): only the missing size is made.
+A song queues nothing, and a folder outside every share is refused"
+show thumb "$share/Photos/IMG_0001.jpg" "$share/Music/song.mp3" "$work" 2>&1
 wait_for 20 test -s "$share/Photos/.quvameta/IMG_0001.jpg/QUVAPHOTO_THUMB_B.jpg"
 show sizemap "$share/Photos/IMG_0001.jpg"
 

@@ -27,7 +27,7 @@ seconds=${2:-20}
 root=$(cd "$(dirname "$0")/.." && pwd)
 build_dir=$(cd "$build_dir" && pwd)
 targets=(fuzz_event_server fuzz_recv_packet fuzz_host_ini fuzz_host_pid_file fuzz_file_rules fuzz_mediainfo fuzz_text fuzz_trim
-         fuzz_proc_parse fuzz_spool_consumer fuzz_mediaparser_glue
+         fuzz_proc_parse fuzz_spool_consumer fuzz_peer_groups fuzz_mediaparser_glue
          fuzz_mediaparser_file)
 
 # Findings must stop the run with a stack trace; libFuzzer already checks for

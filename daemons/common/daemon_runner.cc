@@ -2,12 +2,14 @@
 
 #include <ctype.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <grp.h>
 #include <limits.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -35,7 +37,12 @@ struct Settings {
   int log_level = -1;    // -1: leave g_log_level alone
   int socket_mode = -1;  // -1: the file-creation mask decides
   gid_t socket_group = static_cast<gid_t>(-1);  // -1: unchanged
+  int handed_socket = -1;  // the listening socket a service manager passed
 };
+
+// The first descriptor a service manager passes (systemd's
+// SD_LISTEN_FDS_START).
+constexpr int kFirstHandedDescriptor = 3;
 
 std::string ParseMode(const char* text, int* mode) {
   char* end = nullptr;
@@ -74,6 +81,17 @@ quvaidx_tools::CommandLine MakeCommandLine(const DaemonSpec& spec,
   line.description = summary + ".\n\n" + spec.description;
   line.version = VersionLine(spec.program);
   line.epilog = spec.epilog;
+  if (!line.epilog.empty()) line.epilog += "\n";
+  if (spec.default_socket != nullptr) {
+    line.epilog +=
+        "Started by a service manager that hands over a listening socket\n"
+        "(LISTEN_PID naming this process, LISTEN_FDS: descriptor 3, bound "
+        "to\nthe --socket path), the daemon serves that socket and leaves its "
+        "file\nto the manager.\n\n";
+  }
+  line.epilog +=
+      "Exit status: 0 after SIGTERM or SIGINT, 1 when the daemon cannot "
+      "start\n(why is printed on stderr), 2 on a usage error.\n";
   if (spec.default_socket != nullptr) {
     line.options.push_back(
         Text("socket", 's', "PATH", &settings->socket,
@@ -128,25 +146,103 @@ void OnStopSignal(evutil_socket_t, short, void* base) {
   event_base_loopexit(static_cast<event_base*>(base), nullptr);
 }
 
-// Listens on the socket, with the mode and group asked for (the socket is
-// never open to others meanwhile). Without either, the file-creation mask
-// decides, as for any daemon.
-int Listen(event_base* base, const Settings& settings, EventArgs* args) {
+// The listening socket a service manager handed to this process
+// (LISTEN_PID names it and LISTEN_FDS counts at least one), or -1. The
+// variables are removed either way, so that no child takes them for its
+// own. Read before detaching, which changes the process id.
+int TakeHandedSocket() {
+  const char* pid_text = getenv("LISTEN_PID");
+  const char* count_text = getenv("LISTEN_FDS");
+  int pid = 0, count = 0;
+  bool ours = pid_text != nullptr && count_text != nullptr &&
+              quvaidx_tools::ParseInt(pid_text, 1, INT_MAX, &pid) &&
+              pid == static_cast<int>(getpid()) &&
+              quvaidx_tools::ParseInt(count_text, 1, INT_MAX, &count);
+  unsetenv("LISTEN_PID");
+  unsetenv("LISTEN_FDS");
+  unsetenv("LISTEN_FDNAMES");
+  return ours ? kFirstHandedDescriptor : -1;
+}
+
+// Why a server could not be built, after BuildServer* set errno: the
+// system's words and what they mean here.
+std::string ListenFailure(int err) {
+  std::string reason = strerror(err);
+  switch (err) {
+    case EADDRINUSE:
+      return reason + " (another process answers there)";
+    case EEXIST:
+      return reason + " (not a socket; it was left alone)";
+    case EADDRNOTAVAIL:
+      return reason + " (the socket handed over is bound elsewhere)";
+    default:
+      return reason;
+  }
+}
+
+// Listens on the socket: the one handed over by a service manager, whose
+// mode and group are the manager's, or one made here with the mode and
+// group asked for (never open to others meanwhile). Without either, the
+// file-creation mask decides, as for any daemon. Prints why on failure.
+int Listen(event_base* base, const DaemonSpec& spec, const Settings& settings,
+           EventArgs* args) {
   const char* path = settings.socket.c_str();
-  if (settings.socket_mode < 0 &&
-      settings.socket_group == static_cast<gid_t>(-1)) {
-    return BuildServer(base, path, args);
-  }
-  ServerSocketAccess access;
-  if (settings.socket_mode >= 0) {
-    access.mode = static_cast<mode_t>(settings.socket_mode);
+  int result;
+  if (settings.handed_socket >= 0) {
+    result = BuildServerOnSocket(base, settings.handed_socket, path, args);
+  } else if (settings.socket_mode < 0 &&
+             settings.socket_group == static_cast<gid_t>(-1)) {
+    result = BuildServer(base, path, args);
   } else {
-    mode_t mask = umask(0);  // read it: umask has no query of its own
-    umask(mask);
-    access.mode = 0777 & ~mask;
+    ServerSocketAccess access;
+    if (settings.socket_mode >= 0) {
+      access.mode = static_cast<mode_t>(settings.socket_mode);
+    } else {
+      mode_t mask = umask(0);  // read it: umask has no query of its own
+      umask(mask);
+      access.mode = 0777 & ~mask;
+    }
+    access.group = settings.socket_group;
+    result = BuildServerWithAccess(base, path, args, &access);
   }
-  access.group = settings.socket_group;
-  return BuildServerWithAccess(base, path, args, &access);
+  if (result != 0) {
+    std::string reason = ListenFailure(errno);
+    if (settings.handed_socket >= 0) {
+      fprintf(stderr,
+              "%s: cannot serve the socket handed over (fd %d) for %s: %s\n",
+              spec.program, settings.handed_socket, path, reason.c_str());
+    } else {
+      fprintf(stderr, "%s: cannot listen on %s: %s\n", spec.program, path,
+              reason.c_str());
+    }
+  }
+  return result;
+}
+
+// Why the pid file at `path` could not be taken, as far as can be seen from
+// here (the library has logged its own reason). A live instance holds the
+// file's lock for its whole life.
+std::string PidFileProblem(const std::string& path) {
+  int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  if (fd >= 0) {
+    bool locked = flock(fd, LOCK_SH | LOCK_NB) != 0 && errno == EWOULDBLOCK;
+    close(fd);
+    if (locked) return "another instance runs";
+  }
+  struct stat st;
+  if (lstat(path.c_str(), &st) == 0) {
+    if (!S_ISREG(st.st_mode)) return "not a regular file";
+    if (st.st_nlink > 1) return "a file of more than one name";
+    if (access(path.c_str(), W_OK) != 0) return strerror(errno);
+  } else if (errno != ENOENT) {
+    return strerror(errno);
+  }
+  size_t slash = path.rfind('/');
+  std::string directory = slash == 0 ? "/" : path.substr(0, slash);
+  if (access(directory.c_str(), W_OK | X_OK) != 0) {
+    return directory + ": " + strerror(errno);
+  }
+  return "see the system log";
 }
 
 // Runs the event loop part of the daemon's life (steps 5 to 9 but the pid
@@ -166,11 +262,7 @@ int Serve(const DaemonSpec& spec, const Settings& settings) {
     goto done;
   }
   if (!settings.socket.empty()) {
-    if (Listen(base, settings, &args) != 0) {
-      fprintf(stderr, "%s: cannot listen on %s (see the system log)\n",
-              spec.program, settings.socket.c_str());
-      goto done;
-    }
+    if (Listen(base, spec, settings, &args) != 0) goto done;
     listening = true;
   }
   // A start hook that refuses has said why.
@@ -240,6 +332,9 @@ int RunDaemon(const DaemonSpec& spec, int argc, char** argv) {
     fprintf(stderr, "%s: %s\n", spec.program, strerror(errno));
     return 1;
   }
+  if (spec.default_socket != nullptr) {
+    settings.handed_socket = TakeHandedSocket();
+  }
   openlog(spec.program, LOG_PID | (settings.to_stderr ? LOG_PERROR : 0),
           LOG_DAEMON);
   if (settings.log_level >= 0) ChageLogLevel(settings.log_level);
@@ -248,8 +343,9 @@ int RunDaemon(const DaemonSpec& spec, int argc, char** argv) {
   int taken = settings.foreground ? BecomeProcess(settings.pid_file.c_str())
                                   : BecomeDaemon(settings.pid_file.c_str());
   if (taken != 0) {
-    fprintf(stderr, "%s: not started (pid file %s)\n", spec.program,
-            settings.pid_file.c_str());
+    fprintf(stderr, "%s: not started: pid file %s: %s\n", spec.program,
+            settings.pid_file.c_str(),
+            PidFileProblem(settings.pid_file).c_str());
     return 1;
   }
   int status = Serve(spec, settings);

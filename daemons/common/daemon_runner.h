@@ -12,8 +12,11 @@
 //   4. BecomeDaemon (detach; the default) or, with --foreground,
 //      BecomeProcess: the pid file, refusing a second instance;
 //   5. make the event base; SIGTERM and SIGINT end the loop;
-//   6. BuildServer on the socket (when the daemon has one), then the
-//      socket's mode and group when asked for;
+//   6. the socket (when the daemon has one): the listening socket a service
+//      manager handed over (LISTEN_PID names this process and LISTEN_FDS
+//      counts one or more: descriptor 3, which must be bound to the
+//      --socket path; its file stays the manager's), else BuildServer with
+//      the socket's mode and group when asked for;
 //   7. the daemon's start hook; in the foreground, "PROGRAM: listening on
 //      SOCKET" (or "PROGRAM: running") on standard output;
 //   8. the loop, until a stop signal;
@@ -57,8 +60,10 @@ struct DaemonSpec {
 
 // Runs the daemon described by `spec` with main's arguments. Returns the
 // process's exit status: 0 after a stop signal, 1 when the daemon could not
-// start (another instance runs, the socket is taken, a hook refused), 2 for a
-// usage error; after --help or --version, 0.
+// start (another instance runs, the socket is taken, a hook refused), with
+// one line on standard error that says why in the system's words
+// ("PROGRAM: cannot listen on PATH: Address already in use (another process
+// answers there)"), 2 for a usage error; after --help or --version, 0.
 int RunDaemon(const DaemonSpec& spec, int argc, char** argv);
 
 // A daemon option whose value is a path: stored in *out made absolute (from

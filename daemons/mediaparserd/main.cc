@@ -22,13 +22,20 @@ struct Daemon {
 
 int Handle(Json::Value& request, Json::Value& reply, EventArgs* args) {
   auto* daemon = static_cast<Daemon*>(args->context);
-  // Only about files the asking process could read itself.
+  // Only about files the asking process could read itself, with the groups
+  // it holds.
   PeerCredentials credentials;
   if (GetPeerCredentials(&credentials) != 0) {
     reply = MakeResponse(false, "cannot tell who is asking");
     return 0;
   }
-  mediaparserd::PeerIdentity peer = {credentials.uid, credentials.gid};
+  mediaparserd::PeerIdentity peer;
+  peer.uid = credentials.uid;
+  peer.gid = credentials.gid;
+  if (mediaparserd::PeerNeedsCheck(peer) && GetPeerGroups(&peer.groups) != 0) {
+    reply = MakeResponse(false, "cannot tell the groups of who is asking");
+    return 0;
+  }
   mediaparserd::HandleRequest(daemon->parser.get(), request, &reply, &peer);
   return 0;
 }

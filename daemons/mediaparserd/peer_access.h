@@ -6,8 +6,9 @@
 // peer names is opened with the peer's rights:
 //
 //   - as root, the daemon takes the peer's identity for file access while
-//     it opens the file (setfsuid/setfsgid and the peer's groups), and the
-//     kernel decides, ACLs and all, exactly as it would for the peer;
+//     it opens the file (quvaidx_daemons::FsIdentity: the peer's user, group
+//     and the supplementary groups the peer process holds), and the kernel
+//     decides, ACLs and all, exactly as it would for the peer;
 //   - as any other user, it cannot take another identity, so it checks the
 //     permission bits itself: search permission on every folder of the
 //     file's canonical path and read permission on the file, as owner,
@@ -16,8 +17,8 @@
 // Root peers, and peers of the daemon's own user, are answered as the
 // daemon's own rights allow.
 //
-// Single-threaded: the identity is taken for the calling thread, and the
-// supplementary groups for the whole process, while one file is opened.
+// The identity is taken for the calling thread only, while one file is
+// opened.
 #ifndef MEDIAPARSERD_PEER_ACCESS_H_
 #define MEDIAPARSERD_PEER_ACCESS_H_
 
@@ -27,21 +28,18 @@
 #include <string>
 #include <vector>
 
+#include "fs_identity.h"
+
 namespace mediaparserd {
 
-// The process that sent a request.
-struct PeerIdentity {
-  uid_t uid;
-  gid_t gid;
-};
+// The process that sent a request: its user, primary group and the
+// supplementary groups it holds (GetPeerGroups), not those the group
+// database lists for its user.
+using PeerIdentity = quvaidx_daemons::FsUser;
 
 // True when a peer's requests need a check of their own: not root and not
 // the daemon's own user.
 bool PeerNeedsCheck(const PeerIdentity& peer);
-
-// The peer's groups: its primary group and, when its user has an entry in
-// the user database, that user's supplementary groups.
-std::vector<gid_t> PeerGroups(const PeerIdentity& peer);
 
 // True when the permission bits of `status` grant `want` (4 read, 1
 // search) to a process of user `uid` in `groups`, as owner, group member or
@@ -55,24 +53,6 @@ bool ModeGrants(const struct stat& status, uid_t uid,
 // path cannot be resolved).
 bool PeerMayRead(const std::string& path, const PeerIdentity& peer,
                  std::string* reason);
-
-// While it lives, file access of the calling thread happens with the peer's
-// identity (the daemon must be root). Restores the daemon's own when
-// destroyed.
-class PeerFileIdentity {
- public:
-  explicit PeerFileIdentity(const PeerIdentity& peer);
-  ~PeerFileIdentity();
-  PeerFileIdentity(const PeerFileIdentity&) = delete;
-  PeerFileIdentity& operator=(const PeerFileIdentity&) = delete;
-
-  // False when the identity could not be taken (the daemon's own is kept).
-  bool taken() const { return taken_; }
-
- private:
-  bool taken_ = false;
-  std::vector<gid_t> saved_groups_;
-};
 
 }  // namespace mediaparserd
 

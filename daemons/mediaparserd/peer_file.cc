@@ -29,7 +29,7 @@ bool OpenPeerFile(const std::string& path, PeerFile* file, std::string* reason,
     return PeerMayRead(path, *peer, reason) &&
            OpenFileChecked(path, file, reason);
   }
-  PeerFileIdentity as_peer(*peer);
+  quvaidx_daemons::FsIdentity as_peer(*peer);
   if (!as_peer.taken()) {
     *reason = "cannot take the rights of the asking process";
     return false;

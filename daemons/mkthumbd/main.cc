@@ -7,7 +7,8 @@
 // has grown, then works through the queue one photo per loop turn, so a
 // SIGTERM or SIGINT ends it after the photo at hand, with that photo's
 // thumbnails complete and its entry still queued. At start it looks at the
-// queue once, for entries left from before.
+// queue once, for entries left from before, after removing the copies of
+// the queue that a rewrite killed half-way may have left.
 #include <signal.h>
 #include <stdio.h>
 #include <sys/time.h>
@@ -16,6 +17,7 @@
 
 #include <event2/event.h>
 #include <quvaidx/log.h>
+#include <quvaidx/spool_consumer.h>
 
 #include "daemon_runner.h"
 #include "preview_names.h"
@@ -67,9 +69,10 @@ int Start(event_base* base, void* context) {
     fprintf(stderr, "%s: cannot start libvips: %s\n", kProgram, error.c_str());
     return 1;
   }
-  daemon->worker =
-      new mkthumbd::ThumbWorker(daemon->queue, [](const std::string& photo) {
-        return mkthumbd::MakePhotoThumbnails(photo);
+  daemon->worker = new mkthumbd::ThumbWorker(
+      daemon->queue,
+      [](int folder_fd, const std::string& folder, const std::string& name) {
+        return mkthumbd::MakePhotoThumbnails(folder_fd, folder, name);
       });
   daemon->wake = evsignal_new(base, SIGUSR1, OnWake, daemon);
   daemon->work = evtimer_new(base, OnWork, daemon);
@@ -78,6 +81,9 @@ int Start(event_base* base, void* context) {
     fprintf(stderr, "%s: cannot watch SIGUSR1\n", kProgram);
     return 1;
   }
+  // Copies of the queue that a rewrite killed half-way left; logged by the
+  // library, and nothing else is touched, so the result does not matter.
+  RemoveStaleQueueCopies(daemon->queue.c_str());
   Schedule(daemon, 0);  // entries queued before we started
   return 0;
 }
@@ -89,10 +95,12 @@ void Stop(void* context) {
   const mkthumbd::WorkerCounts counts = daemon->worker->counts();
   AppLogError(6,
               "%s:%d stopping: %ld entries done (%ld queued again, %ld "
-              "refused), %ld photos made, %ld up to date, %ld skipped",
+              "refused, %ld given up), %ld photos made, %ld up to date, %ld "
+              "skipped",
               kProgram, __LINE__, counts.entries_done, counts.entries_requeued,
-              counts.entries_refused, counts.photos_made,
-              counts.photos_up_to_date, counts.photos_skipped);
+              counts.entries_refused, counts.entries_given_up,
+              counts.photos_made, counts.photos_up_to_date,
+              counts.photos_skipped);
   delete daemon->worker;
   mkthumbd::ShutdownThumbnailer();
 }
@@ -110,12 +118,13 @@ int main(int argc, char** argv) {
   spec.summary = "the thumbnail daemon of the media index";
   spec.description =
       "Serves the thumbnail queue: for every folder queued there (by\n"
-      "WriteThumbQueue, e.g. 'quvaidx scan --queue-thumbs'), makes the\n"
-      "thumbnails of each web photo directly in it, in the photo's metadata\n"
-      "(EA) directory: QUVAPHOTO_THUMB_XL.jpg (1280 pixels on the long\n"
-      "side), _B (640), _M (320) and _S (120). Thumbnails newer than their\n"
-      "photo are kept. Sleeps until SIGUSR1; ends after the photo at hand on\n"
-      "SIGTERM or SIGINT.\n";
+      "WriteThumbQueue, e.g. 'quvaidx scan --queue-thumbs') inside a share,\n"
+      "makes the thumbnails of each web photo directly in it, in the photo's\n"
+      "metadata (EA) directory: QUVAPHOTO_THUMB_XL.jpg (1280 pixels on the\n"
+      "long side), _B (640), _M (320) and _S (120), as readable as the photo.\n"
+      "Works with the rights of each folder's owner and follows no link.\n"
+      "Thumbnails newer than their photo are kept. Sleeps until SIGUSR1;\n"
+      "ends after the photo at hand on SIGTERM or SIGINT.\n";
   spec.default_socket = nullptr;
   spec.default_pidfile = kPidFile;
   spec.handler = nullptr;
@@ -130,8 +139,11 @@ int main(int argc, char** argv) {
                             "spare the disks (default 0)"),
   };
   spec.epilog =
-      "Photos larger than 100 million pixels, and photos libvips cannot read,\n"
-      "are logged and skipped.\n";
+      "Photos larger than 100 million pixels, photos whose decoding would\n"
+      "take more than 384 MiB (large progressive JPEGs, GIFs, lossless WebPs,\n"
+      "HEIFs), photos the folder's owner cannot read and photos libvips\n"
+      "cannot read are logged and skipped. A queue entry that ended the\n"
+      "daemon 3 times is logged and dropped at the next start.\n";
   spec.start = Start;
   spec.stop = Stop;
   return quvaidx_daemons::RunDaemon(spec, argc, argv);

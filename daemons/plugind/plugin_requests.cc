@@ -1,5 +1,5 @@
 // Map of this file:
-//   1. request helpers: guarded reads, replies
+//   1. request helpers: guarded reads, replies, the peer's identity
 //   2. thumbnail size maps (GET_THUMB_SIZE_MAP, GET_DIR_THUMB_SIZE_MAP)
 //   3. plug-in names (GET_ALL_PLUGIN_NAME)
 //   4. videos that need converting (IS_VIDEO_NEED_CONVERT)
@@ -11,26 +11,27 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <poll.h>
+#include <stdio.h>
 #include <string.h>
 #include <strings.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <memory>
 
 #include <quvahost/quvahost.h>
 #include <quvaidx/codec_names.h>
 #include <quvaidx/daemon.h>
 #include <quvaidx/daemon_info.h>
 #include <quvaidx/ea_file.h>
-#include <quvaidx/ipc.h>
 #include <quvaidx/media_type.h>
 #include <quvaidx/mediainfo.h>
 #include <quvaidx/path_rules.h>
 #include <quvaidx/system.h>
 
-#include "atomic_file.h"
+#include "media_parser_query.h"
 #include "preview_names.h"
 
 namespace plugind {
@@ -65,9 +66,47 @@ int Fail(Json::Value* reply, const std::string& reason) {
   return 0;
 }
 
-bool IsRegularFile(const std::string& path) {
-  struct stat st;
-  return stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode);
+// While it lives, the calling thread's file access is the peer's: its own
+// identity for a peer that is neither root nor the daemon's own user.
+class AsPeer {
+ public:
+  explicit AsPeer(const quvaidx_daemons::FsUser& peer) {
+    if (peer.uid != 0 && peer.uid != geteuid()) {
+      identity_ = std::make_unique<quvaidx_daemons::FsIdentity>(peer);
+    }
+  }
+  // False when the peer's identity could not be taken: nothing may be done
+  // for it then.
+  bool ok() const { return identity_ == nullptr || identity_->taken(); }
+
+ private:
+  std::unique_ptr<quvaidx_daemons::FsIdentity> identity_;
+};
+
+constexpr char kNoRights[] = "cannot take the rights of the asking process";
+
+// A descriptor closed when it goes out of scope.
+class Descriptor {
+ public:
+  explicit Descriptor(int fd) : fd_(fd) {}
+  ~Descriptor() {
+    if (fd_ >= 0) close(fd_);  // read or already synced: nothing to lose
+  }
+  Descriptor(const Descriptor&) = delete;
+  Descriptor& operator=(const Descriptor&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
+// The folder part and the last component of an absolute path ("/" for a
+// file at the root).
+void SplitPath(const std::string& path, std::string* folder,
+               std::string* name) {
+  const size_t slash = path.rfind('/');
+  *folder = slash == 0 ? "/" : path.substr(0, slash);
+  *name = path.substr(slash + 1);
 }
 
 // ---------------------------------------------------------------------------
@@ -86,41 +125,51 @@ int PhotoSizeMap(const std::string& photo) {
 }
 
 // The folder's representative photo: the first web photo directly in it,
-// in bytewise name order, as the thumbnail daemon lists them. "" for none.
-std::string RepresentativePhoto(const std::string& folder) {
+// in bytewise name order, as the thumbnail daemon lists them, into *first
+// ("" for none). Returns 0, or the errno that kept the folder from being
+// listed.
+int RepresentativePhoto(const std::string& folder, std::string* first) {
   DIR* dir = opendir(folder.c_str());
-  if (dir == nullptr) return "";
-  std::string first;
+  if (dir == nullptr) return errno;
   const int fd = dirfd(dir);
+  first->clear();
+  errno = 0;
   while (struct dirent* entry = readdir(dir)) {
     const char* name = entry->d_name;
-    if (!EntryNameShouldIndex(name) || !BlQUVAIndexIsPhotoOnWebFile(name)) {
+    if (!EntryNameShouldIndex(name) || !BlQUVAIndexIsPhotoOnWebFile(name) ||
+        (!first->empty() && strcmp(name, first->c_str()) >= 0)) {
       continue;
     }
-    if (!first.empty() && strcmp(name, first.c_str()) >= 0) continue;
     struct stat st;
     if (fstatat(fd, name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
         S_ISREG(st.st_mode)) {
-      first = name;
+      *first = name;
     }
+    errno = 0;
   }
+  const int err = errno;
   closedir(dir);
-  return first;
+  return err;
 }
 
-int ThumbSizeMap(const Json::Value& request, bool folder, Json::Value* reply) {
+int ThumbSizeMap(const quvaidx_daemons::FsUser& peer,
+                 const Json::Value& request, bool folder, Json::Value* reply) {
   std::string path;
   if (!PathMember(request, "path", &path, reply)) return 0;
   const Json::Value& type = request["type"];
   if (!type.isIntegral() || !type.isInt() || type.asInt() != THUMB_TYPE_PHOTO) {
     return Fail(reply, "\"type\" must be 1: only photo thumbnails are made");
   }
+  AsPeer as_peer(peer);
+  if (!as_peer.ok()) return Fail(reply, kNoRights);
   struct stat st;
   if (stat(path.c_str(), &st) != 0) return Fail(reply, strerror(errno));
   std::string photo;
   if (folder) {
     if (!S_ISDIR(st.st_mode)) return Fail(reply, "not a directory");
-    std::string name = RepresentativePhoto(path);
+    std::string name;
+    const int err = RepresentativePhoto(path, &name);
+    if (err != 0) return Fail(reply, strerror(err));
     if (!name.empty()) photo = (path == "/" ? "" : path) + "/" + name;
   } else {
     if (!S_ISREG(st.st_mode)) return Fail(reply, "not a regular file");
@@ -214,67 +263,64 @@ bool WebPlayable(const std::string& video, const std::string& audio,
          EqualsAny(container, {"mov", "m4v"});
 }
 
-// Asks the media parser for the media record of `path`. Waits for its
-// reply to begin at most the configured time. "" or what failed.
-std::string AskMediaParser(const PluginConfig& config, const std::string& path,
-                           __tag_QUVA_MEDIA_INFO* record) {
-  int fd = ConnectPeer(config.media_parser_socket.c_str(), false,
-                       config.media_parser_attempts);
-  if (fd < 0) return "the media parser does not answer";
-  Json::Value value(Json::objectValue);
-  value["command"] = "GET_MEDIA_INFO";
-  value["path"] = path;
-  struct pollfd ready = {fd, POLLIN, 0};
-  int polled = -1;
-  if (SendPacket(fd, value) == 0) {
-    do {
-      polled = poll(&ready, 1, config.media_parser_timeout_s * 1000);
-    } while (polled < 0 && errno == EINTR);
+// True when `path` is a regular file that the calling thread may open for
+// reading (opened without waiting on a FIFO or device, and closed again);
+// else false with *reason set.
+bool ReadableFile(const std::string& path, std::string* reason) {
+  Descriptor file(
+      open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+  if (file.get() < 0) {
+    *reason = errno == ENOENT ? "no such file" : strerror(errno);
+    return false;
   }
-  Json::Value reply;
-  const bool received = polled > 0 && RecvPacket(fd, reply) == 0;
-  DisconnectPeer(fd);
-  if (!received) return "the media parser does not answer";
-  if (!reply.isObject() || !reply["success"].isBool() ||
-      !reply["success"].asBool()) {
-    std::string reason = "the media parser cannot read the file";
-    if (reply.isObject() && reply["reason"].isString()) {
-      reason += ": " + reply["reason"].asString();
-    }
-    return reason;
+  struct stat st;
+  if (fstat(file.get(), &st) != 0 || !S_ISREG(st.st_mode)) {
+    *reason = "not a regular file";
+    return false;
   }
-  Json::Value media = reply["media"];
-  MediaInfoJson2Object(media, *record);
-  return "";
+  return true;
 }
 
-int VideoNeedConvert(const PluginConfig& config, const Json::Value& request,
-                     Json::Value* reply) {
+int VideoNeedConvert(const PluginConfig& config,
+                     const quvaidx_daemons::FsUser& peer,
+                     const Json::Value& request, Json::Value* reply) {
   std::string path;
   if (!PathMember(request, "path", &path, reply)) return 0;
-  if (!IsRegularFile(path)) return Fail(reply, "no such file");
   Json::Value answer = MakeResponse(true, nullptr);
   answer["result"] = 0;
+  std::string problem;
+  std::string converted;
+  {
+    AsPeer as_peer(peer);
+    if (!as_peer.ok()) return Fail(reply, kNoRights);
+    if (!ReadableFile(path, &problem)) return Fail(reply, problem);
+    if (BlQUVAIndexIsVideoFile(path.c_str())) converted = ConvertedCopy(path);
+  }
   if (!BlQUVAIndexIsVideoFile(path.c_str())) {
     *reply = answer;
     return 0;
   }
-  const std::string converted = ConvertedCopy(path);
   if (!converted.empty()) {
     answer["converted"] = converted;
     *reply = answer;
     return 0;
   }
-  // About 13 KB; the loop runs one handler at a time.
-  static __tag_QUVA_MEDIA_INFO record;
-  std::string problem = AskMediaParser(config, path, &record);
+  // The media parser is asked with the peer's credentials, so it opens the
+  // file as the peer: whatever is at the path by then, it reads only what
+  // the peer could.
+  Json::Value media;
+  problem = AskMediaInfo(config, peer, path, &media);
   if (!problem.empty()) return Fail(reply, problem);
-  const std::string video = record.szVideoCodec;
-  const std::string audio = record.szAudioCodec;
-  const std::string container = record.szContainerType;
-  answer["result"] = WebPlayable(video, audio, container, path) ? 0 : 1;
-  answer["video_codec"] = video;
-  answer["audio_codec"] = audio;
+  // About 13 KB, so not on a worker's stack.
+  auto record = std::make_unique<__tag_QUVA_MEDIA_INFO>();
+  MediaInfoJson2Object(media, *record);
+  const std::string video_codec = record->szVideoCodec;
+  const std::string audio_codec = record->szAudioCodec;
+  const std::string container = record->szContainerType;
+  answer["result"] =
+      WebPlayable(video_codec, audio_codec, container, path) ? 0 : 1;
+  answer["video_codec"] = video_codec;
+  answer["audio_codec"] = audio_codec;
   answer["container"] = container;
   *reply = answer;
   return 0;
@@ -293,45 +339,127 @@ Json::Value CleanRecord(const Json::Value& value, __tag_QUVA_MEDIA_INFO* out) {
   return clean;
 }
 
-int ConvertAdd(const Json::Value& request, Json::Value* reply) {
+// Writes `text` to the entry `name` of the directory `dir_fd` through a
+// temporary file created beside it (never through a link) and renamed into
+// place. Returns "" or what failed, with no temporary file left.
+std::string WriteRecordAt(int dir_fd, const std::string& name,
+                          const std::string& text, mode_t mode) {
+  std::string temp;
+  int fd = -1;
+  for (int attempt = 0; fd < 0 && attempt < 8; ++attempt) {
+    unsigned char random[6];
+    if (getrandom(random, sizeof(random), 0) != sizeof(random)) break;
+    char suffix[16];
+    snprintf(suffix, sizeof(suffix), "%02x%02x%02x%02x%02x%02x", random[0],
+             random[1], random[2], random[3], random[4], random[5]);
+    temp = name + ".part-" + suffix;
+    fd = openat(dir_fd, temp.c_str(),
+                O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+    if (fd < 0 && errno != EEXIST) break;
+  }
+  if (fd < 0)
+    return std::string("cannot create the record: ") + strerror(errno);
+  int err = 0;
+  for (size_t done = 0; err == 0 && done < text.size();) {
+    ssize_t wrote = write(fd, text.data() + done, text.size() - done);
+    if (wrote < 0 && errno == EINTR) continue;  // Retry
+    if (wrote < 0) err = errno;
+    if (wrote > 0) done += static_cast<size_t>(wrote);
+  }
+  if (err == 0 && fsync(fd) != 0) err = errno;
+  if (close(fd) != 0 && err == 0) err = errno;
+  if (err == 0 && renameat(dir_fd, temp.c_str(), dir_fd, name.c_str()) != 0) {
+    err = errno;
+  }
+  if (err != 0) {
+    unlinkat(dir_fd, temp.c_str(), 0);  // ours, made just now
+    return std::string("cannot write the record: ") + strerror(err);
+  }
+  return "";
+}
+
+// The EA directory of `video` as the peer reaches it, without a link at the
+// metadata directory or below: the descriptor, or -1 with *reason set.
+int VideoEADir(const std::string& video, std::string* reason) {
+  std::string folder, name;
+  SplitPath(video, &folder, &name);
+  Descriptor folder_fd(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  struct stat st;
+  if (folder_fd.get() < 0 ||
+      fstatat(folder_fd.get(), name.c_str(), &st, 0) != 0 ||
+      !S_ISREG(st.st_mode)) {
+    *reason = "\"src\" must name an existing video";
+    return -1;
+  }
+  int ea_dir = OpenEADir(video.c_str(), folder_fd.get(), 0);
+  if (ea_dir < 0) {
+    *reason = std::string("no EA directory beside ") + video + ": " +
+              (errno == ELOOP ? "a link is in the way" : strerror(errno));
+  }
+  return ea_dir;
+}
+
+// True when the folder of `path` is the directory `dir_fd`: the same one,
+// whatever path leads there.
+bool FolderIs(const std::string& path, int dir_fd) {
+  std::string folder, name;
+  SplitPath(path, &folder, &name);
+  Descriptor folder_fd(open(folder.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  struct stat there, dir;
+  return folder_fd.get() >= 0 && fstat(folder_fd.get(), &there) == 0 &&
+         fstat(dir_fd, &dir) == 0 && there.st_dev == dir.st_dev &&
+         there.st_ino == dir.st_ino;
+}
+
+int ConvertAdd(const quvaidx_daemons::FsUser& peer, const Json::Value& request,
+               Json::Value* reply) {
   if (!request.isObject() || !request["src"].isObject() ||
       !request["convert"].isObject()) {
     return Fail(reply, "\"src\" and \"convert\" must be media records");
   }
-  static __tag_QUVA_MEDIA_INFO source;
-  static __tag_QUVA_MEDIA_INFO converted;
+  auto source = std::make_unique<__tag_QUVA_MEDIA_INFO>();
+  auto converted = std::make_unique<__tag_QUVA_MEDIA_INFO>();
   Json::Value record(Json::objectValue);
-  record["src"] = CleanRecord(request["src"], &source);
-  record["convert"] = CleanRecord(request["convert"], &converted);
-  const std::string video = source.szPath;
-  const std::string copy = converted.szPath;
-  if (video.empty() || video[0] != '/' || !IsRegularFile(video) ||
+  record["src"] = CleanRecord(request["src"], source.get());
+  record["convert"] = CleanRecord(request["convert"], converted.get());
+  const std::string video = source->szPath;
+  const std::string copy = converted->szPath;
+  if (video.empty() || video[0] != '/' ||
       !BlQUVAIndexIsVideoFile(video.c_str())) {
     return Fail(reply, "\"src\" must name an existing video");
   }
-  const size_t slash = copy.rfind('/');
-  const std::string name =
-      slash == std::string::npos ? copy : copy.substr(slash + 1);
+  std::string copy_folder, name;
+  SplitPath(copy, &copy_folder, &name);
   char type[64];
-  if (ConvertVideoTypeGet(name.c_str(), type, sizeof(type)) != 1) {
+  if (copy.empty() || copy[0] != '/' ||
+      ConvertVideoTypeGet(name.c_str(), type, sizeof(type)) != 1) {
     return Fail(reply, "\"convert\" must be named as a converted video");
-  }
-  // The copy must be that item of the source's EA directory, and present.
-  char item[PATH_MAX];
-  if (GetEAFilePath(video.c_str(), name.c_str(), name.c_str(), item,
-                    sizeof(item)) != 0 ||
-      copy != item) {
-    return Fail(reply, "no converted copy " + name + " beside " + video);
   }
   record["conversion_type"] = type;
   if (request.isMember("package")) record["package"] = request["package"];
-  const std::string path = std::string(item) + ".json";
+
+  // The peer's own work from here: the kernel decides what it may reach
+  // and whether it may write there.
+  AsPeer as_peer(peer);
+  if (!as_peer.ok()) return Fail(reply, kNoRights);
+  std::string problem;
+  Descriptor ea_dir(VideoEADir(video, &problem));
+  if (ea_dir.get() < 0) return Fail(reply, problem);
+  // The copy is that item of the video's EA directory if its path leads
+  // there, and present.
+  struct stat item;
+  if (!FolderIs(copy, ea_dir.get()) ||
+      fstatat(ea_dir.get(), name.c_str(), &item, AT_SYMLINK_NOFOLLOW) != 0 ||
+      !S_ISREG(item.st_mode) || item.st_size < 2) {
+    return Fail(reply, "no converted copy " + name + " beside " + video);
+  }
   const std::string text = record.toStyledString();
-  std::string problem = quvaidx_daemons::WriteAtomically(
-      path, ".", text.data(), text.size(), 0644, true, "the record");
+  // Readable as the copy is, no more.
+  problem = WriteRecordAt(ea_dir.get(), name + ".json", text,
+                          S_IRUSR | S_IWUSR | (item.st_mode & 0044));
   if (!problem.empty()) return Fail(reply, problem);
   *reply = MakeResponse(true, nullptr);
-  (*reply)["record"] = path;
+  (*reply)["record"] = copy + ".json";
   return 0;
 }
 
@@ -350,8 +478,17 @@ PluginConfig DefaultConfig() {
   return config;
 }
 
-int HandlePluginRequest(const PluginConfig& config, const Json::Value& request,
-                        Json::Value* reply) {
+bool AnsweredAtOnce(const Json::Value& request) {
+  std::string command;
+  TextMember(request, "command", &command);
+  return command != "GET_THUMB_SIZE_MAP" &&
+         command != "GET_DIR_THUMB_SIZE_MAP" &&
+         command != "IS_VIDEO_NEED_CONVERT" && command != "INDEX_CONVERT_ADD";
+}
+
+int HandlePluginRequest(const PluginConfig& config,
+                        const quvaidx_daemons::FsUser& peer,
+                        const Json::Value& request, Json::Value* reply) {
   try {
     std::string command;
     TextMember(request, "command", &command);
@@ -359,16 +496,17 @@ int HandlePluginRequest(const PluginConfig& config, const Json::Value& request,
       *reply = MakeResponse(true, nullptr);
       return 0;
     }
-    if (command == "GET_THUMB_SIZE_MAP")
-      return ThumbSizeMap(request, false, reply);
+    if (command == "GET_THUMB_SIZE_MAP") {
+      return ThumbSizeMap(peer, request, false, reply);
+    }
     if (command == "GET_DIR_THUMB_SIZE_MAP") {
-      return ThumbSizeMap(request, true, reply);
+      return ThumbSizeMap(peer, request, true, reply);
     }
     if (command == "GET_ALL_PLUGIN_NAME") return AllPluginNames(config, reply);
     if (command == "IS_VIDEO_NEED_CONVERT") {
-      return VideoNeedConvert(config, request, reply);
+      return VideoNeedConvert(config, peer, request, reply);
     }
-    if (command == "INDEX_CONVERT_ADD") return ConvertAdd(request, reply);
+    if (command == "INDEX_CONVERT_ADD") return ConvertAdd(peer, request, reply);
     return Fail(reply, "unknown command");
   } catch (...) {  // out of memory: answer, never end the daemon
     return Fail(reply, "internal error");

@@ -13,7 +13,9 @@
 // Threads: single-threaded. Every function and callback here runs on the
 // thread that runs the daemon's event loop; g_listener and g_conn_count are
 // plain variables without locking. A slow handler holds up every connection
-// of the daemon.
+// of the daemon; a handler whose answer takes long takes the reply away
+// (DeferReply), has the work done elsewhere, and sends the reply later from
+// the loop (SendDeferredReply), while the server answers other connections.
 //
 // Robustness:
 // - a handler that throws is logged and its connection closed;
@@ -24,7 +26,9 @@
 // - a reply too large for a packet is replaced by
 //   {"success":false,"reason":"reply too large"};
 // - every complete request in a connection's input buffer is answered, in
-//   order, in the same callback;
+//   order, in the same callback, unless a handler defers a reply: then the
+//   connection's later requests wait (64 KiB of them at most are read) until
+//   that reply has been sent, and other connections are served meanwhile;
 // - a peer that shuts down its sending side still gets every reply queued
 //   for it before the server closes the connection;
 // - a connection stops being read while more than kMaxPendingOutput bytes of
@@ -36,7 +40,10 @@
 //   waited longest, and only when none has waited kAcceptPauseMs pauses
 //   accepting for that long, instead of ending the loop;
 // - BuildServer never removes anything at its socket path but a stale
-//   socket: it takes no socket away from a daemon that still answers on it.
+//   socket: it takes no socket away from a daemon that still answers on it;
+// - a daemon started by a service manager may instead serve the listening
+//   socket the manager bound for it (BuildServerOnSocket), which then stays
+//   the manager's: StopServer leaves its file in place.
 //
 // Log lines carry the module name "quvaidx_daemon" and go through
 // AppLogError.
@@ -47,6 +54,8 @@
 #include <stdint.h>
 #include <sys/socket.h>
 #include <sys/types.h>
+
+#include <vector>
 
 #include <json/json.h>
 
@@ -84,12 +93,15 @@ struct ServerLimits {
 };
 
 struct EventArgs;
+// A request whose reply a handler took away to send later (DeferReply).
+struct DeferredReply;
 
 // A daemon's request handler. It fills `reply` (see MakeResponse) and
 // returns 0 to have the reply sent; any other result ends the connection
 // without a reply and without reading further requests (replies already
 // queued for earlier requests of the same connection are still delivered
-// before it closes). GetPeerCredentials tells it who is asking.
+// before it closes). GetPeerCredentials and GetPeerGroups tell it who is
+// asking; DeferReply lets it answer later.
 typedef int (*EventHandler)(Json::Value& request, Json::Value& reply,
                             EventArgs* args);
 
@@ -135,8 +147,11 @@ QUVAIDX_API int BuildServer(struct event_base* base, const char* path,
 // - A socket on which a daemon still takes connections: left alone; -1, and
 //   a level-3 line saying it is in use.
 // - A regular file, directory, link or anything else, or a path that cannot
-//   be examined or removed: left alone; -1 and the level-3 line
-//   "remove <path>".
+//   be examined or probed: left alone; -1, and a level-3 line naming the
+//   path, what was found and "left alone" ("<path> is not a socket; left
+//   alone").
+// - A stale socket that cannot be removed: -1 and the level-3 line
+//   "remove <path> (<system error>)".
 // With `access` null the socket file gets the process's file-creation mask.
 // Otherwise it is created for the owner alone (0600 at most, where the
 // system allows setting a socket's mode before binding it), then given
@@ -148,11 +163,34 @@ QUVAIDX_API int BuildServer(struct event_base* base, const char* path,
 // must not end the daemon.
 // Returns 0 with g_listener set. Returns -1, with g_listener unchanged, on
 // the refusals above, when a server already runs, when the listener cannot
-// be created, or when the path is longer than kMaxSocketPath bytes (nothing
-// is examined or created then). Each failure is logged at level 3.
+// be created ("Could not create a listener: <path> (<system error>)"), or
+// when the path is longer than kMaxSocketPath bytes (nothing is examined or
+// created then). Each failure is logged at level 3, and errno says why, for
+// a daemon to tell whoever started it: EADDRINUSE (a daemon answers at the
+// path), EEXIST (something other than a socket is there, or it changed
+// while examined), ENAMETOOLONG, EBUSY (a server already runs), or the
+// system's error (EACCES, ENOENT, ...) of examining, removing, binding or
+// listening.
 QUVAIDX_API int BuildServerWithAccess(struct event_base* base, const char* path,
                                       EventArgs* args,
                                       const ServerSocketAccess* access);
+
+// Serves connections on `fd`, a socket that a service manager (systemd's
+// socket activation, say) has bound and set listening for this daemon, so
+// that nobody else could take its path while the daemon was not running.
+// `fd` must be a listening Unix-domain stream socket bound to `path`, when
+// `path` is not null; it is made non-blocking and close-on-exec, and keeps
+// the backlog, mode and owner its manager gave it. On success the server
+// owns the descriptor and closes it when it stops, while the socket file
+// stays the manager's: StopServer does not remove it. Otherwise as
+// BuildServerWithAccess after the socket is made.
+// Returns 0 with g_listener set. Returns -1, with `fd` still the caller's
+// and g_listener unchanged, when a server already runs (EBUSY), or when
+// `fd` is not a socket (ENOTSOCK), is another kind of socket or does not
+// listen (EINVAL), or is bound to another path (EADDRNOTAVAIL); each
+// logged at level 3 ("the socket handed over (fd N) ...; not used").
+QUVAIDX_API int BuildServerOnSocket(struct event_base* base, int fd,
+                                    const char* path, EventArgs* args);
 
 // Sets the limits of the running server and of later ones; null restores
 // the defaults (kPacketDeadlineMs, kIdleDeadlineMs, kMaxTotalPendingOutput).
@@ -169,9 +207,60 @@ QUVAIDX_API void SetServerLimits(const ServerLimits* limits);
 // when peer is null or the system does not tell).
 QUVAIDX_API int GetPeerCredentials(PeerCredentials* peer);
 
+// During a handler call: stores in *groups the supplementary groups of the
+// process on the other end of the connection whose request is being
+// handled, as the kernel holds them (which may differ from what the group
+// database lists for its user): those the process had when it connected
+// (SO_PEERGROUPS), or, where the system does not record them, those its
+// /proc/PID/status lists, used only while that process still runs with the
+// effective user and group it connected with. The primary group is the gid
+// of GetPeerCredentials and may or may not be among them.
+// Returns 0. Returns -1, leaving *groups unchanged, outside a handler call,
+// when groups is null, or when the groups cannot be told (logged at level 3
+// when the process's status text refused them); a caller that decides
+// access by them then refuses.
+QUVAIDX_API int GetPeerGroups(std::vector<gid_t>* groups);
+
+// During a handler call: takes the reply of the request being handled away
+// from the server, so that the daemon can send it later with
+// SendDeferredReply, for example when another thread has done the work.
+// The handler then returns 0 (its `reply` is not sent). Until the deferred
+// reply is sent, the connection's later requests wait unanswered (at most
+// 64 KiB of them are read meanwhile), so the replies of one connection keep
+// the order of its requests; other connections are answered as usual. The
+// server's bounds hold throughout: a connection may wait for its deferred
+// reply as long as the idle deadline (ServerLimits) allows, and a peer that
+// ends its stream meanwhile still gets the reply and the answers to the
+// requests it sent before, as for any reply.
+// Returns the request's handle, owned by the daemon until it passes it to
+// SendDeferredReply. Returns null (logged at level 3) outside a handler
+// call, for a second deferral in the same call, for a connection the server
+// did not accept itself (one a daemon serves with these callbacks on a
+// listener of its own), or when memory runs out; the handler then answers
+// as usual.
+QUVAIDX_API DeferredReply* DeferReply();
+
+// Sends `reply` as the answer to the deferred request `deferred` and frees
+// the handle; then answers the connection's waiting requests. With `reply`
+// null, ends the connection without an answer instead, as a handler's
+// non-zero result does. When the connection closed meanwhile (its peer went,
+// a deadline or a bound of the server ended it), only frees the handle.
+// A reply too large for a packet is replaced as a handler's is.
+// REQUIRES: on the loop's thread, outside handler calls (from an event
+// callback of the daemon's own), with a handle from DeferReply not yet
+// passed here.
+// Returns 0 when the reply was queued (or, with `reply` null, the connection
+// ended); -1 when the connection had closed, when the reply could not be
+// queued, when the server's bound on unsent replies closed the connection
+// at once, or, with the handle untouched, when called inside a handler call
+// or with a null handle.
+QUVAIDX_API int SendDeferredReply(DeferredReply* deferred,
+                                  const Json::Value* reply);
+
 // When a server runs: frees its listener (closing the listening socket),
-// sets g_listener to null and removes the file at `path`. Otherwise does
-// nothing. Open connections are left alone. Always returns 0.
+// sets g_listener to null and removes the file at `path`, unless the socket
+// was handed over (BuildServerOnSocket). Otherwise does nothing. Open
+// connections are left alone. Always returns 0.
 QUVAIDX_API int StopServer(const char* path);
 
 // Returns g_conn_count.

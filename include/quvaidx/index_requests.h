@@ -17,6 +17,15 @@
 //   QUVAIDX_GetDirThumbSizeMap  plug-in       GET_DIR_THUMB_SIZE_MAP
 //   QUVAIDX_GetAllPluginName    plug-in       GET_ALL_PLUGIN_NAME
 //
+// Who answers. The fixed paths lie in a folder every user can write, so a
+// user could bind one while its daemon is down and then receive root's
+// requests and forge the replies. The process at the other end of the
+// connection (SO_PEERCRED) must therefore be root or run as the caller's
+// effective user; with anyone else the connection is closed before
+// anything is sent, "[Error] refused <socket>: served by uid <uid> (pid
+// <pid>), neither root nor uid <euid>" is logged at level 3, and the
+// exchange fails at once, with no further attempts.
+//
 // Results: 0 on success, -1 on failure, unless a call says otherwise. A
 // reply succeeds when it is an object whose "success" reads as true (a
 // missing key, or a reply that is not an object, is a failure). Output

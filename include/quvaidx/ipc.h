@@ -113,6 +113,20 @@ QUVAIDX_API int Handshake(int fd);
 // Closes fd when it is 0 or greater. Always returns 0.
 QUVAIDX_API int DisconnectPeer(int fd);
 
+// An addition for programs that talk to a daemon on a well-known path.
+// Connects to the daemon listening on `path` and checks who answers: the
+// process at the other end (SO_PEERCRED) must be root or run as this
+// process's effective user, since anyone else may have bound the path while
+// the daemon was down. Makes one attempt, waiting at most `timeout_ms`
+// (at least 1) for a daemon whose backlog is full; no handshake.
+// Returns the connected descriptor, which belongs to the caller; -1 with
+// errno ENAMETOOLONG (path longer than kMaxSocketPath bytes), ENOENT (no
+// such socket), EACCES (permission denied), ENOTSOCK (something other than
+// a socket is there), ECONNREFUSED (nobody listens), ETIMEDOUT (the backlog
+// stayed full), EPERM (another user answers; logged at level 3), or the
+// system's errno of a failed socket(2).
+QUVAIDX_API int ConnectDaemon(const char* path, int timeout_ms);
+
 // Connects with a handshake (see ConnectPeer), sends `value` and expects no
 // reply. When the daemon closes the connection under the send, reconnects
 // and sends again, at most kMaxExchangeRestarts times.

@@ -45,11 +45,14 @@ QUVAIDX_API int ForkExecv(const char* path, char* const argv[]);
 // Spool queues
 
 // Appends `entry` and a line feed to the queue file `queue` (created with
-// mode 0777 less the umask), unless a line equal to it is already there.
-// The file is opened with O_APPEND | O_SYNC and written under an exclusive
-// flock; if the file was replaced (trimmed) while this call waited for the
-// lock, the new file at `queue` is opened and locked instead, so no entry
-// goes to an unlinked file. An open refused with EACCES is retried up to 16
+// mode 0666 less the umask: never executable), unless a line equal to it is
+// already there. The file is opened with O_APPEND | O_SYNC and written
+// under an exclusive flock; if the file was replaced (trimmed or compacted
+// by its consumer) while this call waited for the lock, the new file at
+// `queue` is opened and locked instead, so no entry goes to an unlinked
+// file. A consumer's finished entries are empty lines (see
+// quvaidx/spool_consumer.h), so one never counts as a line equal to a new
+// entry. An open refused with EACCES is retried up to 16
 // times, one second apart. The duplicate test runs before the lock, so two
 // processes queueing the same entry at once may both append it.
 // Returns 0 when the entry is in the queue afterwards; -1 for a null
@@ -90,8 +93,11 @@ QUVAIDX_API int RenameFile(const char* source, const char* destination);
 // Removes the first `n` lines of the file at `path` (all lines for n beyond
 // the end; none for n <= 0): the rest is copied to a temporary file
 // "<path>.XXXXXX" beside it, synced, given the file's owner, group and mode,
-// and renamed over it. Takes no lock: a consumer of a spool queue holds the
-// queue's exclusive flock around the call.
+// and renamed over it. Takes no lock: a caller that trims a spool queue
+// holds the queue's exclusive flock around the call. Consumers use
+// quvaidx/spool_consumer.h instead, which does not rewrite the queue per
+// entry; its RemoveStaleQueueCopies removes a temporary file left by a
+// process killed during this call.
 // Returns 0, or -1 with the file unchanged (the temporary file removed,
 // unless its close or the rename failed).
 QUVAIDX_API int FileRemoveHeadingLine(const char* path, int n);

@@ -4,7 +4,8 @@
 // it live in server_connections.cc.
 //
 // Map: ending connections; the packet at the head of a connection's input;
-// handling one packet; exported operations; libevent callbacks.
+// handling one packet; serving a connection's input; exported operations
+// (deferred replies among them); libevent callbacks.
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
@@ -15,6 +16,7 @@
 
 #include <algorithm>
 #include <exception>
+#include <new>
 
 #include <event2/buffer.h>
 #include <event2/bufferevent.h>
@@ -22,6 +24,7 @@
 #include <event2/listener.h>
 #include <event2/util.h>
 
+#include "daemon/peer_groups.h"
 #include "daemon/server_connections.h"
 #include "daemon/server_socket.h"
 #include "ipc/packet_codec.h"
@@ -42,13 +45,22 @@ constexpr char kModule[] = "quvaidx_daemon";
 // Connections closed at most, longest waiting first, each time accepting
 // runs out of descriptors: a listen backlog's worth.
 constexpr int kClosedPerAcceptFailure = 16;
+// Bytes of later requests read from a connection while its deferred reply
+// is due; reading stops there until the reply has gone.
+constexpr size_t kDeferredInputLimit = 64 * 1024;
 
 // Re-enables the listener after accepting paused for lack of descriptors.
 // Lives as long as the listener.
 struct event* g_accept_resume = nullptr;
-// The connection whose request the handler is answering; null outside
-// handler calls (GetPeerCredentials).
+// The connection whose request the handler is answering, and its server
+// record; null outside handler calls (GetPeerCredentials, DeferReply).
 struct bufferevent* g_handler_connection = nullptr;
+EventArgs* g_handler_args = nullptr;
+// The reply the handler being called took away (DeferReply), if any.
+DeferredReply* g_deferred_in_call = nullptr;
+// Whether the running server made its socket file (BuildServerWithAccess)
+// and so removes it when it stops.
+bool g_owns_socket_file = false;
 
 const char* DaemonName(void* args) {
   const EventArgs* event_args = static_cast<const EventArgs*>(args);
@@ -161,7 +173,20 @@ void ParseRequest(const char* body, size_t length, Json::Value& value) {
   if (quvaidx::ParsePacketBody(body, length, parsed)) value.swap(parsed);
 }
 
-enum class PacketOutcome { kAnswered, kWaiting, kClosed };
+enum class PacketOutcome { kAnswered, kDeferred, kWaiting, kClosed };
+
+// Queues `reply` on `bev`, replaced when it is too large for a packet, so
+// the client is never left waiting for ever. Returns 0 when a reply was
+// queued.
+int QueueReply(struct bufferevent* bev, const Json::Value& reply) {
+  bool too_large = false;
+  int result = QueuePacket(bev, reply, &too_large);
+  if (result != 0 && too_large) {
+    result =
+        QueuePacket(bev, MakeResponse(false, "reply too large"), &too_large);
+  }
+  return result;
+}
 
 // Handles the packet at the head of the connection's input, if it is
 // complete: parse, handler, reply. The header is read once.
@@ -188,19 +213,77 @@ PacketOutcome HandleOnePacket(struct bufferevent* bev, EventArgs* args) {
   Json::Value reply(Json::objectValue);
   ParseRequest(body, peek.body_length, request);
   g_handler_connection = bev;
+  g_handler_args = args;
   int result = CallHandler(args, request, reply);
+  DeferredReply* deferred = g_deferred_in_call;
   g_handler_connection = nullptr;
+  g_handler_args = nullptr;
+  g_deferred_in_call = nullptr;
   if (result != 0) {
+    if (deferred != nullptr) {  // nothing more is sent on this connection
+      quvaidx::DetachDeferred(bev);
+      deferred->bev = nullptr;
+    }
     FinishConnection(bev);
     return PacketOutcome::kClosed;
   }
-  bool too_large = false;
-  if (QueuePacket(bev, reply, &too_large) != 0 && too_large) {
-    // Answer anyway, so the client is not left waiting for ever.
-    QueuePacket(bev, MakeResponse(false, "reply too large"), &too_large);
-  }
+  if (deferred != nullptr) return PacketOutcome::kDeferred;
+  QueueReply(bev, reply);
   if (quvaidx::EnforceOutputLimit(bev)) return PacketOutcome::kClosed;
   return PacketOutcome::kAnswered;
+}
+
+// While `bev` waits for a deferred reply, its later requests are read up to
+// kDeferredInputLimit bytes, then not at all until the reply has gone.
+void WaitForDeferredReply(struct bufferevent* bev) {
+  if (evbuffer_get_length(bufferevent_get_input(bev)) >= kDeferredInputLimit) {
+    bufferevent_disable(bev, EV_READ);
+  }
+}
+
+// Answers every complete request buffered on `bev`: libevent calls again
+// only when more bytes arrive, which may be never. Stops at a deferred
+// reply, and while too many replies wait to be sent; a connection whose
+// peer has ended its stream is finished once nothing is left to answer.
+void ServeInput(struct bufferevent* bev, EventArgs* args) {
+  // Later requests wait for the deferred reply, so replies keep their order.
+  if (quvaidx::DeferredOf(bev) != nullptr) {
+    WaitForDeferredReply(bev);
+    return;
+  }
+  struct evbuffer* input = bufferevent_get_input(bev);
+  struct evbuffer* output = bufferevent_get_output(bev);
+  bool answered = false;
+  do {
+    PacketOutcome outcome = HandleOnePacket(bev, args);
+    if (outcome == PacketOutcome::kClosed) return;
+    if (outcome == PacketOutcome::kDeferred) {
+      WaitForDeferredReply(bev);
+      quvaidx::NoteWait(bev, Wait::kReply, /*progress=*/true);
+      return;
+    }
+    if (outcome == PacketOutcome::kWaiting) {
+      if (quvaidx::InputEnded(bev)) {
+        FinishConnection(bev);  // the rest of that request never comes
+        return;
+      }
+      quvaidx::NoteWait(bev, Wait::kPacket, answered);
+      return;
+    }
+    answered = true;
+    if (evbuffer_get_length(output) > kMaxPendingOutput) {
+      // The peer is not reading its replies; stop reading its requests until
+      // onWrite sees the output drained.
+      bufferevent_disable(bev, EV_READ);
+      quvaidx::NoteWait(bev, Wait::kDrain, answered);
+      return;
+    }
+  } while (evbuffer_get_length(input) > 0);
+  if (quvaidx::InputEnded(bev)) {
+    FinishConnection(bev);
+    return;
+  }
+  quvaidx::NoteWait(bev, Wait::kRequest, answered);
 }
 
 }  // namespace
@@ -215,11 +298,13 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
   if (!quvaidx::BuildUnixAddress(path, &address)) {
     AppLogError(3, "%s:%d [Error] socket path too long: %s", kModule, __LINE__,
                 path != nullptr ? path : "(null)");
+    errno = ENAMETOOLONG;
     return -1;
   }
   if (g_listener != nullptr) {
     AppLogError(3, "%s:%d [Error] a server is already running, not at %s",
                 kModule, __LINE__, path);
+    errno = EBUSY;
     return -1;
   }
   int fd = quvaidx::BindServerSocket(path, address, access);
@@ -230,8 +315,9 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
       LEV_OPT_CLOSE_ON_FREE | LEV_OPT_REUSEABLE | LEV_OPT_CLOSE_ON_EXEC;
   g_listener = evconnlistener_new(base, OnAccept, args, flags, 16, fd);
   if (g_listener == nullptr || !quvaidx::StartDeadlines(base, args)) {
-    AppLogError(3, "%s:%d [Error] Could not create a listener: %s", kModule,
-                __LINE__, path);
+    int err = g_listener == nullptr ? errno : ENOMEM;
+    AppLogError(3, "%s:%d [Error] Could not create a listener: %s (%s)",
+                kModule, __LINE__, path, strerror(err));
     if (g_listener != nullptr) {
       evconnlistener_free(g_listener);  // closes fd
       g_listener = nullptr;
@@ -239,10 +325,44 @@ int BuildServerWithAccess(struct event_base* base, const char* path,
       close(fd);
     }
     unlink(path);  // ours, made just now
+    errno = err;
     return -1;
   }
   evconnlistener_set_error_cb(g_listener, OnAcceptError);
   IgnoreBrokenPipes();
+  g_owns_socket_file = true;
+  return 0;
+}
+
+int BuildServerOnSocket(struct event_base* base, int fd, const char* path,
+                        EventArgs* args) {
+  if (g_listener != nullptr) {
+    AppLogError(3, "%s:%d [Error] a server is already running, not on fd %d",
+                kModule, __LINE__, fd);
+    errno = EBUSY;
+    return -1;
+  }
+  if (quvaidx::AdoptListeningSocket(fd, path) != 0) return -1;
+  // The deadlines first: once the listener exists it owns fd, which stays
+  // the caller's on failure.
+  int err = ENOMEM;
+  if (quvaidx::StartDeadlines(base, args)) {
+    // Backlog 0: the socket listens already, with its owner's backlog.
+    g_listener = evconnlistener_new(
+        base, OnAccept, args, LEV_OPT_CLOSE_ON_FREE | LEV_OPT_CLOSE_ON_EXEC, 0,
+        fd);
+    err = errno;
+  }
+  if (g_listener == nullptr) {
+    quvaidx::StopDeadlines();
+    AppLogError(3, "%s:%d [Error] Could not create a listener: fd %d (%s)",
+                kModule, __LINE__, fd, strerror(err));
+    errno = err;
+    return -1;
+  }
+  evconnlistener_set_error_cb(g_listener, OnAcceptError);
+  IgnoreBrokenPipes();
+  g_owns_socket_file = false;
   return 0;
 }
 
@@ -255,7 +375,9 @@ int StopServer(const char* path) {
   quvaidx::StopDeadlines();
   evconnlistener_free(g_listener);
   g_listener = nullptr;
-  if (path != nullptr) unlink(path);  // don't care if this fails
+  // A socket handed over belongs to whoever bound it. The removal's
+  // outcome is not examined.
+  if (path != nullptr && g_owns_socket_file) unlink(path);
   return 0;
 }
 
@@ -280,6 +402,75 @@ int GetPeerCredentials(PeerCredentials* peer) {
   peer->uid = credentials.uid;
   peer->gid = credentials.gid;
   return 0;
+}
+
+int GetPeerGroups(std::vector<gid_t>* groups) {
+  if (groups == nullptr || g_handler_connection == nullptr) return -1;
+  const int fd = static_cast<int>(bufferevent_getfd(g_handler_connection));
+  struct ucred credentials;
+  socklen_t length = sizeof(credentials);
+  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) {
+    return -1;
+  }
+  try {
+    return quvaidx::PeerSocketGroups(fd, credentials, groups) ? 0 : -1;
+  } catch (...) {  // out of memory
+    return -1;
+  }
+}
+
+DeferredReply* DeferReply() {
+  if (g_handler_connection == nullptr || g_deferred_in_call != nullptr) {
+    AppLogError(3, "%s:%d [Error] no reply to defer here", kModule, __LINE__);
+    return nullptr;
+  }
+  auto* deferred =
+      new (std::nothrow) DeferredReply{g_handler_connection, g_handler_args};
+  if (deferred == nullptr ||
+      !quvaidx::AttachDeferred(g_handler_connection, deferred)) {
+    AppLogError(3, "%s:%d [Error] [%s] cannot defer the reply on fd = %d",
+                kModule, __LINE__, DaemonName(g_handler_args),
+                static_cast<int>(bufferevent_getfd(g_handler_connection)));
+    delete deferred;
+    return nullptr;
+  }
+  g_deferred_in_call = deferred;
+  return deferred;
+}
+
+int SendDeferredReply(DeferredReply* deferred, const Json::Value* reply) {
+  if (deferred == nullptr || g_handler_connection != nullptr) {
+    AppLogError(3,
+                "%s:%d [Error] a deferred reply is sent from the loop, "
+                "outside handlers",
+                kModule, __LINE__);
+    return -1;
+  }
+  struct bufferevent* bev = deferred->bev;
+  EventArgs* args = deferred->args;
+  delete deferred;
+  if (bev == nullptr) return -1;  // its connection has closed
+  quvaidx::DetachDeferred(bev);
+  // Reading resumes unless the peer has ended its stream (libevent stopped
+  // reading then).
+  if (!quvaidx::InputEnded(bev)) bufferevent_enable(bev, EV_READ);
+  if (reply == nullptr) {
+    FinishConnection(bev);
+    return 0;
+  }
+  const int queued = QueueReply(bev, *reply);
+  if (quvaidx::EnforceOutputLimit(bev)) return -1;
+  if (evbuffer_get_length(bufferevent_get_output(bev)) > kMaxPendingOutput) {
+    bufferevent_disable(bev, EV_READ);  // onWrite serves the rest
+    quvaidx::NoteWait(bev, Wait::kDrain, /*progress=*/true);
+  } else if (evbuffer_get_length(bufferevent_get_input(bev)) > 0) {
+    ServeInput(bev, args);
+  } else if (quvaidx::InputEnded(bev)) {
+    FinishConnection(bev);
+  } else {
+    quvaidx::NoteWait(bev, Wait::kRequest, /*progress=*/true);
+  }
+  return queued;
 }
 
 int CheckBufferevent(struct bufferevent* bev) {
@@ -380,36 +571,18 @@ void OnAcceptError(struct evconnlistener* listener, void*) {
               evutil_socket_error_to_string(err));
 }
 
-void onRead(struct bufferevent* bev, void* ptr) {
-  EventArgs* args = static_cast<EventArgs*>(ptr);
-  struct evbuffer* input = bufferevent_get_input(bev);
-  struct evbuffer* output = bufferevent_get_output(bev);
-  // Every complete request already buffered is answered now: libevent calls
-  // again only when more bytes arrive, which may be never.
-  bool answered = false;
-  do {
-    PacketOutcome outcome = HandleOnePacket(bev, args);
-    if (outcome == PacketOutcome::kClosed) return;
-    if (outcome == PacketOutcome::kWaiting) {
-      quvaidx::NoteWait(bev, Wait::kPacket, answered);
-      return;
-    }
-    answered = true;
-    if (evbuffer_get_length(output) > kMaxPendingOutput) {
-      // The peer is not reading its replies; stop reading its requests until
-      // onWrite sees the output drained.
-      bufferevent_disable(bev, EV_READ);
-      quvaidx::NoteWait(bev, Wait::kDrain, answered);
-      return;
-    }
-  } while (evbuffer_get_length(input) > 0);
-  quvaidx::NoteWait(bev, Wait::kRequest, answered);
+void onRead(struct bufferevent* bev, void* args) {
+  ServeInput(bev, static_cast<EventArgs*>(args));
 }
 
 void onWrite(struct bufferevent* bev, void* args) {
   // Called when the output has drained. Resume a connection that was paused
-  // for backpressure, and answer what it had already sent.
-  if ((bufferevent_get_enabled(bev) & EV_READ) != 0) return;
+  // for backpressure, and answer what it had already sent; one that waits
+  // for a deferred reply is resumed when that is sent.
+  if ((bufferevent_get_enabled(bev) & EV_READ) != 0 ||
+      quvaidx::DeferredOf(bev) != nullptr) {
+    return;
+  }
   bufferevent_enable(bev, EV_READ);
   if (evbuffer_get_length(bufferevent_get_input(bev)) > 0) {
     onRead(bev, args);
@@ -441,7 +614,12 @@ void onEvent(struct bufferevent* bev, short events, void* args) {
   }
   if ((events & BEV_EVENT_EOF) != 0) {
     // The peer will send nothing more, but may still read: its replies go
-    // out before the close (libevent has stopped reading already).
+    // out before the close (libevent has stopped reading already), the
+    // deferred one and those to the requests waiting behind it included.
+    if (quvaidx::DeferredOf(bev) != nullptr) {
+      quvaidx::NoteInputEnded(bev);
+      return;
+    }
     FinishConnection(bev);
     return;
   }

@@ -32,6 +32,8 @@ struct Connection {
   long long since_ms;     // when that wait began, or progress last came
   size_t pending_output;  // bytes in its output buffer, counted in total
   struct evbuffer_cb_entry* output_watch;  // keeps pending_output current
+  DeferredReply* deferred;  // the reply the daemon still owes, or null
+  bool input_ended;         // the peer ended its stream while one was owed
 };
 
 const ServerLimits kDefaultLimits = {kPacketDeadlineMs, kIdleDeadlineMs,
@@ -85,6 +87,7 @@ void Forget(struct bufferevent* bev) {
   evbuffer_remove_cb_entry(bufferevent_get_output(bev),
                            connection->output_watch);
   g_pending_total -= connection->pending_output;
+  if (connection->deferred != nullptr) connection->deferred->bev = nullptr;
   g_by_fd[static_cast<size_t>(bufferevent_getfd(bev))] = nullptr;
   --g_tracked;
   delete connection;
@@ -157,8 +160,8 @@ void CheckDeadlines(evutil_socket_t, short, void*) {
 bool TrackConnection(struct bufferevent* bev, EventArgs* args) {
   int fd = static_cast<int>(bufferevent_getfd(bev));
   if (fd < 0) return false;
-  Connection* connection = new (std::nothrow)
-      Connection{bev, args, Wait::kRequest, NowMs(), 0, nullptr};
+  Connection* connection = new (std::nothrow) Connection{
+      bev, args, Wait::kRequest, NowMs(), 0, nullptr, nullptr, false};
   if (connection == nullptr) return false;
   try {
     if (static_cast<size_t>(fd) >= g_by_fd.size()) {
@@ -179,6 +182,7 @@ bool TrackConnection(struct bufferevent* bev, EventArgs* args) {
     // The descriptor was closed behind the server's back (its bufferevent
     // freed elsewhere): the old record describes nothing any more.
     g_pending_total -= slot->pending_output;
+    if (slot->deferred != nullptr) slot->deferred->bev = nullptr;
     --g_tracked;
     delete slot;
   }
@@ -192,6 +196,33 @@ void CloseConnection(struct bufferevent* bev) {
   Forget(bev);
   --g_conn_count;
   bufferevent_free(bev);  // closes the socket
+}
+
+bool AttachDeferred(struct bufferevent* bev, DeferredReply* deferred) {
+  Connection* connection = Find(bev);
+  if (connection == nullptr || connection->deferred != nullptr) return false;
+  connection->deferred = deferred;
+  return true;
+}
+
+DeferredReply* DeferredOf(struct bufferevent* bev) {
+  Connection* connection = Find(bev);
+  return connection != nullptr ? connection->deferred : nullptr;
+}
+
+void DetachDeferred(struct bufferevent* bev) {
+  Connection* connection = Find(bev);
+  if (connection != nullptr) connection->deferred = nullptr;
+}
+
+void NoteInputEnded(struct bufferevent* bev) {
+  Connection* connection = Find(bev);
+  if (connection != nullptr) connection->input_ended = true;
+}
+
+bool InputEnded(struct bufferevent* bev) {
+  Connection* connection = Find(bev);
+  return connection != nullptr && connection->input_ended;
 }
 
 void NoteWait(struct bufferevent* bev, Wait wait, bool progress) {

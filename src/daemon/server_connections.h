@@ -14,6 +14,13 @@
 
 #include "quvaidx/daemon.h"
 
+// A request whose reply the daemon sends later (DeferReply). The daemon
+// holds it from DeferReply until SendDeferredReply frees it.
+struct DeferredReply {
+  struct bufferevent* bev;  // its connection; null once that has closed
+  EventArgs* args;          // the connection's server record
+};
+
 namespace quvaidx {
 
 // What a connection waits for, which decides the deadline that applies.
@@ -22,6 +29,7 @@ enum class Wait {
   kPacket,   // the rest of a request that has begun (packet deadline)
   kDrain,    // the peer to take its replies; not read meanwhile (idle)
   kFlush,    // the peer to take its last replies before the close (idle)
+  kReply,    // the daemon's deferred reply; further requests wait (idle)
 };
 
 // Starts tracking `bev`, just accepted, as waiting for a request. Returns
@@ -31,6 +39,19 @@ bool TrackConnection(struct bufferevent* bev, EventArgs* args);
 // Ends a connection: stops tracking it, lowers g_conn_count and frees `bev`,
 // which closes its socket and drops whatever it had not sent.
 void CloseConnection(struct bufferevent* bev);
+
+// Records that `bev` waits for `deferred`'s reply (Wait::kReply). Returns
+// false, recording nothing, when `bev` is not tracked or already waits for
+// one. When the connection closes, deferred->bev becomes null.
+bool AttachDeferred(struct bufferevent* bev, DeferredReply* deferred);
+// The reply `bev` waits for, or null.
+DeferredReply* DeferredOf(struct bufferevent* bev);
+// `bev` no longer waits for a deferred reply.
+void DetachDeferred(struct bufferevent* bev);
+// Records that the peer of `bev` sent the end of its stream while a deferred
+// reply was due, and tells whether it did; untracked connections never did.
+void NoteInputEnded(struct bufferevent* bev);
+bool InputEnded(struct bufferevent* bev);
 
 // Records that `bev` now waits for `wait`. Its clock restarts when `wait`
 // differs from before or `progress` says a request was just answered; a

@@ -3,10 +3,12 @@
 #include <errno.h>
 #include <string.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/time.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include "ipc/client_internal.h"
 #include "ipc/connect_timeout.h"
 #include "ipc/packet_codec.h"
 #include "quvaidx/ipc.h"
@@ -31,21 +33,44 @@ void CloseSocket(int fd) {
 // which the kernel applies to connect and which wakes the caller as soon as
 // the daemon accepts; it is cleared again afterwards, because exchanges have
 // no time limit. Returns false when the connection was not made.
-bool ConnectWithinLimit(int fd, const struct sockaddr_un& address) {
-  struct timeval limit = {g_connect_timeout_ms / 1000,
-                          (g_connect_timeout_ms % 1000) * 1000};
+bool ConnectWithinLimit(int fd, const struct sockaddr_un& address,
+                        int limit_ms = g_connect_timeout_ms) {
+  struct timeval limit = {limit_ms / 1000, (limit_ms % 1000) * 1000};
   if (setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof(limit)) != 0) {
     return false;  // an unbounded wait is what this must prevent
   }
   bool connected =
       connect(fd, reinterpret_cast<const struct sockaddr*>(&address),
               sizeof(address)) == 0;
+  const int err = errno;
   struct timeval none = {0, 0};
   if (connected &&
       setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &none, sizeof(none)) != 0) {
     return false;  // sends would time out: not the connection promised
   }
+  errno = err;
   return connected;
+}
+
+// True when the process at the other end of `fd` is root or runs as this
+// process's effective user. Anyone else may have bound the daemon's path
+// while the daemon was down: it would receive the requests and forge the
+// replies. Logs a refusal at level 3.
+bool PeerIsTrusted(int fd, const char* path) {
+  struct ucred peer;
+  socklen_t length = sizeof(peer);
+  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0) {
+    AppLogError(3, "%s:%d [Error] cannot tell who serves %s: %s", kModule,
+                __LINE__, path, strerror(errno));
+    return false;
+  }
+  if (peer.uid == 0 || peer.uid == geteuid()) return true;
+  AppLogError(3,
+              "%s:%d [Error] refused %s: served by uid %u (pid %d), neither "
+              "root nor uid %u",
+              kModule, __LINE__, path, static_cast<unsigned>(peer.uid),
+              static_cast<int>(peer.pid), static_cast<unsigned>(geteuid()));
+  return false;
 }
 
 }  // namespace
@@ -107,16 +132,49 @@ int DisconnectPeer(int fd) {
   return 0;
 }
 
+int ConnectDaemon(const char* path, int timeout_ms) {
+  struct sockaddr_un address;
+  if (!quvaidx::BuildUnixAddress(path, &address)) {
+    errno = ENAMETOOLONG;
+    return -1;
+  }
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return -1;
+  if (!ConnectWithinLimit(fd, address, timeout_ms > 0 ? timeout_ms : 1)) {
+    int err = errno;
+    CloseSocket(fd);
+    struct stat st;
+    if (err == EAGAIN || err == EINPROGRESS) {
+      err = ETIMEDOUT;  // the backlog stayed full
+    } else if (err == ECONNREFUSED && stat(path, &st) == 0 &&
+               !S_ISSOCK(st.st_mode)) {
+      err = ENOTSOCK;
+    }
+    errno = err;
+    return -1;
+  }
+  if (!PeerIsTrusted(fd, path)) {
+    CloseSocket(fd);
+    errno = EPERM;
+    return -1;
+  }
+  return fd;
+}
+
 namespace {
 
 // One connection, one request, optionally one reply; restarted when the
 // daemon closed or reset the connection. The reply, when one is wanted,
 // replaces `value`; without a reply `value` becomes null.
 int ExchangeByPath(const char* path, Json::Value& value, int attempts,
-                   bool want_reply) {
+                   bool want_reply, bool check_peer = false) {
   for (int restarts = 0;; ++restarts) {
     int fd = ConnectPeer(path, /*handshake=*/!want_reply, attempts);
     if (fd < 0) break;
+    if (check_peer && !PeerIsTrusted(fd, path)) {
+      CloseSocket(fd);  // nothing was sent to the stranger
+      break;
+    }
     Json::Value reply;
     int result = SendPacket(fd, value);
     if (result == 0 && want_reply) result = RecvPacket(fd, reply);
@@ -137,6 +195,15 @@ int ExchangeByPath(const char* path, Json::Value& value, int attempts,
 }
 
 }  // namespace
+
+namespace quvaidx {
+
+int ExchangeWithDaemon(const char* path, Json::Value& value, int attempts) {
+  return ExchangeByPath(path, value, attempts, /*want_reply=*/true,
+                        /*check_peer=*/true);
+}
+
+}  // namespace quvaidx
 
 int AutoSendPacket(const char* path, Json::Value& value, int attempts) {
   return ExchangeByPath(path, value, attempts, /*want_reply=*/false);

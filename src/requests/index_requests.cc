@@ -4,6 +4,7 @@
 #include <string.h>
 #include <syslog.h>
 
+#include "ipc/client_internal.h"
 #include "quvahost/quvahost.h"
 #include "quvaidx/index_requests.h"
 #include "quvaidx/ipc.h"
@@ -24,9 +25,11 @@ enum class Outcome {
   kDone,            // "success" true; the reply is in the request value
 };
 
-// Sends `value` to the daemon at `socket` and leaves the reply in it.
+// Sends `value` to the daemon at `socket` and leaves the reply in it. Only
+// root or this process's own user may answer: a stranger who bound the
+// fixed path while the daemon was down gets nothing.
 Outcome Exchange(const char* socket, Json::Value& value) {
-  if (AutoSendRecvPacket(socket, -1, value, kIndexRequestAttempts) == -1) {
+  if (quvaidx::ExchangeWithDaemon(socket, value, kIndexRequestAttempts) == -1) {
     return Outcome::kExchangeFailed;
   }
   return quvaidx::ReadBool(quvaidx::MemberOf(value, "success"))

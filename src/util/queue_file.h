@@ -1,9 +1,9 @@
 // Locking a spool-queue file for its writers and its consumer. Not exported.
 //
-// A consumer trims a queue by writing the rest to a new file and renaming it
-// over the queue (FileRemoveHeadingLine). A process that was waiting for the
-// old file's flock meanwhile holds the lock of a file nobody will read again:
-// it must notice and lock the file that is at the path now.
+// A consumer compacts a queue by writing the rest to a new file and renaming
+// it over the queue (as FileRemoveHeadingLine does). A process that was
+// waiting for the old file's flock meanwhile holds the lock of a file nobody
+// will read again: it must notice and lock the file that is at the path now.
 #ifndef QUVAIDX_UTIL_QUEUE_FILE_H_
 #define QUVAIDX_UTIL_QUEUE_FILE_H_
 

@@ -49,7 +49,8 @@ int WriteIndexQueue(const char* entry, const char* queue) {
     if (QueueHoldsEntry(queue, entry, length)) return 0;
     // O_NOFOLLOW: a link planted at the queue path is refused (ELOOP, in
     // the line below), not written through.
-    fd = open(queue, kQueueOpenFlags | O_CLOEXEC | O_NOFOLLOW, 0777);
+    // 0666: a queue holds text, never anything to execute.
+    fd = open(queue, kQueueOpenFlags | O_CLOEXEC | O_NOFOLLOW, 0666);
     if (fd >= 0) {
       if (flock(fd, LOCK_EX) != 0) {
         int err = errno;

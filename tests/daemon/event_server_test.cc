@@ -8,10 +8,12 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -166,6 +168,29 @@ class EventServerTest : public ::testing::Test {
                            static_cast<unsigned char>(header[3]));
   }
 
+  // Sends bytes[*sent, end) on fd, running the loop, for as long as the
+  // server takes them within `ms`; advances *sent.
+  void SendAsTaken(int fd, const std::string& bytes, size_t* sent, int ms) {
+    RunUntil(
+        [&] {
+          ssize_t n = send(fd, bytes.data() + *sent, bytes.size() - *sent,
+                           MSG_DONTWAIT | MSG_NOSIGNAL);
+          *sent += n > 0 ? static_cast<size_t>(n) : 0;
+          return *sent == bytes.size();
+        },
+        ms);
+  }
+
+  // True when `received` is `reply` `n` times over.
+  static bool Repeats(const std::string& received, const std::string& reply,
+                      size_t n) {
+    if (received.size() != reply.size() * n) return false;
+    for (size_t at = 0; at < received.size(); at += reply.size()) {
+      if (received.compare(at, reply.size(), reply) != 0) return false;
+    }
+    return true;
+  }
+
   // True when the server closed fd without sending anything more.
   bool ClosedSilently(int fd) {
     bool closed = false;
@@ -183,15 +208,10 @@ class EventServerTest : public ::testing::Test {
   std::map<int, std::string> pending_;
 };
 
-// A request in pieces reaches the handler once, after its last byte; the
-// handler learns who is asking (nobody, outside its calls); a reply it does
-// not touch goes out as {}.
-TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPeerIsKnown) {
-  PeerCredentials seen = {-1, 0, 0};
-  handler_ = [&](Json::Value& request, Json::Value& reply) {
-    EXPECT_EQ(GetPeerCredentials(&seen), 0);
-    return Succeed(request, reply);
-  };
+// A request in pieces reaches the handler once, after its last byte; a
+// reply the handler does not touch goes out as {}.
+TEST_F(EventServerTest, SuccessReplyIsExactly21Bytes) {
+  handler_ = Succeed;
   Start();
   int fd = Connect();
   const std::string packet = Request("HANDSHAKE");
@@ -204,14 +224,54 @@ TEST_F(EventServerTest, SuccessReplyIsExactly21BytesAndPeerIsKnown) {
   EXPECT_EQ(Receive(fd, 21), std::string("\x15\xbe\x00\x11", 4) + kSuccess);
   ASSERT_EQ(requests_.size(), 1u);
   EXPECT_EQ(requests_[0]["command"].asString(), "HANDSHAKE");
-  EXPECT_TRUE(seen.pid == getpid() && seen.uid == getuid() &&
-              seen.gid == getgid());
-  PeerCredentials untouched = {-7, 0, 0};
-  EXPECT_EQ(GetPeerCredentials(&untouched), -1);
-  EXPECT_EQ(untouched.pid, -7);
   handler_ = nullptr;
   Send(fd, Request("UNTOUCHED"));
   EXPECT_EQ(ReceiveBody(fd), "{}\n");
+}
+
+// The handler learns who is asking (nobody, outside its calls): the
+// process, its user and group, and the groups it holds, which need not be
+// those the group database gives its user (here it gives none).
+TEST_F(EventServerTest, HandlerLearnsThePeerAndTheGroupsItHolds) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to make a peer of groups";
+  const gid_t kGroups[] = {48213, 48212, 48214};
+  std::vector<gid_t> seen;
+  PeerCredentials peer = {};
+  handler_ = [&](Json::Value& request, Json::Value& reply) {
+    EXPECT_EQ(GetPeerGroups(&seen), 0);
+    EXPECT_EQ(GetPeerCredentials(&peer), 0);
+    return Succeed(request, reply);
+  };
+  ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
+  const ServerSocketAccess open_to_all = {0666, static_cast<gid_t>(-1)};
+  ASSERT_EQ(BuildServerWithAccess(base_, path_.c_str(), &args_, &open_to_all),
+            0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {  // no gtest here: the exit status says how it went
+    if (setgroups(3, kGroups) != 0 || setresgid(48211, 48211, 48211) != 0 ||
+        setresuid(48211, 48211, 48211) != 0) {
+      _exit(2);
+    }
+    int fd = ConnectPeer(path_.c_str(), false, 1);
+    Json::Value request(Json::objectValue);
+    request["command"] = "WHO";
+    _exit(fd >= 0 && AutoSendRecvPacketByFd(fd, request, 0) == 0 ? 0 : 1);
+  }
+  RunUntil([&] { return !requests_.empty(); }, 3000);
+  RunFor(20);
+  int status = -1;
+  waitpid(child, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  std::sort(seen.begin(), seen.end());
+  EXPECT_EQ(seen, (std::vector<gid_t>{48212, 48213, 48214}));
+  EXPECT_TRUE(peer.uid == 48211 && peer.gid == 48211 && peer.pid == child);
+  std::vector<gid_t> outside = {1};
+  EXPECT_EQ(GetPeerGroups(&outside), -1);
+  EXPECT_EQ(outside, std::vector<gid_t>{1});
+  PeerCredentials untouched = {-7, 0, 0};
+  EXPECT_EQ(GetPeerCredentials(&untouched), -1);
+  EXPECT_EQ(untouched.pid, -7);
 }
 
 // Pipelined requests are all answered at once, in order, without waiting
@@ -303,15 +363,20 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   mkdir(dir_.File("dir").c_str(), 0700);
   symlink(dir_.File("stale.sock").c_str(), dir_.File("link").c_str());
   const std::string in_use = " is in use: a daemon listens there";
+  const std::string other = " is not a socket; left alone";
   struct Case {
     const char* name;
     int result;
     std::string line;  // after "quvaidx_daemon:N [Error] " and the path
+    int error;         // errno after a refusal
     mode_t type;       // what is at the path afterwards
   } cases[] = {
-      {"absent.sock", 0, "", S_IFSOCK},    {"stale.sock", 0, "", S_IFSOCK},
-      {"live.sock", -1, in_use, S_IFSOCK}, {"file", -1, "remove", S_IFREG},
-      {"dir", -1, "remove", S_IFDIR},      {"link", -1, "remove", S_IFLNK},
+      {"absent.sock", 0, "", 0, S_IFSOCK},
+      {"stale.sock", 0, "", 0, S_IFSOCK},
+      {"live.sock", -1, in_use, EADDRINUSE, S_IFSOCK},
+      {"file", -1, other, EEXIST, S_IFREG},
+      {"dir", -1, other, EEXIST, S_IFDIR},
+      {"link", -1, other, EEXIST, S_IFLNK},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -319,6 +384,7 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
     struct stat before = {};
     lstat(path.c_str(), &before);
     LogCapture log;
+    errno = 0;
     EXPECT_EQ(BuildServer(base_, path.c_str(), &args_), c.result);
     EXPECT_EQ(g_listener != nullptr, c.result == 0);
     struct stat after = {};
@@ -329,13 +395,59 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
       StopServer(path.c_str());
       continue;
     }
+    EXPECT_EQ(errno, c.error);
     EXPECT_EQ(after.st_ino, before.st_ino);
-    const std::string line =
-        c.line == in_use ? path + c.line : c.line + " " + path;
-    EXPECT_EQ(log.Normalized(),
-              std::vector<std::string>{"quvaidx_daemon:N [Error] " + line});
+    EXPECT_EQ(
+        log.Normalized(),
+        std::vector<std::string>{"quvaidx_daemon:N [Error] " + path + c.line});
   }
   close(live);
+}
+
+// A socket handed over is served only when it is a listening Unix stream
+// socket bound to the expected path; the server closes its descriptor when
+// it stops but never removes the file, which belongs to whoever bound it.
+TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
+  int datagram = socket(AF_UNIX, SOCK_DGRAM, 0);
+  int unbound = socket(AF_UNIX, SOCK_STREAM, 0);
+  int elsewhere = ListenUnix(dir_.File("elsewhere.sock"), 4);
+  int pipe_ends[2];
+  ASSERT_EQ(pipe(pipe_ends), 0);
+  struct Case {
+    const char* name;
+    int fd;
+    int error;
+  } refused[] = {{"pipe", pipe_ends[0], ENOTSOCK},
+                 {"datagram", datagram, EINVAL},
+                 {"not listening", unbound, EINVAL},
+                 {"other path", elsewhere, EADDRNOTAVAIL}};
+  for (const Case& c : refused) {
+    SCOPED_TRACE(c.name);
+    LogCapture log;
+    errno = 0;
+    EXPECT_EQ(BuildServerOnSocket(base_, c.fd, path_.c_str(), &args_), -1);
+    EXPECT_EQ(errno, c.error);
+    EXPECT_EQ(g_listener, nullptr);
+    EXPECT_EQ(fcntl(c.fd, F_GETFL) & O_NONBLOCK, 0) << "the descriptor changed";
+    EXPECT_EQ(log.lines().size(), 1u);
+    close(c.fd);
+  }
+  close(pipe_ends[1]);
+  int handed = ListenUnix(path_, 4);
+  ASSERT_EQ(BuildServerOnSocket(base_, handed, path_.c_str(), &args_), 0);
+  EXPECT_NE(fcntl(handed, F_GETFL) & O_NONBLOCK, 0);
+  int fd = Connect();
+  Send(fd, Request("HANDSHAKE"));
+  EXPECT_EQ(ReceiveBody(fd), "{}\n");
+  StopServer(path_.c_str());
+  struct stat st;
+  EXPECT_EQ(lstat(path_.c_str(), &st), 0) << "the manager's socket was removed";
+  EXPECT_EQ(fcntl(handed, F_GETFD), -1) << "the descriptor was not closed";
+  // A server built later on its own socket removes it again.
+  unlink(path_.c_str());
+  Start();
+  StopServer(path_.c_str());
+  EXPECT_NE(lstat(path_.c_str(), &st), 0);
 }
 
 // An overlong path is refused, not cut: the file at the cut path stays. A
@@ -475,10 +587,7 @@ TEST_F(EventServerTest, RepliesToASlowHalfClosedClientAreBoundedAndAllSent) {
       Receive(fd, reply.size() * kRequests + 1, &closed, 10000);
   EXPECT_TRUE(closed);
   EXPECT_EQ(requests_.size(), static_cast<size_t>(kRequests));
-  ASSERT_EQ(received.size(), reply.size() * kRequests);
-  for (size_t at = 0; at < received.size(); at += reply.size()) {
-    ASSERT_EQ(received.compare(at, reply.size(), reply), 0) << at;
-  }
+  EXPECT_TRUE(Repeats(received, reply, kRequests)) << received.size();
   EXPECT_EQ(GetCurrentConnCount(), 0);
 }
 
@@ -491,23 +600,15 @@ TEST_F(EventServerTest, HalfClosedPipelineGetsEveryReply) {
   const int kRequests = 20000;
   const std::string requests = Requests("R", kRequests);
   int fd = Connect();
-  // Everything goes out before the client reads a byte.
-  for (size_t sent = 0; sent < requests.size();) {
-    ssize_t n = send(fd, requests.data() + sent, requests.size() - sent,
-                     MSG_DONTWAIT | MSG_NOSIGNAL);
-    sent += n > 0 ? static_cast<size_t>(n) : 0;
-    event_base_loop(base_, EVLOOP_NONBLOCK);
-  }
+  size_t sent = 0;  // everything goes out before the client reads a byte
+  SendAsTaken(fd, requests, &sent, 10000);
   ASSERT_EQ(shutdown(fd, SHUT_WR), 0);
   bool closed = false;
   const std::string reply = std::string("\x15\xbe\x00\x11", 4) + kSuccess;
   const std::string received =
       Receive(fd, reply.size() * kRequests + 1, &closed, 10000);
   EXPECT_TRUE(closed);
-  ASSERT_EQ(received.size(), reply.size() * kRequests);
-  for (size_t at = 0; at < received.size(); at += reply.size()) {
-    ASSERT_EQ(received.compare(at, reply.size(), reply), 0) << at;
-  }
+  EXPECT_TRUE(Repeats(received, reply, kRequests)) << received.size();
 }
 
 // A request that trickles in is closed at the packet deadline counted from
@@ -625,6 +726,150 @@ TEST_F(EventServerTest, UnsentRepliesOfAllConnectionsAreBounded) {
   clients_.clear();
   EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 5000));
   EXPECT_EQ(quvaidx::PendingOutputTotal(), 0u);
+}
+
+// A handler that takes every "SLOW" request's reply away, kept in deferred_.
+class DeferredReplyTest : public EventServerTest {
+ protected:
+  void SetUp() override {
+    EventServerTest::SetUp();
+    handler_ = [this](Json::Value& request, Json::Value& reply) {
+      if (request["command"] == "SLOW") {
+        DeferredReply* deferred = DeferReply();
+        EXPECT_NE(deferred, nullptr);
+        deferred_.push_back(deferred);
+        return 0;
+      }
+      reply["echo"] = request["command"];
+      return 0;
+    };
+  }
+
+  // Sends the oldest deferred reply: {"late": n}.
+  int Answer(int n) {
+    Json::Value late(Json::objectValue);
+    late["late"] = n;
+    DeferredReply* deferred = deferred_.front();
+    deferred_.erase(deferred_.begin());
+    return SendDeferredReply(deferred, &late);
+  }
+
+  std::vector<DeferredReply*> deferred_;
+};
+
+// While a reply is deferred, other connections are answered; the
+// connection's own later requests wait, unseen by the handler, and are
+// answered in order after the late reply, however many arrive meanwhile
+// (more than the server reads while it waits).
+TEST_F(DeferredReplyTest, RepliesKeepTheirOrderPerConnection) {
+  Start();
+  int slow = Connect();
+  int other = Connect();
+  const int kLater = 30000;  // about 750 KB of requests
+  std::string requests = Request("SLOW") + Requests("LATER", kLater);
+  size_t sent = 0;
+  SendAsTaken(slow, requests, &sent, 300);
+  EXPECT_LT(sent, requests.size());  // the server stopped reading
+  Send(other, Request("OTHER"));
+  EXPECT_EQ(ReceiveBody(other), "{\"echo\":\"OTHER\"}\n");
+  ASSERT_EQ(deferred_.size(), 1u);
+  EXPECT_EQ(requests_.size(), 2u);  // nothing of `slow` after its SLOW
+  EXPECT_EQ(Receive(slow, 1, nullptr, 50), "");
+  EXPECT_EQ(Answer(1), 0);
+  EXPECT_EQ(ReceiveBody(slow), "{\"late\":1}\n");
+  const std::string reply = Packet("{\"echo\":\"LATER\"}\n");
+  std::string received;
+  RunUntil(
+      [&] {
+        SendAsTaken(slow, requests, &sent, 1);
+        received +=
+            Receive(slow, reply.size() * kLater - received.size(), nullptr, 1);
+        return received.size() == reply.size() * kLater;
+      },
+      5000);
+  EXPECT_EQ(sent, requests.size());
+  EXPECT_TRUE(Repeats(received, reply, kLater)) << received.size();
+}
+
+// A peer that ends its stream while its reply is deferred still gets that
+// reply and the answers to what it sent before the end, then the close. A
+// late reply to a connection that has gone (its peer left, its idle
+// deadline passed, or the handler ended it) is dropped; the handle is freed
+// either way (the sanitizers see to that).
+TEST_F(DeferredReplyTest, LateRepliesReachHalfClosedPeersAndNobodyElse) {
+  const ServerLimits limits = {kPacketDeadlineMs, 300, kMaxTotalPendingOutput};
+  Start(&limits);
+  int half = Connect();
+  Send(half, Request("SLOW") + Request("AFTER") + Request("SLOW"));
+  ASSERT_EQ(shutdown(half, SHUT_WR), 0);
+  RunFor(20);
+  ASSERT_EQ(deferred_.size(), 1u);
+  EXPECT_EQ(Answer(1), 0);
+  EXPECT_EQ(ReceiveBody(half), "{\"late\":1}\n");
+  EXPECT_EQ(ReceiveBody(half), "{\"echo\":\"AFTER\"}\n");
+  ASSERT_EQ(deferred_.size(), 1u);
+  EXPECT_EQ(Answer(2), 0);
+  EXPECT_EQ(ReceiveBody(half), "{\"late\":2}\n");
+  bool closed = false;
+  EXPECT_EQ(Receive(half, 1, &closed), "");
+  EXPECT_TRUE(closed);
+
+  int leaving = Connect();
+  int idle = Connect();
+  Send(leaving, Request("SLOW"));
+  Send(idle, Request("SLOW"));
+  RunFor(20);
+  close(leaving);
+  clients_.erase(std::find(clients_.begin(), clients_.end(), leaving));
+  EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 1500));
+  EXPECT_TRUE(ClosedSilently(idle));  // the idle deadline holds meanwhile
+  EXPECT_EQ(Answer(3), -1);
+  EXPECT_EQ(Answer(4), -1);
+
+  int ended = Connect();
+  handler_ = [&](Json::Value&, Json::Value&) {
+    deferred_.push_back(DeferReply());
+    return -1;
+  };
+  Send(ended, Request("SLOW"));
+  EXPECT_TRUE(ClosedSilently(ended));
+  ASSERT_EQ(deferred_.size(), 1u);
+  EXPECT_EQ(Answer(5), -1);
+}
+
+// Deferring works only inside a handler, once per request; a late reply is
+// sent from the loop, not from inside a handler; a null reply ends the
+// connection as a handler's refusal does; a late reply too large for a
+// packet is replaced, as any reply is.
+TEST_F(DeferredReplyTest, MisusesAreRefusedAndNullOrHugeRepliesHandled) {
+  LogCapture log;
+  EXPECT_EQ(DeferReply(), nullptr);
+  Json::Value reply(Json::objectValue);
+  EXPECT_EQ(SendDeferredReply(nullptr, &reply), -1);
+  Start();
+  handler_ = [&](Json::Value&, Json::Value&) {
+    deferred_.push_back(DeferReply());
+    EXPECT_EQ(DeferReply(), nullptr);
+    Json::Value now(Json::objectValue);
+    EXPECT_EQ(SendDeferredReply(deferred_.back(), &now), -1);  // untouched
+    return 0;
+  };
+  int fd = Connect();
+  Send(fd, Request("SLOW"));
+  RunFor(10);
+  ASSERT_EQ(deferred_.size(), 1u);
+  EXPECT_EQ(Receive(fd, 1, nullptr, 20), "");
+  Json::Value huge(Json::objectValue);
+  huge["blob"] = std::string(20000, 'b');
+  EXPECT_EQ(SendDeferredReply(deferred_.back(), &huge), 0);
+  EXPECT_EQ(ReceiveBody(fd),
+            "{\"reason\":\"reply too large\",\"success\":false}\n");
+  Send(fd, Request("SLOW"));
+  RunFor(10);
+  ASSERT_EQ(deferred_.size(), 2u);
+  EXPECT_EQ(SendDeferredReply(deferred_.back(), nullptr), 0);
+  EXPECT_TRUE(ClosedSilently(fd));
+  EXPECT_EQ(log.lines().size(), 7u);  // each refusal, the reply too large
 }
 
 }  // namespace

@@ -1,9 +1,12 @@
 #include "photo_fixtures.h"
 
 #include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
+#include <fstream>
 
 #include <vips/vips.h>
 
@@ -38,6 +41,41 @@ bool WritePhoto(const std::string& path, int width, int height, Rgb left,
   g_object_unref(image);
   vips_error_clear();
   return failed == 0;
+}
+
+bool WritePlainPhoto(const std::string& path, int width, int height,
+                     Rgb colour) {
+  const std::string file = path.substr(0, path.find('['));
+  if (file.size() > 4 && file.compare(file.size() - 4, 4, ".gif") == 0) {
+    // Through the vips command: libvips's GIF encoder (libimagequant) leaks,
+    // and the tests run under LeakSanitizer too. The test's own paths under
+    // mkdtemp hold no quote.
+    const std::string png = file + ".png";
+    const bool ok =
+        WritePlainPhoto(png, width, height, colour) &&
+        system(("vips copy '" + png + "' '" + path + "'").c_str()) == 0;
+    unlink(png.c_str());
+    return ok;
+  }
+  VipsImage* black = nullptr;
+  VipsImage* coloured = nullptr;
+  VipsImage* cast = nullptr;
+  double zero[] = {1, 1, 1};
+  double add[] = {static_cast<double>(colour.r), static_cast<double>(colour.g),
+                  static_cast<double>(colour.b)};
+  bool ok = StartVips() &&
+            vips_black(&black, width, height, "bands", 3, nullptr) == 0 &&
+            vips_linear(black, &coloured, zero, add, 3, nullptr) == 0 &&
+            vips_cast(coloured, &cast, VIPS_FORMAT_UCHAR, nullptr) == 0;
+  if (ok) {
+    cast->Type = VIPS_INTERPRETATION_sRGB;
+    ok = vips_image_write_to_file(cast, path.c_str(), nullptr) == 0;
+  }
+  for (VipsImage* image : {black, coloured, cast}) {
+    if (image != nullptr) g_object_unref(image);
+  }
+  vips_error_clear();
+  return ok;
 }
 
 bool WritePngBomb(const std::string& path, int width, int height) {
@@ -125,10 +163,33 @@ std::vector<std::string> NamesUnder(const std::string& dir) {
   std::error_code ignored;
   for (const auto& entry :
        std::filesystem::recursive_directory_iterator(dir, ignored)) {
-    names.push_back(std::filesystem::relative(entry.path(), dir).string());
+    names.push_back(entry.path().lexically_relative(dir).string());
   }
   std::sort(names.begin(), names.end());
   return names;
+}
+
+void WriteShares(
+    const std::string& etc_dir,
+    const std::vector<std::pair<std::string, std::string>>& shares) {
+  mkdir(etc_dir.c_str(), 0755);
+  std::ofstream out(etc_dir + "/shares.conf", std::ios::trunc);
+  for (const auto& [name, path] : shares) {
+    out << "[" << name << "]\npath = " << path << "\n";
+  }
+}
+
+bool Own(const std::string& path, unsigned uid, unsigned gid, unsigned mode) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0 || lchown(path.c_str(), uid, gid) != 0) {
+    return false;
+  }
+  return S_ISLNK(st.st_mode) || chmod(path.c_str(), mode) == 0;
+}
+
+bool MakeOwnedDir(const std::string& path, unsigned uid, unsigned gid,
+                  unsigned mode) {
+  return mkdir(path.c_str(), 0700) == 0 && Own(path, uid, gid, mode);
 }
 
 }  // namespace quvaidx::daemon_test

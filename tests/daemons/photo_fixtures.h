@@ -23,6 +23,11 @@ constexpr Rgb kBlue = {20, 20, 230};
 bool WritePhoto(const std::string& path, int width, int height, Rgb left,
                 Rgb right, int bands = 3, int alpha = 255);
 
+// Writes a `width` x `height` image of one colour, in the format its name's
+// suffix says (options allowed), a strip at a time: never whole in memory.
+bool WritePlainPhoto(const std::string& path, int width, int height,
+                     Rgb colour);
+
 // Writes a valid 1-bit grey PNG of `width` x `height` black pixels whose
 // compressed data is tiny (about a thousandth): a decompression bomb.
 bool WritePngBomb(const std::string& path, int width, int height);
@@ -56,6 +61,26 @@ std::string ThumbItem(const std::string& photo, const std::string& label);
 
 // The paths under `dir`, recursively, sorted; relative to `dir`.
 std::vector<std::string> NamesUnder(const std::string& dir);
+
+// Writes the host stand-in's share database in `etc_dir` (what
+// QUVA_HOST_ETC names): one share "<name>" for each (name, path).
+void WriteShares(
+    const std::string& etc_dir,
+    const std::vector<std::pair<std::string, std::string>>& shares);
+
+// Gives `path` (not following a link) the owner `uid`, group `gid` and, for
+// anything but a link, `mode`. False when it cannot (the tests that need
+// this run as root).
+bool Own(const std::string& path, unsigned uid, unsigned gid, unsigned mode);
+
+// Makes the directory `path` owned by `uid` and `gid` with `mode`.
+bool MakeOwnedDir(const std::string& path, unsigned uid, unsigned gid,
+                  unsigned mode = 0755);
+
+// Users that tests run as: nobody, and one that the user database does not
+// know (so it is in no group but its own).
+constexpr unsigned kUserA = 65534;
+constexpr unsigned kUserB = 65533;
 
 }  // namespace quvaidx::daemon_test
 

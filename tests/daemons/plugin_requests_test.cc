@@ -1,7 +1,8 @@
 // The plug-in daemon's answers, without its socket: size maps against the
 // files actually present, the representative photo, running plug-ins,
 // videos that need converting (with a scripted media parser), records of
-// converted copies, and requests that must be refused.
+// converted copies, and requests that must be refused. Asked for root here;
+// answers for other users are tested on the daemon itself.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -42,7 +43,9 @@ class PluginRequestsTest : public ::testing::Test {
  protected:
   Json::Value Ask(const Json::Value& request) {
     Json::Value reply;
-    EXPECT_EQ(plugind::HandlePluginRequest(config_, request, &reply), 0);
+    EXPECT_EQ(plugind::HandlePluginRequest(config_, quvaidx_daemons::FsUser(),
+                                           request, &reply),
+              0);
     return reply;
   }
 
@@ -250,8 +253,8 @@ TEST_F(PluginRequestsTest, VideoNeedConvertFollowsCodecsAndConvertedCopies) {
 }
 
 // Without an answer from the media parser the daemon cannot tell: the reply
-// fails (the caller reads 0), and a parser that never answers costs at most
-// the configured wait.
+// fails (the caller reads 0), and a parser that never answers, or stops in
+// the middle of its reply, costs at most the configured wait.
 TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
   std::string video = File("v", "a.mkv");
   config_.media_parser_socket = dir_.File("mediaparser.sock");
@@ -264,29 +267,40 @@ TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
   EXPECT_NE(reply["reason"].asString().find("cannot parse"), std::string::npos);
   refusing.reset();
 
-  ScriptedPeer silent(config_.media_parser_socket, [](int& fd, int) {
-    Json::Value request;
-    RecvPacket(fd, request);
-    char byte;
-    while (read(fd, &byte, 1) > 0) {  // until the daemon hangs up
-    }
-  });
-  const auto started = std::chrono::steady_clock::now();
-  EXPECT_FALSE(
-      Ask(Request("IS_VIDEO_NEED_CONVERT", video))["success"].asBool());
-  EXPECT_LT(std::chrono::steady_clock::now() - started,
-            std::chrono::seconds(3));
+  for (const std::string& sent :
+       {std::string(), std::string("\x15\xbe\x00\x40{")}) {
+    ScriptedPeer stalled(config_.media_parser_socket, [&](int& fd, int) {
+      Json::Value request;
+      RecvPacket(fd, request);
+      if (!sent.empty()) Writen(fd, sent.data(), sent.size());
+      char byte;
+      while (read(fd, &byte, 1) > 0) {  // until the daemon hangs up
+      }
+    });
+    const auto started = std::chrono::steady_clock::now();
+    Json::Value reply = Ask(Request("IS_VIDEO_NEED_CONVERT", video));
+    EXPECT_FALSE(reply["success"].asBool());
+    EXPECT_EQ(reply["reason"], "the media parser does not answer (timed out)");
+    EXPECT_LT(std::chrono::steady_clock::now() - started,
+              std::chrono::milliseconds(1500));
+  }
 }
 
-// The record lands beside the converted copy, complete and clean. A record
-// may only go beside a real converted copy of a real video: no file is ever
-// written where a request points elsewhere.
+// The record lands beside the converted copy, complete and clean, whatever
+// path leads to the copy. A record may only go beside a real converted copy
+// of a real video: no file is ever written where a request points
+// elsewhere, nor through a link planted in the metadata directory.
 TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
   std::string video = File("v", "a.mkv",
                            {{"QUVAPHOTO:FILM_H.mp4", "converted video"},
                             {"QUVAPHOTO_FILM_L.mp4", "converted video"}});
   std::string photo = File("v", "p.jpg", {{"QUVAPHOTO_FILM_L.mp4", "x y"}});
+  File("v", "b.mkv", {{"QUVAPHOTO_FILM_L.mp4", "converted video"}});
   std::string ea = dir_.File("v/.quvameta/a.mkv/");
+  // A folder whose metadata directory is a link to v's.
+  mkdir(dir_.File("w").c_str(), 0755);
+  WriteFile(dir_.File("w/a.mkv"), "video");
+  symlink(dir_.File("v/.quvameta").c_str(), dir_.File("w/.quvameta").c_str());
   struct Case {
     const char* fault;
     std::string source;
@@ -295,7 +309,10 @@ TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
       {"copy elsewhere", video, dir_.File("v/QUVAPHOTO_FILM_L.mp4")},
       {"copy not named as one", video, ea + "other.mp4"},
       {"copy missing", video, ea + "QUVAPHOTO_FILM_M.mp4"},
-      {"copy under a path trick", video, ea + "../a.mkv/QUVAPHOTO_FILM_L.mp4"},
+      {"copy of another video", video,
+       dir_.File("v/.quvameta/b.mkv/QUVAPHOTO_FILM_L.mp4")},
+      {"metadata directory a link", dir_.File("w/a.mkv"),
+       dir_.File("w/.quvameta/a.mkv/QUVAPHOTO_FILM_L.mp4")},
       {"source not a video", photo,
        dir_.File("v/.quvameta/p.jpg/QUVAPHOTO_FILM_L.mp4")},
       {"source missing", dir_.File("v/gone.mkv"), ea + "QUVAPHOTO_FILM_L.mp4"},
@@ -312,7 +329,11 @@ TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
   const std::string copy = ea + "QUVAPHOTO:FILM_H.mp4";
   Json::Value package(Json::objectValue);
   package["job"] = 7;
-  Json::Value reply = Add(video, copy, package);
+  // The same item by another way: the folder's path through "..".
+  Json::Value reply =
+      Add(video, ea + "../a.mkv/QUVAPHOTO:FILM_H.mp4", Json::Value(1));
+  EXPECT_TRUE(reply["success"].asBool()) << reply;
+  reply = Add(video, copy, package);
   ASSERT_TRUE(reply["success"].asBool()) << reply;
   EXPECT_EQ(reply["record"], copy + ".json");
   Json::Value record;

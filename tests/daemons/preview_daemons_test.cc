@@ -1,15 +1,20 @@
-// The preview daemons as real processes in a private directory:
+// The thumbnail daemon as a real process in a private directory:
 // quvamkthumbd on its own queue and pid file (woken by SIGUSR1, bad photos
-// skipped, stopped or killed in the middle of an entry and started again),
-// and quvaindexplugind on its own socket, asked with the library's typed
-// requests (pointed at it through the library's socket seam) with a
-// scripted media parser beside it.
+// skipped, stopped or killed in the middle of an entry and started again;
+// and, run as root over folders of other users, links planted in its way,
+// photos it must not read, a photo swapped under it). The plug-in daemon's
+// process tests are in plugind_daemon_test.cc.
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
+#include <stdio.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
+
+#include <chrono>
 
 #include <filesystem>
 #include <string>
@@ -19,26 +24,24 @@
 
 #include "daemon_process.h"
 #include "photo_fixtures.h"
-#include "quvaidx/index_requests.h"
-#include "quvaidx/ipc.h"
 #include "quvaidx/system.h"
-#include "requests/index_requests_internal.h"
-#include "support/fake_host.h"
 #include "support/fd_check.h"
-#include "support/scripted_peer.h"
 
 namespace {
 
-using quvahost::test::FakeHost;
-using quvahost::test::HostOp;
+using quvaidx::daemon_test::ColourAt;
 using quvaidx::daemon_test::DaemonProcess;
 using quvaidx::daemon_test::kBlue;
 using quvaidx::daemon_test::kRed;
+using quvaidx::daemon_test::kUserA;
+using quvaidx::daemon_test::kUserB;
+using quvaidx::daemon_test::MakeOwnedDir;
 using quvaidx::daemon_test::NamesUnder;
+using quvaidx::daemon_test::Own;
+using quvaidx::daemon_test::Rgb;
 using quvaidx::daemon_test::ThumbItem;
 using quvaidx::daemon_test::WaitUntil;
 using quvaidx::test::ReadFile;
-using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
@@ -49,7 +52,13 @@ bool Exists(const std::string& path) {
 
 class ThumbDaemonTest : public ::testing::Test {
  protected:
-  ThumbDaemonTest() { mkdir(share_.c_str(), 0755); }
+  // The share is the only one of the host stand-in's database, which the
+  // daemon reads from the test's directory (DaemonProcess).
+  ThumbDaemonTest() {
+    umask(022);  // the daemon's, which thumbnails' modes are read with
+    mkdir(share_.c_str(), 0755);
+    quvaidx::daemon_test::WriteShares(dir_.path(), {{"share", share_}});
+  }
 
   // Starts the daemon in the foreground on the private queue and pid file,
   // pausing `throttle_ms` after each photo, and waits until its loop runs.
@@ -80,6 +89,24 @@ class ThumbDaemonTest : public ::testing::Test {
     }
     return false;
   }
+  // A folder of the share owned by `uid`, and a photo in it owned by `uid`.
+  std::string UserFolder(const std::string& name, unsigned uid) {
+    EXPECT_TRUE(MakeOwnedDir(share_ + "/" + name, uid, uid));
+    return share_ + "/" + name;
+  }
+  std::string UserPhoto(const std::string& path, unsigned uid,
+                        unsigned mode = 0644, Rgb colour = kRed) {
+    EXPECT_TRUE(quvaidx::daemon_test::WritePlainPhoto(path, 900, 600, colour));
+    EXPECT_TRUE(Own(path, uid, uid, mode));
+    return path;
+  }
+  // Queues `entries`, wakes the daemon and waits until the queue is empty.
+  bool Serve(DaemonProcess& daemon, const std::vector<std::string>& entries) {
+    for (const std::string& entry : entries) {
+      if (WriteIndexQueue(entry.c_str(), queue_.c_str()) != 0) return false;
+    }
+    return daemon.Signal(SIGUSR1) && Served();
+  }
 
   TempDir dir_;
   std::string share_ = dir_.File("share");
@@ -88,38 +115,46 @@ class ThumbDaemonTest : public ::testing::Test {
 };
 
 // Asleep until SIGUSR1; then the whole queue: a truncated JPEG, a zero-byte
-// .jpg, a bomb, a photo deleted after its folder was listed (the pause after
-// each photo holds the daemon while it goes) and a folder deleted while
-// queued are logged and skipped, the good photo made, and the daemon runs
-// on; SIGTERM ends it with its pid file gone.
+// .jpg, a bomb, a photo deleted and one replaced by a FIFO after their
+// folder was listed (the pause after each photo holds the daemon while they
+// change; the FIFO is never waited on), a folder deleted while queued and
+// one outside every share are logged and skipped, the good photo made, and
+// the daemon runs on; SIGTERM ends it at once with its pid file gone.
 TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   std::string whole = ReadFile(Photo("a.jpg"));
   WriteFile(share_ + "/cut.jpg", whole.substr(0, whole.size() / 3));
   WriteFile(share_ + "/empty.jpg", "");
   ASSERT_TRUE(
       quvaidx::daemon_test::WritePngBomb(share_ + "/bomb.png", 30000, 30000));
+  const std::string fifo = Photo("y.jpg");
   const std::string doomed = Photo("z.jpg");
+  ASSERT_EQ(mkdir(dir_.File("outside").c_str(), 0755), 0);
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon, "500")) << daemon.Errors();
-  ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
-  ASSERT_EQ(WriteIndexQueue(dir_.File("deleted-while-queued").c_str(),
-                            queue_.c_str()),
-            0);
+  for (const std::string& entry :
+       {share_, share_ + "/deleted-while-queued", dir_.File("outside")}) {
+    ASSERT_EQ(WriteIndexQueue(entry.c_str(), queue_.c_str()), 0);
+  }
   usleep(200 * 1000);
   EXPECT_FALSE(Exists(share_ + "/.quvameta"));  // not polling: asleep
   ASSERT_TRUE(daemon.Signal(SIGUSR1));
   ASSERT_TRUE(WaitUntil(20, [&] { return AllThumbs("a.jpg"); }));
   ASSERT_EQ(unlink(doomed.c_str()), 0);
+  ASSERT_EQ(unlink(fifo.c_str()), 0);
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0666), 0);
   ASSERT_TRUE(Served()) << daemon.Errors();
   const std::string log = daemon.Errors();
   for (const std::string& skipped : std::vector<std::string>{
            "empty.jpg: cannot read it", "cut.jpg: cannot read it",
-           "bomb.png: 30000 x 30000 pixels", "deleted-while-queued",
-           "skipped " + doomed + ": it is gone"}) {
+           "bomb.png: 30000 x 30000 pixels",
+           "deleted-while-queued': No such file",
+           "outside': outside every share",
+           "skipped " + doomed + ": it is gone",
+           "skipped " + fifo + ": not a regular file"}) {
     EXPECT_NE(log.find(skipped), std::string::npos) << skipped << "\n" << log;
   }
   ASSERT_TRUE(daemon.Signal(SIGTERM));
-  EXPECT_TRUE(daemon.WaitExit(10));
+  EXPECT_TRUE(daemon.WaitExit(5));
   EXPECT_FALSE(Exists(pid_file_));
 }
 
@@ -181,85 +216,217 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
   EXPECT_TRUE(daemon.Running()) << daemon.Errors();
 }
 
-// The plug-in daemon answers what the library's typed requests send, and
-// the library reads its answers; SIGTERM ends it with its socket and pid
-// file gone.
-TEST(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
-  TempDir dir;
-  const std::string socket = dir.File("plugind.sock");
-  const std::string media = dir.File("mediaparser.sock");
-  const std::string pid_file = dir.File("plugind.pid");
-  const std::string photo = dir.File("share/a.jpg");
-  const std::string video = dir.File("share/clip.mkv");
-  const std::string copy =
-      dir.File("share/.quvameta/clip.mkv/QUVAPHOTO_FILM_M.mp4");
-  std::filesystem::create_directories(dir.File("share/.quvameta/a.jpg"));
-  std::filesystem::create_directories(dir.File("share/.quvameta/clip.mkv"));
-  for (const std::string& file : {photo, video}) WriteFile(file, "media");
-  const quvaidx::IndexSockets previous =
-      quvaidx::SetIndexSockets({media.c_str(), socket.c_str()});
-  // Plug-ins are named only while their pid file names a live process:
-  // not when it is missing (web_video) or names a dead one.
-  WriteFile(dir.File("quvamkthumbd.pid"), std::to_string(getpid()));
-  WriteFile(dir.File("dead.pid"), "999999999");
+// An entry during which the daemon died (killed here, as the memory limit
+// or a crash would end it) is tried again at the next start, but not a
+// fourth time: then it is logged and dropped, and the entry behind it is
+// served.
+TEST_F(ThumbDaemonTest, EntryThatEndedTheDaemonThreeTimesIsDropped) {
+  const std::string bad = share_ + "/bad";
+  ASSERT_EQ(mkdir(bad.c_str(), 0755), 0);
+  ASSERT_EQ(mkdir((share_ + "/good").c_str(), 0755), 0);
+  Photo("bad/1.jpg");
+  Photo("bad/2.jpg");
+  Photo("good/g.jpg");
+  ASSERT_EQ(WriteIndexQueue(bad.c_str(), queue_.c_str()), 0);
+  ASSERT_EQ(WriteIndexQueue((share_ + "/good").c_str(), queue_.c_str()), 0);
+  for (int attempt = 1; attempt <= 3; ++attempt) {
+    SCOPED_TRACE("attempt " + std::to_string(attempt));
+    std::filesystem::remove_all(bad + "/.quvameta");  // 1.jpg is made anew
+    DaemonProcess daemon;
+    ASSERT_TRUE(Start(daemon, "60000")) << daemon.Errors();
+    ASSERT_TRUE(WaitUntil(20, [&] {
+      return daemon.Errors().find("of " + bad + "/1.jpg") != std::string::npos;
+    }));
+    ASSERT_TRUE(daemon.Signal(SIGKILL));
+    EXPECT_TRUE(daemon.WaitExit(5, false));
+  }
+  DaemonProcess last;
+  ASSERT_TRUE(Start(last)) << last.Errors();
+  ASSERT_TRUE(Served()) << last.Errors();
+  EXPECT_NE(last.Errors().find("gave up queue entry '" + bad + "'"),
+            std::string::npos)
+      << last.Errors();
+  EXPECT_FALSE(Exists(ThumbItem(bad + "/2.jpg", "S")));
+  EXPECT_TRUE(AllThumbs("good/g.jpg"));
+}
+
+// Links planted by a folder's owner where the daemon writes (at the
+// metadata directory, at a photo's EA directory, at a thumbnail's name, at
+// a leftover temporary file's), to a root-only folder, to another user's
+// photos or to a folder the owner may write itself. None is followed
+// (nothing appears, changes or goes at its target) and none is removed;
+// each refusal is logged and the folder's other thumbnails are made. A
+// queued folder that is itself a link is refused.
+TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  const std::string vault = dir_.File("vault");
+  ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
+  WriteFile(vault + "/root.txt", "root's");
+  const std::string bob = UserFolder("bob", kUserB);
+  WriteFile(bob + "/IMG.jpg", "bob's");
+  const std::string spare = UserFolder("spare", kUserA);
+  struct Case {
+    const char* folder;
+    std::string link;  // in the folder
+    std::string target;
+    std::string logged;
+  } cases[] = {
+      {"m1", ".quvameta", vault, "IMG.jpg: a symbolic link is in the way"},
+      {"m2", ".quvameta", spare, "IMG.jpg: a symbolic link is in the way"},
+      {"e1", ".quvameta/IMG.jpg", bob, "IMG.jpg: a symbolic link is in the"},
+      {"e2", ".quvameta/IMG.jpg", spare, "IMG.jpg: a symbolic link is in th"},
+      {"i1", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_XL.jpg", vault + "/root.txt",
+       "cannot write QUVAPHOTO_THUMB_XL.jpg: a symbolic link is in its place"},
+      {"i2", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_B.jpg", spare + "/b.jpg",
+       "cannot write QUVAPHOTO_THUMB_B.jpg: a symbolic link is in its place"},
+      {"p1", ".quvameta/IMG.jpg/QUVAPHOTO_THUMB_S.jpg.part-AbCdEf",
+       vault + "/root.txt", "made thumbnails 0xf of " + share_ + "/p1/"},
+  };
+  std::vector<std::string> entries;
+  for (const Case& c : cases) {
+    const std::string folder = UserFolder(c.folder, kUserA);
+    UserPhoto(folder + "/IMG.jpg", kUserA);
+    // The real directories above the link, as the owner would make them.
+    for (size_t slash = c.link.find('/'); slash != std::string::npos;
+         slash = c.link.find('/', slash + 1)) {
+      ASSERT_TRUE(
+          MakeOwnedDir(folder + "/" + c.link.substr(0, slash), kUserA, kUserA));
+    }
+    ASSERT_EQ(symlink(c.target.c_str(), (folder + "/" + c.link).c_str()), 0);
+    ASSERT_TRUE(Own(folder + "/" + c.link, kUserA, kUserA, 0));
+    entries.push_back(folder);
+  }
+  ASSERT_EQ(symlink((share_ + "/m1").c_str(), (share_ + "/linked").c_str()), 0);
+  entries.push_back(share_ + "/linked");
   DaemonProcess daemon;
-  ASSERT_TRUE(
-      daemon.Start(PLUGIND_PATH,
-                   {"--foreground", "--socket", socket, "--pidfile", pid_file,
-                    "--media-parser", media, "--plugin",
-                    "photo_thumbnail=" + dir.File("quvamkthumbd.pid"),
-                    "--plugin", "web_video=" + dir.File("quvamkflvd.pid"),
-                    "--plugin", "other=" + dir.File("dead.pid")},
-                   dir.path(), "plugind", "listening"))
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
+  ASSERT_TRUE(Serve(daemon, entries)) << daemon.Errors();
+  const std::string log = daemon.Errors();
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.folder);
+    char target[4096] = {};
+    const std::string link = share_ + "/" + c.folder + "/" + c.link;
+    EXPECT_GT(readlink(link.c_str(), target, sizeof(target) - 1), 0);
+    EXPECT_EQ(c.target, target);
+    EXPECT_NE(log.find(c.logged), std::string::npos) << log;
+  }
+  EXPECT_NE(log.find("'" + share_ + "/linked': a symbolic link"),
+            std::string::npos)
+      << log;
+  EXPECT_EQ(NamesUnder(vault), std::vector<std::string>{"root.txt"});
+  EXPECT_EQ(ReadFile(vault + "/root.txt"), "root's");
+  EXPECT_EQ(NamesUnder(bob), std::vector<std::string>{"IMG.jpg"});
+  EXPECT_EQ(ReadFile(bob + "/IMG.jpg"), "bob's");
+  EXPECT_TRUE(NamesUnder(spare).empty());
+  EXPECT_TRUE(Exists(ThumbItem(share_ + "/i1/IMG.jpg", "S")));
+}
+
+// The daemon reads a folder's photos as the folder's owner, so a root-only
+// photo among them gets no thumbnails (the refusal logged), although root
+// could read it; and each thumbnail gets its photo's owner, group and read
+// bits (plus the owner's write bit), whoever's photo it is.
+TEST_F(ThumbDaemonTest, ThumbnailsAreNoMoreReadableThanTheirPhotos) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  const std::string folder = UserFolder("u", kUserA);
+  struct Case {
+    const char* name;
+    unsigned uid, mode;
+    unsigned thumb_mode;  // 0: no thumbnail
+  } cases[] = {
+      {"own.jpg", kUserA, 0640, 0640},
+      {"private.jpg", kUserA, 0400, 0600},
+      {"others.jpg", kUserB, 0644, 0644},
+      {"root.jpg", 0, 0600, 0},
+  };
+  for (const Case& c : cases) {
+    UserPhoto(folder + "/" + c.name, c.uid, c.mode);
+  }
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
+  ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    struct stat st;
+    const bool made =
+        lstat(ThumbItem(folder + "/" + c.name, "XL").c_str(), &st) == 0;
+    ASSERT_EQ(made, c.thumb_mode != 0);
+    if (!made) continue;
+    EXPECT_EQ(st.st_uid, c.uid);
+    EXPECT_EQ(st.st_gid, c.uid);
+    EXPECT_EQ(st.st_mode & 07777, c.thumb_mode);
+  }
+  EXPECT_NE(
+      daemon.Errors().find("skipped " + folder +
+                           "/root.jpg: cannot open it: Permission denied"),
+      std::string::npos)
       << daemon.Errors();
+}
 
-  const std::string jpeg(64, 'j');
-  WriteFile(dir.File("share/.quvameta/a.jpg/QUVAPHOTO_THUMB_XL.jpg"), jpeg);
-  WriteFile(dir.File("share/.quvameta/a.jpg/QUVAPHOTO:THUMB_S.jpg"), jpeg);
-  int map = -1;
-  EXPECT_EQ(QUVAIDX_GetThumbSizeMap(photo.c_str(), THUMB_TYPE_PHOTO, &map), 0);
-  EXPECT_EQ(map, 0x9);
-  map = -1;
-  EXPECT_EQ(QUVAIDX_GetDirThumbSizeMap(dir.File("share").c_str(),
-                                       THUMB_TYPE_PHOTO, &map),
-            0);
-  EXPECT_EQ(map, 0x9);
+// While the daemon works on a folder over and over, the folder's owner
+// swaps a photo's name with a link to a root-only photo, and another's with
+// a 196-megapixel photo, by rename-exchange (at most 20 million times or 15 s).
+// No thumbnail ever shows either: each photo is opened once, without
+// following a link, as the folder's owner, and its limits are checked on
+// the very bytes that are decoded.
+TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
+  constexpr Rgb kGreen = {20, 230, 20};
+  const std::string vault = dir_.File("vault");
+  ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
+  UserPhoto(vault + "/secret.jpg", 0, 0600, kBlue);
+  const std::string folder = UserFolder("race", kUserA);
+  UserPhoto(folder + "/p.jpg", kUserA);
+  UserPhoto(folder + "/r.jpg", kUserA);
+  ASSERT_EQ(
+      symlink((vault + "/secret.jpg").c_str(), (folder + "/q.jpg").c_str()), 0);
+  ASSERT_TRUE(Own(folder + "/q.jpg", kUserA, kUserA, 0));
+  ASSERT_TRUE(quvaidx::daemon_test::WritePlainPhoto(folder + "/big.jpg", 14000,
+                                                    14000, kGreen));
+  ASSERT_TRUE(Own(folder + "/big.jpg", kUserA, kUserA, 0644));
+  DaemonProcess daemon;
+  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
 
-  ScriptedPeer parser(media, [](int& fd, int) {
-    Json::Value request;
-    if (RecvPacket(fd, request) != 0) return;
-    Json::Value reply(Json::objectValue);
-    reply["success"] = true;
-    reply["media"]["szVideoCodec"] = "hevc";
-    SendPacket(fd, reply);
-  });
-  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 1);
-  WriteFile(copy, "converted video");
-  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 0);
-  static __tag_QUVA_MEDIA_INFO source;
-  static __tag_QUVA_MEDIA_INFO converted;
-  snprintf(source.szPath, sizeof(source.szPath), "%s", video.c_str());
-  snprintf(converted.szPath, sizeof(converted.szPath), "%s", copy.c_str());
-  EXPECT_EQ(QUVAIDX_IndexConvertAdd(&source, &converted, Json::Value("job 7")),
-            0);
-  Json::Value record;
-  ASSERT_TRUE(Json::Reader().parse(ReadFile(copy + ".json"), record));
-  EXPECT_EQ(record["conversion_type"], "CONVERTA_MEDIUM");
-  EXPECT_EQ(record["package"], "job 7");
-
-  FakeHost host;  // the index daemon counts as alive for this process
-  host.Answer(HostOp::kProcAliveByPidFile, {1});
-  Json::Value names;
-  EXPECT_EQ(QUVAIDX_GetAllPluginName(names), 0);
-  Json::Value expected(Json::arrayValue);
-  expected.append("photo_thumbnail");
-  EXPECT_EQ(names, expected);
-
-  ASSERT_TRUE(daemon.Signal(SIGTERM));
-  EXPECT_TRUE(daemon.WaitExit(10));
-  EXPECT_FALSE(Exists(socket));
-  EXPECT_FALSE(Exists(pid_file));
-  quvaidx::SetIndexSockets(previous);
+  // The swapper works from a descriptor: the test's directory above is
+  // root's alone.
+  const int at = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(at, 0);
+  const pid_t swapper = fork();
+  ASSERT_GE(swapper, 0);
+  if (swapper == 0) {
+    if (setgroups(0, nullptr) != 0 || setresgid(kUserA, kUserA, kUserA) != 0 ||
+        setresuid(kUserA, kUserA, kUserA) != 0) {
+      _exit(1);
+    }
+    const auto end =
+        std::chrono::steady_clock::now() + std::chrono::seconds(15);
+    long swaps = 0;
+    for (long i = 0; i < 20000000 && std::chrono::steady_clock::now() < end;
+         ++i) {
+      swaps += renameat2(at, "p.jpg", at, "q.jpg", RENAME_EXCHANGE) == 0;
+      swaps += renameat2(at, "r.jpg", at, "big.jpg", RENAME_EXCHANGE) == 0;
+    }
+    _exit(swaps > 0 ? 0 : 1);
+  }
+  close(at);
+  int made = 0;
+  int leaked = 0;
+  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(14);
+  for (int round = 0; round < 30 && std::chrono::steady_clock::now() < end;
+       ++round) {
+    std::filesystem::remove_all(folder + "/.quvameta");
+    ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
+    for (const char* name : {"p.jpg", "q.jpg", "r.jpg", "big.jpg"}) {
+      const std::string thumb = ThumbItem(folder + "/" + name, "M");
+      if (!Exists(thumb)) continue;
+      ++made;
+      leaked += !quvaidx::daemon_test::Near(ColourAt(thumb, 0.5, 0.5), kRed);
+    }
+  }
+  int status = 0;
+  EXPECT_EQ(waitpid(swapper, &status, 0), swapper);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);  // it swapped
+  EXPECT_GT(made, 0) << daemon.Errors();
+  EXPECT_EQ(leaked, 0) << daemon.Errors();
 }
 
 }  // namespace

@@ -66,10 +66,11 @@ mount_private_paths road "$work" "$TOOL" "$MKTHUMBD" "$PLUGIND" "$0"
 [ -d "$work" ] || fail "the work directory is not reachable after the mounts"
 export QUVA_HOST_ETC=$work/host-etc # no boot step file: booted
 
-# The share: photos in two folders (one below the other), a PNG, files of
-# other kinds.
+# The share, the only one of the host's database: photos in two folders
+# (one below the other), a PNG, files of other kinds.
 share=$work/share
-mkdir -p "$share/Photos/2023" "$share/Music"
+mkdir -p "$share/Photos/2023" "$share/Music" "$QUVA_HOST_ETC"
+printf '[share]\npath = %s\n' "$share" >"$QUVA_HOST_ETC/shares.conf"
 vips black "$share/Photos/a.jpg" 1600 1200 --bands 3
 vips black "$share/Photos/b.jpg" 300 200 --bands 3
 vips black "$share/Photos/2023/c.png" 640 480 --bands 3
@@ -127,8 +128,8 @@ timeout 10 "$TOOL" plugins >/dev/null 2>&1 &&
 echo $$ >/var/run/quvaindexd.pid
 out=$(timeout 10 "$TOOL" plugins) || fail "plugins failed"
 [ "$out" = photo_thumbnail ] || fail "plugin names: '$out'"
-timeout 10 "$TOOL" daemons | grep -q '^plugind.*yes' ||
-  fail "quvaidx daemons does not show plugind alive"
+timeout 10 "$TOOL" daemons plugind | grep -q '^plugind.*yes' ||
+  fail "quvaidx daemons plugind does not show it alive, or exits non-zero"
 
 # Both daemons end on SIGTERM and take their files with them.
 kill -TERM "${PIDS[@]}"

@@ -2,9 +2,10 @@
 # The common life of the reference daemons, on a sample daemon:
 #   runner_test.sh SAMPLED QUVAIDX
 # options and their errors, the pid file and a refused second instance,
-# --stderr with --loglevel, the socket's mode and group, SIGTERM, and a
-# detached start with relative paths. Everything lives in a private
-# directory; every process started is ended by its pid.
+# --stderr with --loglevel, the socket's mode and group, SIGTERM, a
+# detached start with relative paths, the reasons a start fails, and a
+# listening socket handed over as a service manager does. Everything lives
+# in a private directory; every process started is ended by its pid.
 set -euo pipefail
 daemon=$1
 tool=$2
@@ -14,6 +15,7 @@ pids=()
 cleanup() {
   local pid
   for pid in "${pids[@]}"; do kill -KILL "$pid" 2>/dev/null || true; done
+  for pid in "${pids[@]}"; do wait "$pid" 2>/dev/null || true; done
   [ -f "$work/d.pid" ] && kill -KILL "$(cat "$work/d.pid")" 2>/dev/null || true
   rm -rf "$work"
 }
@@ -82,4 +84,67 @@ until_ok test -s "$work/d.pid" || fail "no pid file after detaching"
 detached=$(cat "$work/d.pid")
 kill -TERM "$detached"
 until_ok test ! -e "$work/d.pid" || fail "the detached daemon left its pid file"
+
+# A start that fails says why on stderr, with the system's words, whatever
+# the system log does; log lines name no removal that was not tried.
+: >"$work/file"
+python3 -c 'import socket, sys, time
+s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
+print("up", flush=True); time.sleep(20)' "$work/live.sock" >"$work/live.out" &
+pids+=("$!")
+until_ok grep -qs up "$work/live.out" || fail "no live socket"
+while IFS='|' read -r sock reason; do
+  rc=0
+  "$daemon" --foreground --stderr --socket "$sock" --pidfile "$work/f.pid" \
+    >"$work/f.out" 2>"$work/f.err" || rc=$?
+  [ "$rc" -eq 1 ] && grep -qxF "sampled: cannot listen on $sock: $reason" "$work/f.err" ||
+    fail "listening on $sock: exit $rc"
+  ! grep -q '\[Error\] remove' "$work/f.err" || fail "a removal was claimed"
+  [ ! -e "$work/f.pid" ] || fail "the pid file stayed after a failed start"
+done <<EOF_CASES
+$work/file|File exists (not a socket; it was left alone)
+$work/live.sock|Address already in use (another process answers there)
+$work/none/d.sock|No such file or directory
+EOF_CASES
+[ -f "$work/file" ] && [ -S "$work/live.sock" ] || fail "a path was not left alone"
+
+# handed SOCKET PID ARGS...: runs the daemon in the foreground with a
+# listening socket bound at SOCKET as descriptor 3, LISTEN_FDS=1 and
+# LISTEN_PID=PID ("self": its own), as a service manager hands one over.
+handed() {
+  local bound=$1 pid=$2
+  shift 2
+  python3 -c 'import os, socket, sys
+s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(16)
+os.dup2(s.fileno(), 3); os.set_inheritable(3, True)
+pid = str(os.getpid()) if sys.argv[2] == "self" else sys.argv[2]
+os.execve(sys.argv[3], sys.argv[3:],
+          dict(os.environ, LISTEN_PID=pid, LISTEN_FDS="1"))' \
+    "$bound" "$pid" "$daemon" --foreground --pidfile "$work/h.pid" "$@" \
+    >"$work/h.out" 2>"$work/h.err" &
+  pids+=("$!")
+  hpid=$!
+}
+# Served, and the socket file stays the manager's after the daemon stops.
+handed "$work/h.sock" self --socket "$work/h.sock"
+until_ok grep -qs "listening on $work/h.sock" "$work/h.out" || fail "handed: not listening"
+[ "$(send "$work/h.sock" '{}')" = '{"success":true}' ] || fail "handed: no reply"
+kill -TERM "$hpid"
+wait "$hpid" || fail "handed: exit $? after SIGTERM"
+[ -S "$work/h.sock" ] || fail "the handed socket's file was removed"
+# A socket bound elsewhere is refused, with its reason.
+rm -f "$work/h.sock"
+handed "$work/h.sock" self --socket "$work/other.sock"
+rc=0
+wait "$hpid" || rc=$?
+[ "$rc" -eq 1 ] && grep -qF "sampled: cannot serve the socket handed over (fd 3) for $work/other.sock: " "$work/h.err" ||
+  fail "a socket bound elsewhere: exit $rc"
+[ ! -e "$work/other.sock" ] || fail "the daemon bound a socket of its own"
+# Variables meant for another process are not taken: it binds its own.
+rm -f "$work/h.sock"
+handed "$work/h.sock" 1 --socket "$work/own.sock"
+until_ok grep -qs "listening on $work/own.sock" "$work/h.out" || fail "own: not listening"
+kill -TERM "$hpid"
+wait "$hpid" || fail "own: exit $? after SIGTERM"
+[ ! -e "$work/own.sock" ] || fail "its own socket was not removed"
 echo "daemon runner check passed"

@@ -3,15 +3,21 @@
 #include "quvaidx/ea_file.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <functional>
+#include <set>
 #include <string>
 
 #include <gtest/gtest.h>
+
+#include "host_ops.h"
 
 #include "quvaidx/path_rules.h"
 #include "support/fake_host.h"
@@ -23,12 +29,24 @@ namespace {
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
-bool IsLink(const std::string& path) {
+// The kind of entry at `path` (S_IFMT bits of lstat), 0 when there is none.
+mode_t KindAt(const std::string& path) {
   struct stat st;
-  return lstat(path.c_str(), &st) == 0 && S_ISLNK(st.st_mode);
+  return lstat(path.c_str(), &st) == 0 ? st.st_mode & S_IFMT : 0;
+}
+
+// Names in directory `dir`.
+std::set<std::string> Entries(const std::string& dir) {
+  std::set<std::string> names;
+  std::error_code ignored;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ignored)) {
+    names.insert(entry.path().filename());
+  }
+  return names;
 }
 
 // Bad parameters never reach the host; a host failure is logged with the
@@ -105,32 +123,6 @@ TEST_F(RealTree, BothFunctionsCreateTheDirectoriesAndKeepItems) {
   }
 }
 
-// A file in the way is replaced, a link to a file too (its target survives),
-// a link to a directory is kept.
-TEST_F(RealTree, MakeEADirReplacesNonDirectoriesButNothingBeyondThem) {
-  const std::string file = outside_.File("victim");
-  const std::string dir = outside_.File("elsewhere");
-  WriteFile(file, "keep me");
-  mkdir(dir.c_str(), 0755);
-  for (const std::string& link_to : {std::string(), file, dir}) {
-    SCOPED_TRACE(link_to);
-    if (link_to.empty()) {
-      WriteFile(hidden_, "in the way");
-    } else {
-      mkdir(hidden_.c_str(), 0755);
-      ASSERT_EQ(0, symlink(link_to.c_str(), ea_.c_str()));
-    }
-    char buf[4096];
-    ASSERT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
-    EXPECT_EQ(1, IsDirExist(ea_.c_str()));
-    EXPECT_EQ(link_to == dir, IsLink(ea_));
-    EXPECT_EQ(1, IsFileExist(file.c_str(), nullptr)) << "link target lost";
-    unlink(ea_.c_str());
-    rmdir(ea_.c_str());
-    rmdir(hidden_.c_str());
-  }
-}
-
 TEST_F(RealTree, ItemsArePreferredInOrderAndNeedTwoBytesToCount) {
   char buf[4096];
   ASSERT_EQ(0, MakeEADir(media_.c_str(), buf, sizeof(buf)));
@@ -193,6 +185,322 @@ TEST_F(RealTree, OverlongItemPathNeverTouchesTheFileItsCutNames) {
   EXPECT_EQ(1, IsFileExist(victim.c_str(), nullptr));
   EXPECT_STREQ("victim",
                IsEAFileExist(ea_dir.c_str(), nullptr, "victim", nullptr));
+}
+
+// What a user may plant where a directory or an item should be.
+enum class Plant {
+  kNone,
+  kDir,
+  kFile,
+  kLinkToDir,
+  kLinkToFile,
+  kDangling,
+  kFifo
+};
+
+// A photo folder with its metadata directory, EA directory and items x and
+// y planted, and beside it `outside`, where a followed link would lead: the
+// file "victim" and the directory "d" with items x, y, a.jpg/x, a.jpg/y,
+// none of which may be seen, changed or removed.
+class PlantedTree {
+ public:
+  PlantedTree(Plant hidden, Plant ea, Plant x = Plant::kNone,
+              Plant y = Plant::kNone) {
+    mkdir(outside_.File("d").c_str(), 0755);
+    mkdir(outside_.File("d/a.jpg").c_str(), 0755);
+    for (const char* name : kOutsideFiles)
+      WriteFile(outside_.File(name), "root's");
+    PlantAt(hidden_, hidden);
+    PlantAt(ea_, ea);
+    PlantAt(ea_ + "/x", x);
+    PlantAt(ea_ + "/y", y);
+  }
+
+  bool OutsideUntouched() const {
+    std::set<std::string> found;
+    for (const auto& entry :
+         std::filesystem::recursive_directory_iterator(outside_.path())) {
+      found.insert(entry.path().lexically_relative(outside_.path()));
+    }
+    std::set<std::string> expected = {"d", "d/a.jpg"};
+    for (const char* name : kOutsideFiles) {
+      expected.insert(name);
+      if (ReadFile(outside_.File(name)) != "root's") return false;
+    }
+    return found == expected;
+  }
+
+  TempDir dir_, outside_;  // first: the paths below are made from them
+  std::string media_ = dir_.File("a.jpg"), hidden_ = dir_.File(".quvameta"),
+              ea_ = hidden_ + "/a.jpg";
+
+ private:
+  static constexpr const char* kOutsideFiles[] = {"victim", "d/x", "d/y",
+                                                  "d/a.jpg/x", "d/a.jpg/y"};
+
+  void PlantAt(const std::string& path, Plant kind) const {
+    const std::string to = outside_.File(kind == Plant::kLinkToDir    ? "d"
+                                         : kind == Plant::kLinkToFile ? "victim"
+                                                                      : "none");
+    switch (kind) {
+      case Plant::kNone:
+        break;
+      case Plant::kDir:
+        mkdir(path.c_str(), 0755);
+        break;
+      case Plant::kFile:
+        WriteFile(path, "12345");
+        break;
+      case Plant::kFifo:
+        mkfifo(path.c_str(), 0666);
+        break;
+      default:
+        symlink(to.c_str(), path.c_str());
+        break;
+    }
+  }
+};
+
+// The metadata directory (.quvameta) and the EA directory (.quvameta/a.jpg)
+// as a user may plant them.
+struct DirCase {
+  const char* what;
+  Plant hidden, ea;
+  int error_open;    // errno of OpenEADir without create, 0: opened
+  int error_create;  // and with create
+  bool refused;      // a refusal is logged
+};
+
+const DirCase kDirCases[] = {
+    {"nothing", Plant::kNone, Plant::kNone, ENOENT, 0, false},
+    {"both directories", Plant::kDir, Plant::kDir, 0, 0, false},
+    {"metadata dir links elsewhere", Plant::kLinkToDir, Plant::kNone, ELOOP,
+     ELOOP, true},
+    {"EA dir links elsewhere", Plant::kDir, Plant::kLinkToDir, ELOOP, ELOOP,
+     true},
+    {"EA dir links to a file", Plant::kDir, Plant::kLinkToFile, ELOOP, ELOOP,
+     true},
+    {"dangling link at the metadata dir", Plant::kDangling, Plant::kNone, ELOOP,
+     ELOOP, true},
+    {"dangling link at the EA dir", Plant::kDir, Plant::kDangling, ELOOP, ELOOP,
+     true},
+    {"FIFO at the metadata dir", Plant::kFifo, Plant::kNone, ENOTDIR, ENOTDIR,
+     true},
+    {"FIFO at the EA dir", Plant::kDir, Plant::kFifo, ENOTDIR, ENOTDIR, true},
+    {"file at the metadata dir", Plant::kFile, Plant::kNone, ENOTDIR, 0, false},
+    {"file at the EA dir", Plant::kDir, Plant::kFile, ENOTDIR, 0, false},
+};
+
+// Every planted entry, without and with create, from the folder's path and
+// from a descriptor of the folder: a link or special file is refused,
+// logged and left in place, a regular file is replaced only when creating.
+TEST(OpenEADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
+  for (const DirCase& c : kDirCases) {
+    for (int create : {0, 1}) {
+      for (bool by_fd : {false, true}) {
+        SCOPED_TRACE(std::string(c.what) + (create ? ", create" : "") +
+                     (by_fd ? ", folder fd" : ""));
+        PlantedTree tree(c.hidden, c.ea);
+        const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
+        const int folder =
+            by_fd ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
+        quvaidx::test::FdLeakCheck leaks;
+        LogCapture log;
+        errno = 0;
+        const int fd = OpenEADir(tree.media_.c_str(), folder, create);
+        EXPECT_EQ(create ? c.error_create : c.error_open, fd < 0 ? errno : 0);
+        EXPECT_EQ(c.refused ? 1u : 0u, log.lines().size());
+        if (fd >= 0) {
+          struct stat opened, named;
+          ASSERT_EQ(0, fstat(fd, &opened));
+          ASSERT_EQ(0, lstat(tree.ea_.c_str(), &named));
+          EXPECT_TRUE(S_ISDIR(named.st_mode));
+          EXPECT_EQ(named.st_ino, opened.st_ino);
+          EXPECT_EQ(FD_CLOEXEC, fcntl(fd, F_GETFD) & FD_CLOEXEC);
+          close(fd);
+        } else if (c.refused) {
+          EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
+          EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
+        }
+        EXPECT_TRUE(leaks.NoLeak());
+        EXPECT_TRUE(tree.OutsideUntouched());
+        if (folder >= 0) close(folder);
+      }
+    }
+  }
+}
+
+// The walk starts at the descriptor: the folder's path in file_path is not
+// opened then. Made directories take 0777 less the umask.
+TEST(OpenEADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
+  TempDir dir;
+  const int folder = open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+  ASSERT_GE(folder, 0);
+  const mode_t old_umask = umask(027);
+  const int fd = OpenEADir("/no-such-folder/a.jpg", folder, 1);
+  umask(old_umask);
+  ASSERT_GE(fd, 0) << strerror(errno);
+  close(fd);
+  close(folder);
+  for (const char* made : {".quvameta", ".quvameta/a.jpg"}) {
+    struct stat st;
+    ASSERT_EQ(0, lstat(dir.File(made).c_str(), &st));
+    EXPECT_EQ(0750u, st.st_mode & 07777) << made;
+  }
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir("/no-such-folder/a.jpg", -1, 1));
+  EXPECT_EQ(ENOENT, errno);
+}
+
+// What the host answers for every file, set per case.
+const char* g_host_answer = "";
+
+int AnswerHostPath(int, const char*, char* buffer, int size) {
+  snprintf(buffer, static_cast<size_t>(size), "%s", g_host_answer);
+  return 0;
+}
+
+TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
+  TempDir dir, outside;
+  LogCapture log;
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(nullptr, -1, 1));
+  EXPECT_EQ(EINVAL, errno);
+  errno = 0;
+  EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -2, 1));
+  EXPECT_EQ(EINVAL, errno);
+  {
+    FakeHost host;
+    host.Fail(HostOp::kEADirPath, ENAMETOOLONG);
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1));
+    EXPECT_EQ(EINVAL, errno);
+  }
+  const std::string answers[] = {
+      outside.File(".quvameta/a.jpg"),  // another folder
+      dir.File(".quvameta/sub/a.jpg"),  // deeper than two levels
+      dir.File(".quvameta"),            // one level
+      dir.File("../" + std::string(outside.path().substr(5)) + "/a.jpg"),
+  };
+  quvahost::HostOps ops{};
+  ops.EADirPath = AnswerHostPath;
+  const quvahost::HostOps previous = quvahost::SetHostOps(&ops);
+  for (const std::string& answer : answers) {
+    g_host_answer = answer.c_str();
+    errno = 0;
+    EXPECT_EQ(-1, OpenEADir(dir.File("a.jpg").c_str(), -1, 1)) << answer;
+    EXPECT_EQ(EINVAL, errno) << answer;
+  }
+  quvahost::SetHostOps(&previous);
+  EXPECT_TRUE(Entries(dir.path()).empty());
+  EXPECT_TRUE(Entries(outside.path()).empty());
+  EXPECT_EQ(5u, log.lines().size());  // the host failure and four answers
+}
+
+// MakeEADir makes what OpenEADir with create would; GetEADirPath hands the
+// host only what is missing, never a refused link or special file, and
+// logs the refusal and its failure.
+TEST(EADirMakingWalk, PlantedEntriesAreNeverFollowedByEitherMaker) {
+  for (const DirCase& c : kDirCases) {
+    for (bool by_host : {false, true}) {
+      SCOPED_TRACE(std::string(c.what) + (by_host ? ", GetEADirPath" : ""));
+      PlantedTree tree(c.hidden, c.ea);
+      const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
+      LogCapture log;
+      FakeHost host;
+      char buf[4096];
+      const char* media = tree.media_.c_str();
+      const int result = by_host ? GetEADirPath(media, buf, sizeof(buf))
+                                 : MakeEADir(media, buf, sizeof(buf));
+      const bool made = by_host ? c.error_open == 0 || c.error_open == ENOENT
+                                : c.error_create == 0;
+      EXPECT_EQ(made ? 0 : -1, result);
+      EXPECT_EQ(tree.ea_, buf);
+      if (made) {
+        EXPECT_EQ(S_IFDIR, KindAt(tree.ea_));
+      }
+      if (c.refused) {
+        EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
+        EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
+        EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
+        ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
+        const std::string failure =
+            by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
+                    : ", error:" + std::to_string(c.error_create);
+        EXPECT_NE(std::string::npos, log.lines()[1].text.find(failure));
+      }
+      EXPECT_TRUE(tree.OutsideUntouched());
+    }
+  }
+}
+
+// The item functions where the metadata or EA directory, or an item x or y,
+// is planted: a link is neither an item nor removed nor followed.
+TEST(EAItemsWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
+  const struct {
+    const char* what;
+    Plant hidden, ea, x, y;
+    int removed;        // by RemoveEAFile(ea, "x", "y")
+    const char* found;  // by IsEAFileExist(ea, "x", "y")
+  } cases[] = {
+      {"real items", Plant::kDir, Plant::kDir, Plant::kFile, Plant::kFile, 2,
+       "x"},
+      {"metadata dir links elsewhere", Plant::kLinkToDir, Plant::kNone,
+       Plant::kNone, Plant::kNone, 0, nullptr},
+      {"EA dir links elsewhere", Plant::kDir, Plant::kLinkToDir, Plant::kNone,
+       Plant::kNone, 0, nullptr},
+      {"dangling link at the metadata dir", Plant::kDangling, Plant::kNone,
+       Plant::kNone, Plant::kNone, 0, nullptr},
+      {"FIFO at the EA dir", Plant::kDir, Plant::kFifo, Plant::kNone,
+       Plant::kNone, 0, nullptr},
+      {"x links to a file elsewhere", Plant::kDir, Plant::kDir,
+       Plant::kLinkToFile, Plant::kFile, 1, "y"},
+      {"x dangles, y links to a directory", Plant::kDir, Plant::kDir,
+       Plant::kDangling, Plant::kLinkToDir, 0, nullptr},
+  };
+  const struct {
+    const char* name;
+    std::function<int(const char* media, const char* ea)> call;
+    bool counts_removed;  // else: 1 when found, 0 when not
+  } calls[] = {
+      {"RemoveEAFile", [](auto, auto ea) { return RemoveEAFile(ea, "x", "y"); },
+       true},
+      {"RemoveEAFile2", [](auto m, auto) { return RemoveEAFile2(m, "x", "y"); },
+       true},
+      {"IsEAFileExist",
+       [](auto, auto ea) { return !!IsEAFileExist(ea, nullptr, "x", "y"); },
+       false},
+      {"IsEAFileExist2",
+       [](auto m, auto) { return IsEAFileExist2(m, "x", "y"); }, false},
+      {"GetEAFilePath",
+       [](auto m, auto) {
+         char out[4096];
+         return GetEAFilePath(m, "x", "y", out, sizeof(out)) == 0 ? 1 : 0;
+       },
+       false},
+  };
+  for (const auto& c : cases) {
+    for (const auto& fn : calls) {
+      SCOPED_TRACE(std::string(c.what) + ", " + fn.name);
+      PlantedTree tree(c.hidden, c.ea, c.x, c.y);
+      const mode_t x = KindAt(tree.ea_ + "/x");
+      LogCapture log;
+      EXPECT_EQ(fn.counts_removed ? c.removed : c.found != nullptr,
+                fn.call(tree.media_.c_str(), tree.ea_.c_str()));
+      EXPECT_EQ(c.removed < 2, !log.lines().empty());  // refusals logged
+      EXPECT_TRUE(tree.OutsideUntouched());
+      if (S_ISLNK(x)) {
+        EXPECT_EQ(x, KindAt(tree.ea_ + "/x")) << "link removed";
+      }
+    }
+    PlantedTree tree(c.hidden, c.ea, c.x, c.y);
+    const char *x = "x", *y = "y";
+    EXPECT_EQ(c.found == nullptr ? nullptr
+              : *c.found == 'x'  ? x
+                                 : y,
+              IsEAFileExist(tree.ea_.c_str(), nullptr, x, y))
+        << c.what;
+  }
 }
 
 }  // namespace

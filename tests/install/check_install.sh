@@ -4,7 +4,8 @@
 # daemons start, programs built with pkg-config alone and with
 # find_package(quvaidx) (shared and static) run, every part reports the
 # same version, the man pages open, the completion and the systemd units
-# are in place (and verify, where systemd-analyze is available), and
+# are in place (a socket unit for each daemon that listens, at its own
+# path; all verify, where systemd-analyze is available), and
 # uninstall takes everything away again.
 #
 #   check_install.sh BUILD_DIR VERSION
@@ -71,18 +72,28 @@ if [ -d "$prefix/share/man" ]; then
   done
 fi
 test -f "$prefix/share/bash-completion/completions/quvaidx" || fail "no completion"
+units=$prefix/lib/systemd/system
 for name in "${daemons[@]}"; do
-  unit=$prefix/lib/systemd/system/$name.service
+  unit=$units/$name.service
   test -f "$unit" || fail "no unit $unit"
   grep -qx "ExecStart=$prefix/sbin/$name --foreground" "$unit" ||
     fail "$unit does not start $prefix/sbin/$name"
+  # A daemon that listens has its socket bound by the service manager, at
+  # the path the daemon itself would take.
+  socket=$("$prefix/sbin/$name" --help | grep -A1 -- '--socket PATH' |
+    sed -n 's/^ *(default \(\/.*\))$/\1/p' || true)
+  if [ -n "$socket" ]; then
+    grep -qx "ListenStream=$socket" "$units/$name.socket" ||
+      fail "$name has no socket unit for $socket"
+    grep -qx "Requires=$name.socket" "$unit" || fail "$unit does not require its socket"
+  fi
 done
 if command -v systemd-analyze >/dev/null; then
   # The units name their man pages, which a build without docs lacks.
   man_check=()
   [ -d "$prefix/share/man" ] || man_check=(--man=no)
   MANPATH=$prefix/share/man: systemd-analyze verify "${man_check[@]}" \
-    "$prefix"/lib/systemd/system/*.service || fail "a unit does not verify"
+    "$units"/*.service "$units"/*.socket || fail "a unit does not verify"
 fi
 
 # Uninstall leaves no file behind.

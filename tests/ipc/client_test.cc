@@ -1,7 +1,9 @@
 // Client connections against a scripted peer: attempt loops and their log
 // lines, handshake, one-call exchanges, restarts, ownership of descriptors.
+#include <errno.h>
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -17,12 +19,14 @@
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 #include "support/scripted_peer.h"
+#include "support/unprivileged.h"
 
 namespace {
 
 using quvaidx::test::FakeSleep;
 using quvaidx::test::FdLeakCheck;
 using quvaidx::test::ListenUnix;
+using quvaidx::test::ListenUnixAs;
 using quvaidx::test::LogCapture;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -79,10 +83,10 @@ TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
 
 // A daemon whose backlog stays full does not hold the client: each attempt
 // gives up after the connect limit and counts as failed, with its line.
-TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
-  int daemon = ListenUnix(path_, 0);
-  ASSERT_GE(daemon, 0);
-  struct sockaddr_un address = quvaidx::test::UnixAddress(path_);
+// Connects to `path` until its listen backlog is full; returns the
+// connections, which the caller closes.
+std::vector<int> FillBacklog(const std::string& path) {
+  struct sockaddr_un address = quvaidx::test::UnixAddress(path);
   std::vector<int> queued;
   for (int i = 0; i < 8; ++i) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
@@ -93,6 +97,13 @@ TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
     }
     queued.push_back(fd);
   }
+  return queued;
+}
+
+TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
+  int daemon = ListenUnix(path_, 0);
+  ASSERT_GE(daemon, 0);
+  std::vector<int> queued = FillBacklog(path_);
   int previous = quvaidx::SetConnectTimeoutMs(50);
   LogCapture log(7);
   auto start = std::chrono::steady_clock::now();
@@ -111,6 +122,56 @@ TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
   for (int fd : queued) close(fd);
   close(daemon);
   unlink(path_.c_str());
+}
+
+// ConnectDaemon says why it failed, and connects only to root or this
+// process's own user: a stranger who took the path gets nothing.
+TEST_F(ClientTest, ConnectDaemonSaysWhyAndRefusesStrangers) {
+  const std::string stale = dir_.File("stale.sock");
+  close(ListenUnix(stale, 1));
+  quvaidx::test::WriteFile(dir_.File("file"), "");
+  int mine = ListenUnix(dir_.File("mine.sock"), 4);
+  int stranger = ListenUnixAs(dir_.File("stranger.sock"), 4, 65534);
+  int full = ListenUnix(dir_.File("full.sock"), 0);
+  ASSERT_GE(mine, 0);
+  ASSERT_GE(stranger, 0);
+  std::vector<int> queued = FillBacklog(dir_.File("full.sock"));
+  const struct {
+    std::string path;
+    int error;  // 0: connected
+  } kCases[] = {
+      {dir_.File("missing.sock"), ENOENT},
+      {dir_.File("file"), ENOTSOCK},
+      {stale, ECONNREFUSED},
+      {dir_.File("full.sock"), ETIMEDOUT},
+      {"/" + std::string(kMaxSocketPath, 'p'), ENAMETOOLONG},
+      {dir_.File("stranger.sock"), EPERM},
+      {dir_.File("mine.sock"), 0},
+  };
+  LogCapture log;
+  for (const auto& c : kCases) {
+    errno = 0;
+    int fd = ConnectDaemon(c.path.c_str(), 50);
+    const int error = fd >= 0 ? 0 : errno;
+    if (fd >= 0) close(fd);
+    EXPECT_EQ(error, c.error) << c.path;
+  }
+  EXPECT_EQ(log.Count("quvaidx_ipc_core:N [Error] refused " +
+                      dir_.File("stranger.sock") +
+                      ": served by uid 65534 (pid " + std::to_string(getpid()) +
+                      "), neither root nor uid " + std::to_string(geteuid())),
+            1);
+  EXPECT_EQ(log.lines().size(), 1u);
+  // A socket in a folder the caller cannot search: permission denied.
+  ASSERT_EQ(chmod(dir_.path().c_str(), 0700), 0);
+  EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
+              return ConnectDaemon(dir_.File("mine.sock").c_str(), 50) < 0
+                         ? errno
+                         : 0;
+            }),
+            EACCES);
+  for (int fd : queued) close(fd);
+  for (int fd : {mine, stranger, full}) close(fd);
 }
 
 // A daemon listening at the first 107 bytes of an overlong path must not be

@@ -1,6 +1,7 @@
 // A peer learns about a file only when it could read the file itself: the
-// permission-bit check of a daemon that is not root, and the identity a
-// root daemon takes while it opens the file.
+// permission-bit check of a daemon that is not root, the identity a root
+// daemon takes while it opens the file, and the daemon as a real process
+// asked by processes of other users.
 #include "peer_access.h"
 
 #include <sys/fsuid.h>
@@ -13,18 +14,27 @@
 
 #include <gtest/gtest.h>
 
+#ifdef MEDIAPARSERD_PATH
+#include "daemon_process.h"
+#endif
+#include "media_test_util.h"
 #include "peer_file.h"
+#include "quvaidx/ipc.h"
 #include "support/fd_check.h"
+#include "support/unprivileged.h"
 
 namespace mediaparserd {
 namespace {
 
+using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
-// A user and group that no file here belongs to, and that has no entry in
-// the user database (so its groups are its primary group alone).
-constexpr PeerIdentity kStranger = {48211, 48211};
+// Users and groups that no file here belongs to, and that have no entry in
+// the user database: the groups a peer holds are only those it says.
+const PeerIdentity kStranger = {48211, 48211, {48300}};
+const PeerIdentity kOutsider = {48212, 48212, {}};
+constexpr gid_t kSharedGroup = 48300;
 
 struct stat Status(uid_t uid, gid_t gid, mode_t mode) {
   struct stat status = {};
@@ -69,54 +79,96 @@ class PeerFileTest : public ::testing::Test {
     ASSERT_EQ(mkdir(dir_.File("closed").c_str(), 0700), 0);
     Make("open/public", 0644);
     Make("open/private", 0600);
+    Make("open/shared", 0640, 0, kSharedGroup);
     Make("closed/public", 0644);
     Make("open/theirs", 0400, kStranger.uid);
   }
 
-  void Make(const std::string& name, mode_t mode, uid_t owner = 0) {
+  void Make(const std::string& name, mode_t mode, uid_t owner = 0,
+            gid_t group = 0) {
     WriteFile(dir_.File(name), "bytes");
     ASSERT_EQ(chmod(dir_.File(name).c_str(), mode), 0);
-    ASSERT_EQ(chown(dir_.File(name).c_str(), owner, 0), 0);
+    ASSERT_EQ(chown(dir_.File(name).c_str(), owner, group), 0);
   }
 
   TempDir dir_;
 };
 
-// Both ways a daemon checks a peer agree with what the peer may read: the
-// bit check, and an open with the peer's rights after which a root daemon
-// has its own identity back.
+// Both ways a daemon checks a peer agree with what the peer may read, by
+// the groups the peer holds: the bit check, and an open with the peer's
+// rights after which a root daemon has its own identity back.
 TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
-  const std::pair<const char*, bool> cases[] = {
-      // readable by the stranger
-      {"open/public", true},
-      {"open/private", false},
-      {"closed/public", false},  // the folder cannot be searched
-      {"open/theirs", true},     // its owner's, though others may not read
+  struct Case {
+    const char* name;
+    const PeerIdentity* peer;
+    bool readable;
+  } cases[] = {
+      {"open/public", &kStranger, true},    {"open/private", &kStranger, false},
+      {"closed/public", &kStranger, false},  // the folder cannot be searched
+      {"open/theirs", &kStranger, true},  // its owner's, though others may not
+      {"open/shared", &kStranger, true},  // by a group the peer holds
+      {"open/shared", &kOutsider, false},
   };
   int groups_before = getgroups(0, nullptr);
-  for (const auto& [name, readable] : cases) {
+  for (const Case& c : cases) {
+    SCOPED_TRACE(std::string(c.name) + " as " + std::to_string(c.peer->uid));
     std::string checked, opened;
     PeerFile file;
-    EXPECT_EQ(PeerMayRead(dir_.File(name), kStranger, &checked), readable)
-        << name;
-    EXPECT_EQ(OpenPeerFile(dir_.File(name), &file, &opened, &kStranger),
-              readable)
-        << name << ": " << opened;
-    if (!readable) {
-      EXPECT_EQ(checked, "Permission denied") << name;
-      EXPECT_EQ(opened, "Permission denied") << name;
+    EXPECT_EQ(PeerMayRead(dir_.File(c.name), *c.peer, &checked), c.readable);
+    EXPECT_EQ(OpenPeerFile(dir_.File(c.name), &file, &opened, c.peer),
+              c.readable)
+        << opened;
+    if (!c.readable) {
+      EXPECT_EQ(checked, "Permission denied");
+      EXPECT_EQ(opened, "Permission denied");
     }
     EXPECT_EQ(setfsuid(static_cast<uid_t>(-1)), 0);
     EXPECT_EQ(setfsgid(static_cast<gid_t>(-1)), 0);
     EXPECT_EQ(getgroups(0, nullptr), groups_before);
   }
   // A root peer, and one without credentials, are answered as root may.
-  const PeerIdentity root = {0, 0};
+  const PeerIdentity root = {0, 0, {}};
   PeerFile file;
   std::string reason;
   EXPECT_TRUE(OpenPeerFile(dir_.File("closed/public"), &file, &reason, &root));
   EXPECT_TRUE(OpenPeerFile(dir_.File("open/private"), &file, &reason));
 }
+
+#ifdef MEDIAPARSERD_PATH
+// The daemon itself, asked by processes that hold different groups (here
+// of users the group database does not know), answers each by the groups it
+// holds.
+TEST_F(PeerFileTest, DaemonAnswersEachPeerByTheGroupsItHolds) {
+  const std::string photo = dir_.File("open/shared.jpg");
+  WriteFile(photo, ReadFile(mediaparserd::test::Fixture("photo_exif.jpg")));
+  ASSERT_EQ(chown(photo.c_str(), 0, kSharedGroup), 0);
+  ASSERT_EQ(chmod(photo.c_str(), 0640), 0);
+  const std::string socket = dir_.File("mp.sock");
+  quvaidx::daemon_test::DaemonProcess daemon;
+  ASSERT_TRUE(daemon.Start(MEDIAPARSERD_PATH,
+                           {"--foreground", "--socket", socket, "--pidfile",
+                            dir_.File("mp.pid"), "--socket-mode", "0666"},
+                           dir_.path(), "mediaparserd", "listening"))
+      << daemon.Errors();
+  for (const PeerIdentity* peer : {&kStranger, &kOutsider}) {
+    // Exit status: 0 answered, 1 refused, 2 no exchange.
+    int status =
+        quvaidx::test::RunAsUser(peer->uid, peer->gid, peer->groups, [&] {
+          Json::Value request(Json::objectValue);
+          request["command"] = "GET_MEDIA_RESOLUTION";
+          request["path"] = photo;
+          if (AutoSendRecvPacketBySocketPath(socket.c_str(), request, 1) != 0) {
+            return 2;
+          }
+          return request["success"] == true && request["width"] == 640 ? 0
+                 : request["reason"] == "Permission denied"            ? 1
+                                                                       : 3;
+        });
+    EXPECT_EQ(status, peer == &kStranger ? 0 : 1) << daemon.Errors();
+  }
+}
+
+#endif  // MEDIAPARSERD_PATH
 
 }  // namespace
 }  // namespace mediaparserd

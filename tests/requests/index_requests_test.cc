@@ -2,6 +2,8 @@
 // paths: request keys, reply keys read with guards, outputs left untouched
 // on failure, the daemon down, the index daemon's alive check.
 #include <string.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <memory>
 #include <mutex>
@@ -192,6 +194,31 @@ TEST_F(IndexRequestsTest, DaemonDownFailsAfterEveryAttemptWithItsLine) {
     EXPECT_EQ(log.Normalized(),
               std::vector<std::string>{"quvaidx_ipc:N [Error] " + name});
   }
+}
+
+// A user who bound a daemon's fixed path while it was down receives
+// nothing, and the call fails at once instead of trying for half an hour.
+TEST_F(IndexRequestsTest, StrangerOnTheSocketGetsNothing) {
+  int squatter = quvaidx::test::ListenUnixAs(plugin_path_, 4, 65534);
+  ASSERT_GE(squatter, 0);
+  LogCapture log;
+  int map = 7;
+  EXPECT_EQ(QUVAIDX_GetThumbSizeMap("/p.jpg", THUMB_TYPE_PHOTO, &map), -1);
+  EXPECT_EQ(map, 7);
+  EXPECT_EQ(sleep_.calls(), 0);
+  ASSERT_EQ(log.lines().size(), 2u);
+  EXPECT_NE(log.lines()[0].text.find("refused " + plugin_path_ +
+                                     ": served by uid 65534"),
+            std::string::npos)
+      << log.lines()[0].text;
+  EXPECT_EQ(log.Normalized()[1], "quvaidx_ipc:N [Error] GetThumbSizeMap()");
+  // The queued connection was closed before anything was sent.
+  int fd = accept(squatter, nullptr, nullptr);
+  ASSERT_GE(fd, 0);
+  char byte;
+  EXPECT_EQ(read(fd, &byte, 1), 0);
+  close(fd);
+  close(squatter);
 }
 
 TEST_F(IndexRequestsTest, AllPluginNamesOnlyWhileTheIndexDaemonLives) {

@@ -1,7 +1,9 @@
 #include "support/scripted_peer.h"
 
+#include <stdlib.h>
 #include <string.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -15,17 +17,41 @@ struct sockaddr_un UnixAddress(const std::string& path) {
   return address;
 }
 
-int ListenUnix(const std::string& path, int backlog) {
+namespace {
+
+// The thread's effective user id; the raw call leaves other threads alone.
+bool SetThreadEuid(uid_t euid) {
+  return syscall(SYS_setresuid, static_cast<uid_t>(-1), euid,
+                 static_cast<uid_t>(-1)) == 0;
+}
+
+}  // namespace
+
+int ListenUnixAs(const std::string& path, int backlog, unsigned euid) {
   struct sockaddr_un address = UnixAddress(path);
   int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return -1;
-  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) !=
-          0 ||
-      listen(fd, backlog) != 0) {
+  bool listening = false;
+  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) ==
+      0) {
+    // The kernel records the listener's credentials at listen(2).
+    const uid_t own = geteuid();
+    if (euid == own) {
+      listening = listen(fd, backlog) == 0;
+    } else if (SetThreadEuid(euid)) {
+      listening = listen(fd, backlog) == 0;
+      if (!SetThreadEuid(own)) abort();  // the test process must not go on
+    }
+  }
+  if (!listening) {
     close(fd);
     return -1;
   }
   return fd;
+}
+
+int ListenUnix(const std::string& path, int backlog) {
+  return ListenUnixAs(path, backlog, geteuid());
 }
 
 ScriptedPeer::ScriptedPeer(const std::string& path, Script script)

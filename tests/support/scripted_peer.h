@@ -20,6 +20,12 @@ struct sockaddr_un UnixAddress(const std::string& path);
 // on: a live daemon that is busy or stuck. -1 when it cannot be made.
 int ListenUnix(const std::string& path, int backlog);
 
+// As ListenUnix, but the socket listens as effective user `euid`, which is
+// who a client's SO_PEERCRED then reports: a stranger who took a daemon's
+// path. Only the calling thread's identity changes, and only while it
+// listens. REQUIRES: root.
+int ListenUnixAs(const std::string& path, int backlog, unsigned euid);
+
 class ScriptedPeer {
  public:
   // Runs on the peer's thread for connection number `index` (from 0); the

@@ -40,6 +40,17 @@ int RunUnprivileged(const std::function<int()>& check) {
       check);
 }
 
+int RunAsUser(unsigned uid, unsigned gid, const std::vector<unsigned>& groups,
+              const std::function<int()>& check) {
+  return RunInChild(
+      [&] {
+        const std::vector<gid_t> held(groups.begin(), groups.end());
+        return setgroups(held.size(), held.data()) == 0 &&
+               setresgid(gid, gid, gid) == 0 && setresuid(uid, uid, uid) == 0;
+      },
+      check);
+}
+
 int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
                          unsigned seconds) {
   return RunInChild(

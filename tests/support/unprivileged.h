@@ -1,7 +1,8 @@
 // Runs a check in a child process with less than this process may do: as
 // an unprivileged user, so that permission failures happen even when the
-// tests run as root, or with a file-size limit, so that writes fail as on a
-// full disk.
+// tests run as root; with a file-size limit, so that writes fail as on a
+// full disk; or with chosen system calls failing, as on kernels and
+// filesystems without them.
 #ifndef QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 #define QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 
@@ -18,6 +19,13 @@ constexpr unsigned kNobody = 65534;
 // becomes user and group kNobody. Returns the value `check` returned, or -1
 // when the child could not run it.
 int RunUnprivileged(const std::function<int()>& check);
+
+// Runs `check` in a child process that first becomes user `uid` with
+// primary group `gid` and supplementary groups `groups` (real, effective and
+// saved ids alike), which needs root. Returns the value `check` returned, or
+// -1 when the child could not become that user or did not finish.
+int RunAsUser(unsigned uid, unsigned gid, const std::vector<unsigned>& groups,
+              const std::function<int()>& check);
 
 // Runs `check` in a child process whose files cannot grow beyond `bytes`
 // (RLIMIT_FSIZE, with SIGXFSZ ignored): a write that crosses the limit

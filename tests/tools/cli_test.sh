@@ -70,24 +70,44 @@ expect() {
   [ "$RC" -eq "$1" ] || fail "exit status $RC, expected $1"
   [ $# -lt 2 ] || [ "$OUT" = "$2" ] || fail "stdout '$OUT', expected '$2'"
 }
-# ok [STDOUT]: success with nothing on stderr.
-ok() {
-  expect 0 "$@"
-  [ -z "$ERR" ] || fail "stderr '$ERR'"
-}
 # expect_error TEXT [RC]: nothing on stdout, one stderr line starting with
-# TEXT, exit status RC (2).
+# TEXT (and the hint to ask for --help after a usage error), exit status RC
+# (2).
 expect_error() {
+  local line=${ERR%$'\n'Try \'quvaidx*\'.}
   expect "${2:-2}" ""
-  [[ $ERR != *$'\n'* && $ERR == "$1"* ]] ||
+  [[ $line != *$'\n'* && $line == "$1"* ]] ||
     fail "stderr '$ERR', expected one line starting with '$1'"
 }
-# has out|err TEXT: the last run printed TEXT there.
-has() { grep -qF -- "$2" "$WORK/$1" || fail "$1 lacks '$2'"; }
+# t RC TEXT ARGS...: one row of a table: runs the tool with ARGS; with RC 0
+# it must print TEXT ("*": anything) and nothing on stderr, otherwise
+# nothing on stdout and one stderr line starting with TEXT.
+t() {
+  local rc=$1 text=$2
+  shift 2
+  run "$@"
+  if [ "$rc" -ne 0 ]; then expect_error "$text" "$rc"; return; fi
+  expect 0
+  [ "$text" = "*" ] || [ "$OUT" = "$text" ] || fail "stdout '$OUT', expected '$text'"
+  [ -z "$ERR" ] || fail "stderr '$ERR'"
+}
+# has out|err TEXT...: the last run printed each TEXT there.
+has() {
+  local where=$1 text
+  shift
+  for text; do grep -qF -- "$text" "$WORK/$where" || fail "$where lacks '$text'"; done
+}
 # expect_file FILE TEXT: FILE holds exactly TEXT (a printf format).
 expect_file() {
   printf -- "$2" >"$WORK/expected"
   cmp -s "$1" "$WORK/expected" || fail "$1 holds '$(cat "$1")'"
+}
+# expect_entries QUEUE TEXT: the queue's lines, less the empty lines that
+# finished entries become, are TEXT.
+expect_entries() {
+  printf -- "$2" >"$WORK/expected"
+  sed '/^$/d' "$1" | cmp -s - "$WORK/expected" ||
+    fail "$1 holds the entries '$(sed '/^$/d' "$1")'"
 }
 # json EXPR [ARGS...]: the Python expression EXPR holds, with d the JSON on
 # stdout and A the ARGS; flat(v) lists the whole numbers in v as "path=N".
@@ -122,6 +142,21 @@ start() {
   until_ok grep -qsF "$line" "$WORK/$name.out" ||
     fail "$name did not print '$line': $(cat "$WORK/$name.err")"
 }
+# peer NAME SOCKET [USER]: a process that listens on SOCKET (mode 0666),
+# accepts every connection and never answers, printing "received" when a
+# request arrives; run as USER (default: this one) for 20 s at most.
+peer() {
+  local as=()
+  [ -z "${3:-}" ] || as=(setpriv "--reuid=$3" "--regid=$3" --clear-groups)
+  start "$1" up "${as[@]}" /usr/bin/python3 -c 'import os, select, socket, sys, time
+os.umask(0); s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(16)
+print("up", flush=True); conns = [s]; end = time.time() + 20
+while time.time() < end:
+    for c in select.select(conns, [], [], 0.5)[0]:
+        if c is s: conns.append(s.accept()[0])
+        elif c.recv(65536): print("received", flush=True)
+        else: conns.remove(c); c.close()' "$2"
+}
 # serve SOCKET [OPTIONS...]: starts `quvaidx serve`.
 serve() {
   start serve "quvaidx serve: listening on $1" "$TOOL" serve --socket "$@"
@@ -146,12 +181,10 @@ case_serve_send() {
     fail "stderr '$ERR'"
   serve "$sock" --verbose
   # With --handshake the daemon sees two requests: the handshake and ours.
-  run send --socket "$sock" --handshake --compact '{"command":"HANDSHAKE"}'
-  ok '{"success":true}'
-  run send -s "$sock" -c '{"command":"ECHO","n":[1,2],"s":"x"}'
-  ok '{"echo":{"command":"ECHO","n":[1,2],"s":"x"},"success":true}'
-  run send -s "$sock" '{"command":"ECHO"}' # indented without --compact
-  ok
+  t 0 '{"success":true}' send --socket "$sock" --handshake --compact '{"command":"HANDSHAKE"}'
+  t 0 '{"echo":{"command":"ECHO","n":[1,2],"s":"x"},"success":true}' \
+    send -s "$sock" -c '{"command":"ECHO","n":[1,2],"s":"x"}'
+  t 0 '*' send -s "$sock" '{"command":"ECHO"}' # indented without --compact
   [ "$(wc -l <"$WORK/out")" -gt 3 ] || fail "reply not indented"
   # A request the daemon refuses: exit status 1, its reply on stdout.
   run send -s "$sock" -c '{"command":"NOPE"}'
@@ -159,63 +192,83 @@ case_serve_send() {
   # Requests refused before sending.
   for request in '{"command":' '{} x' '' '{"a":1,}' '{"a":1,"a":2}' \
     '{"a":1} // c' "$(printf '%*s' 5000 '' | tr ' ' '[')"; do
-    run send -s "$sock" "$request"; expect_error "quvaidx send: invalid JSON request: "
+    t 2 "quvaidx send: invalid JSON request: " send -s "$sock" "$request"
   done
-  run send -s "$sock" '[1]'
-  expect_error "quvaidx send: the request must be a JSON object"
-  run send -s "$sock" "{\"command\":\"ECHO\",\"big\":\"$(printf '%*s' 20000 '' | tr ' ' x)\"}"
-  expect_error "quvaidx send: the request is 20028 bytes long; a packet carries at most 16380"
+  t 2 "quvaidx send: the request must be a JSON object" send -s "$sock" '[1]'
+  t 2 "quvaidx send: the request is 20028 bytes long; a packet carries at most 16380" \
+    send -s "$sock" "{\"command\":\"ECHO\",\"big\":\"$(printf '%*s' 20000 '' | tr ' ' x)\"}"
   # The request from standard input ("-" or none); the reply in raw UTF-8
   # with numbers in their shortest exact form.
-  run send -s "$sock" -c <<<'{"command":"ECHO","s":"h\u00e9llo","x":0.1}'
-  ok '{"echo":{"command":"ECHO","s":"héllo","x":0.1},"success":true}'
+  t 0 '{"echo":{"command":"ECHO","s":"héllo","x":0.1},"success":true}' \
+    send -s "$sock" -c - <<<'{"command":"ECHO","s":"h\u00e9llo","x":0.1}'
   # Earlier clients have closed, and the refused requests never arrived.
-  run send -s "$sock" -c '{"command":"STATS"}'
-  ok '{"connections":1,"requests":7,"success":true}'
+  t 0 '{"connections":1,"requests":7,"success":true}' send -s "$sock" -c '{"command":"STATS"}'
   # A second daemon is refused on a live socket and on a regular file.
-  run serve -s "$sock"
-  expect_error "quvaidx serve: a daemon is already listening on $sock"
   echo keep >"$WORK/file"
-  run serve -s "$WORK/file"
-  expect_error "quvaidx serve: $WORK/file exists and is not a socket"
+  t 2 "quvaidx serve: a daemon is already listening on $sock" serve -s "$sock"
+  t 2 "quvaidx serve: $WORK/file exists and is not a socket" serve -s "$WORK/file"
+  t 2 "quvaidx serve: cannot listen on $WORK/none/d.sock: No such file or directory" \
+    serve -s "$WORK/none/d.sock"
   [ "$(cat "$WORK/file")" = keep ] || fail "the file was changed"
-  run send -s "$sock" -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
   stop TERM "$sock"
   # --verbose: the library's debug lines reach stderr.
   grep -qF "[quvaidx-serve] BEV_EVENT_EOF" "$WORK/serve.err" ||
     fail "no library log line on the daemon's stderr"
 }
 
-case_lifecycle() {
-  # A socket path of 107 bytes works end to end; 108 is refused.
-  local sock
-  sock=$WORK/$(printf '%*s' $((106 - ${#WORK})) '' | tr ' ' p)
-  run send -s "${sock}q" '{}'
-  expect_error "quvaidx send: socket path is 108 bytes long; a Unix-domain socket path holds at most 107"
-  run serve -s "${sock}q"; expect_error "quvaidx serve: socket path is 108 bytes long"
+# Every command that waits for a daemon says why it got no answer, names
+# the daemon and its socket, and waits no longer than --timeout.
+case_connect() {
+  local sock long command started reason
+  sock=$WORK/$(printf '%*s' $((106 - ${#WORK})) '' | tr ' ' p) # 107 bytes
+  t 2 "quvaidx send: socket path is 108 bytes long; a Unix-domain socket path holds at most 107" \
+    send -s "${sock}q" '{}'
+  t 2 "quvaidx serve: socket path is 108 bytes long" serve -s "${sock}q"
   [ ! -e "${sock}q" ] || fail "a socket file was created"
-  # A daemon killed outright leaves its socket, where no one answers.
+  # A daemon killed outright leaves its socket, where nobody answers; a
+  # new one replaces it, works on a path of 107 bytes, and stops on SIGINT.
   serve "$sock"
   kill -KILL "$BG"
   wait "$BG" 2>/dev/null || true
   [ -S "$sock" ] || fail "the killed daemon's socket is gone"
-  run send -s "$sock" --attempts 1 '{"command":"HANDSHAKE"}'
-  expect_error "quvaidx send: no daemon answered on $sock after 1 attempt: connection refused"
-  # Each failure names its reason, and no attempt is followed by a wait.
-  run send -s "$WORK/none" --attempts 1 '{}'
-  expect_error "quvaidx send: no daemon answered on $WORK/none after 1 attempt: no such socket"
+  ln -s "$sock" "$WORK/stale.sock"
   : >"$WORK/plain"
-  run send -s "$WORK/plain" --attempts 2 '{}'
-  expect_error "quvaidx send: no daemon answered on $WORK/plain after 2 attempts: not a socket"
-  # A daemon that accepts and never answers: --timeout bounds the wait.
-  start mute mute python3 -c 'import socket, sys, time
-s = socket.socket(socket.AF_UNIX); s.bind(sys.argv[1]); s.listen(1)
-print("mute", flush=True); c = s.accept(); time.sleep(10)' "$WORK/mute.sock"
-  run send -s "$WORK/mute.sock" --timeout 0.2 '{}'
-  expect_error "quvaidx send: the daemon on $WORK/mute.sock sent no reply within 0.2 s"
-  # A new daemon replaces the stale socket; SIGINT stops it cleanly.
+  chmod 755 "$WORK"
+  mkdir -m 777 "$WORK/public"
+  peer mute "$WORK/mute.sock"
+  peer squatter "$WORK/public/squat.sock" 65534
+  for command in send mediainfo resolution sizemap; do
+    local args=(--attempts 3 --timeout 0.3 "$WORK") daemon=quvamediaparserd
+    [ "$command" = send ] && args[4]='{}' daemon="the daemon"
+    [ "$command" = sizemap ] && daemon=quvaindexplugind
+    while IFS='|' read -r path reason; do
+      started=$(date +%s%N)
+      run "$command" --socket "$path" "${args[@]}"
+      expect_error "quvaidx $command: $reason" 2
+      (( ($(date +%s%N) - started) / 1000000 < 900 )) || fail "$command waited too long"
+    done <<EOF
+$WORK/none|cannot reach $daemon on $WORK/none: no such socket (1 attempt)
+$WORK/plain|cannot reach $daemon on $WORK/plain: not a socket (1 attempt)
+$WORK/stale.sock|cannot reach $daemon on $WORK/stale.sock: connection refused (nobody listens there) (1 attempt)
+$WORK/public/squat.sock|cannot reach $daemon on $WORK/public/squat.sock: answered by user nobody, not root or you; nothing was sent (1 attempt)
+$WORK/mute.sock|$daemon on $WORK/mute.sock sent no reply to the request within 0.3 s
+EOF
+  done
+  ! grep -q received "$WORK/squatter.out" || fail "the squatter was sent a request"
+  # Attempts are a second apart while the time limit allows another.
+  started=$(date +%s%N)
+  t 2 "quvaidx send: cannot reach the daemon on $WORK/none: no such socket (2 attempts)" \
+    send --socket "$WORK/none" --attempts 2 '{}'
+  (( ($(date +%s%N) - started) / 1000000 >= 1000 )) || fail "attempts without a wait"
+  # A new daemon replaces the stale socket; as another user, permission
+  # to root's own socket is denied.
   serve "$sock"
-  run send -s "$sock" -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
+  chmod 600 "$sock"
+  as_nobody
+  t 2 "quvaidx send: cannot reach the daemon on $sock: permission denied (1 attempt)" \
+    send -s "$sock" '{}'
+  as_self
+  t 0 '{"success":true}' send -s "$sock" -c '{"command":"HANDSHAKE"}'
   stop INT "$sock"
   [ ! -s "$WORK/serve.err" ] || fail "serve wrote to stderr"
 }
@@ -230,78 +283,79 @@ mediad    no     -    /var/run/quvamediaparserd.pid  /usr/quva/sbin/quvamediapar
 UNKNOWN="unknown daemon 'nosuchd'; known daemons: controld, scand, workerd, plugind, mediad"
 
 case_daemons() {
-  run daemons; ok
+  t 0 "*" daemons
   # Nothing runs the index daemons on a test machine; a live one's row
   # would show its pid.
-  if [ -z "$(ls /var/run/quvaindex*.pid /var/run/quvamediaparserd.pid 2>/dev/null)" ]; then
-    [ "$OUT" = "$DAEMONS" ] || fail "not the daemon table"
-  fi
-  run daemons --json; ok
+  local none_alive=""
+  [ -n "$(ls /var/run/quvaindex*.pid /var/run/quvamediaparserd.pid 2>/dev/null)" ] ||
+    none_alive=yes
+  [ -z "$none_alive" ] || [ "$OUT" = "$DAEMONS" ] || fail "not the daemon table"
+  t 0 "*" daemons --json
   json '[[e["name"], e["pid_file"], e["executable"], e["socket"]] for e in d]
     == [[r[0]] + r[3:] for r in map(str.split, A[0].splitlines()[1:])]
     and all(e["alive"] is False and e["pid"] is None for e in d
     if not os.path.exists(e["pid_file"]))' "$DAEMONS"
-  run daemons mediad scand; ok
+  # Asked by name, as `systemctl is-active`: 3 when one is not alive.
+  run daemons mediad scand
+  [ -z "$none_alive" ] || expect 3
   [ "$(awk 'NR > 1 { print $1 }' "$WORK/out" | tr '\n' ' ')" = "mediad scand " ] ||
     fail "not the rows asked for, in their order"
-  run daemons nosuchd; expect_error "quvaidx daemons: $UNKNOWN"
-  run send --daemon nosuchd '{"command":"HANDSHAKE"}'
-  expect_error "quvaidx send: $UNKNOWN"
-  # A known name resolves to the directory's socket (one attempt: 1 s).
+  t 2 "quvaidx daemons: $UNKNOWN" daemons nosuchd
+  t 2 "quvaidx send: $UNKNOWN" send --daemon nosuchd '{"command":"HANDSHAKE"}'
+  # A known name resolves to the directory's socket.
   if [ ! -e /tmp/quvaindexd_sock ]; then
-    run send --daemon controld --attempts 1 '{"command":"HANDSHAKE"}'
-    expect_error "quvaidx send: no daemon answered on /tmp/quvaindexd_sock after 1 attempt"
+    t 2 "quvaidx send: cannot reach quvaindexd on /tmp/quvaindexd_sock: no such socket" \
+      send --daemon controld --attempts 1 '{"command":"HANDSHAKE"}'
   fi
 }
 
 # new_queue KEYFILE PROJECT: creates the key file and a queue deleted on exit.
 new_queue() {
   : >"$1"
-  run taskq create "$1" "$2"; ok
+  t 0 "*" taskq create "$1" "$2"
   [[ $OUT =~ ^[0-9]+$ ]] || fail "create printed '$OUT', not an identifier"
   QUEUES+=("$1 $2 $OUT")
 }
 
 case_taskq() {
   local key=$WORK/q.key big pid started
-  run taskq create "$WORK/none.key" 7
-  expect_error "quvaidx taskq: key file $WORK/none.key: No such file or directory"
+  t 2 "quvaidx taskq: key file $WORK/none.key: No such file or directory" \
+    taskq create "$WORK/none.key" 7
   new_queue "$key" 7
-  run taskq push "$key" 7 '{"n":1}'; ok ""
-  run taskq push "$key" 7 --type 2 '{"s":"two","n":2}'; ok ""
-  run taskq count "$key" 7; ok 2
-  run taskq pop "$key" 7 --type 2; ok '{"n":2,"s":"two"}' # though pushed last
-  run taskq pop "$key" 7; ok '{"n":1}'
-  run taskq push "$key" 7 '{"a":1'; expect_error "quvaidx taskq: invalid JSON task: "
+  t 0 "" taskq push "$key" 7 '{"n":1}'
+  t 0 "" taskq push "$key" 7 --type 2 - <<<'{"s":"two","n":2}'
+  t 0 2 taskq count "$key" 7
+  t 0 '{"n":2,"s":"two"}' taskq pop "$key" 7 --type 2 # though pushed last
+  t 0 '{"n":1}' taskq pop "$key" 7
+  t 2 "quvaidx taskq: invalid JSON task: " taskq push "$key" 7 '{"a":1'
+  t 2 "quvaidx taskq: --size does not apply to push" taskq push "$key" 7 --size 4 '{}'
   # The largest task a queue carries: 8191 bytes with its line end.
   big=$(printf '%*s' 8182 '' | tr ' ' x)
-  run taskq push "$key" 7 "{\"a\":\"${big}y\"}"
-  expect_error "quvaidx taskq: the task is 8192 bytes long; a queue carries at most 8191"
-  run taskq push "$key" 7 "{\"a\":\"$big\"}"; ok
-  run taskq pop "$key" 7 --nowait; ok "{\"a\":\"$big\"}"
+  t 2 "quvaidx taskq: the task is 8192 bytes long; a queue carries at most 8191" \
+    taskq push "$key" 7 "{\"a\":\"${big}y\"}"
+  t 0 "" taskq push "$key" 7 "{\"a\":\"$big\"}"
+  t 0 "{\"a\":\"$big\"}" taskq pop "$key" 7 --nowait
   # A blocking pop waits for the next push.
   timeout 5 "$TOOL" taskq pop "$key" 7 >"$WORK/wait.out" 2>&1 &
   pid=$!
   PIDS+=("$pid")
   sleep 0.2
   kill -0 "$pid" 2>/dev/null || fail "the blocking pop did not wait"
-  run taskq push "$key" 7 --type 5 '{"late":true}'; ok
+  t 0 "" taskq push "$key" 7 --type 5 '{"late":true}'
   wait "$pid" && [ "$(cat "$WORK/wait.out")" = '{"late":true}' ] ||
     fail "the blocking pop: $(cat "$WORK/wait.out")"
   # Empty: the tool does not wait after its last attempt.
   started=$(date +%s%N)
-  run taskq pop "$key" 7 --nowait --attempts 1
-  expect_error "quvaidx taskq: no task of type 0 after 1 attempt" 1
+  t 1 "quvaidx taskq: no task of type 0 after 1 attempt" taskq pop "$key" 7 -n -a 1
   (( ($(date +%s%N) - started) / 1000000 < 800 )) ||
     fail "an empty --nowait pop waited after its last attempt"
   # create discards what the queue held; delete removes it.
-  run taskq push "$key" 7 '{"old":1}'; ok
+  t 0 "" taskq push "$key" 7 '{"old":1}'
   new_queue "$key" 7
-  run taskq count "$key" 7; ok 0
-  run taskq delete "$key" 7; ok ""
-  run taskq pop "$key" 7 --nowait
-  expect_error "quvaidx taskq: no queue for key file $key, project 7"
-  run taskq delete "$key" 7; ok ""
+  t 0 0 taskq count "$key" 7
+  t 0 "" taskq delete "$key" 7
+  t 2 "quvaidx taskq: no queue for key file $key, project 7" taskq pop "$key" 7 --nowait
+  t 0 "" taskq delete "$key" 7
 }
 
 case_serve_pidfile() {
@@ -318,17 +372,17 @@ case_serve_pidfile() {
   done
   stop TERM "$pid_file" "$sock"
   # --daemon: what the detached process could not report is found first.
-  run serve --daemon --pidfile "$WORK/none/d.pid" --socket "$sock"
-  expect_error "quvaidx serve: cannot create the pid file $WORK/none/d.pid: $WORK/none: No such file or directory"
-  run serve --daemon --pidfile "$pid_file" --socket "$WORK/none/d.sock"
-  expect_error "quvaidx serve: cannot create the socket $WORK/none/d.sock: $WORK/none: No such file or directory"
+  t 2 "quvaidx serve: cannot create the pid file $WORK/none/d.pid: $WORK/none: No such file or directory" \
+    serve --daemon --pidfile "$WORK/none/d.pid" --socket "$sock"
+  t 2 "quvaidx serve: cannot create the socket $WORK/none/d.sock: $WORK/none: No such file or directory" \
+    serve --daemon --pidfile "$pid_file" --socket "$WORK/none/d.sock"
   # Relative paths hold, though the detached daemon works in "/".
   cd "$WORK"
-  run serve --daemon --pidfile d.pid --socket d.sock; ok ""
+  t 0 "" serve --daemon --pidfile d.pid --socket d.sock
   until_ok test -s d.pid -a -S d.sock || fail "no pid file or socket"
   pid=$(cat d.pid)
   PIDS+=("$pid")
-  run send -s d.sock -c '{"command":"HANDSHAKE"}'; ok '{"success":true}'
+  t 0 '{"success":true}' send -s d.sock -c '{"command":"HANDSHAKE"}'
   kill -TERM "$pid"
   until_ok gone "$pid" || fail "the daemon ignored SIGTERM"
   [ ! -e d.pid ] && [ ! -e d.sock ] || fail "pid file or socket left behind"
@@ -380,23 +434,23 @@ case_scan() {
   make_tree "$WORK/tree"
   root=$(cd -P "$WORK/tree" && pwd)
   mapfile -t list < <(tree_list "$root")
-  run scan --json "$WORK/tree"; ok
+  t 0 '*' scan --json "$WORK/tree"
   expect_counts "$TREE_COUNTS"
   json 'd["roots"] == A and "files" not in d and d["elapsed_seconds"] >= 0' "$root"
-  # With --list, the list goes to stdout and the summary to stderr.
-  run scan --list "$WORK/tree"; expect 0
+  # With --list, the list goes to stdout and the summary to stderr; the
+  # DIRs may come from standard input.
+  run scan --list - <<<"$WORK/tree"; expect 0
   [ "$(LC_ALL=C sort "$WORK/out")" = "$(tree_list "$root")" ] || fail "list"
-  has err "Scanned 7 folders and 17 files in "
-  has err "  photo            7   6 need thumbnails, in 4 folders; 5 converted for the web"
-  has err "Skipped 9 entries:"
-  has err "  symbolic links (never followed)                 2"
-  run scan --json --list "$WORK/tree"; ok
+  has err "Scanned 7 folders and 17 files in " "Skipped 9 entries:" \
+    "  photo            7   6 need thumbnails, in 4 folders; 5 converted for the web" \
+    "  symbolic links (never followed)                 2"
+  t 0 '*' scan --json --list "$WORK/tree"
   expect_counts "$TREE_COUNTS"
   json 'sorted(f["table"] + "\t" + f["path"] for f in d["files"]) == A' "${list[@]}"
   # Every DIR is checked before anything is scanned.
   run scan --json "$WORK/tree" "$WORK/none" "$WORK/tree/notes.txt"; expect 2 ""
-  [ "$ERR" = "quvaidx scan: cannot scan $WORK/none: No such file or directory
-quvaidx scan: cannot scan $WORK/tree/notes.txt: not a folder" ] || fail "stderr"
+  [ "$ERR" = "quvaidx scan: $WORK/none: No such file or directory
+quvaidx scan: $WORK/tree/notes.txt: not a folder" ] || fail "stderr"
   # Tabs, line feeds and backslashes in names are escaped in the list.
   mkdir "$WORK/odd"
   odd=$(cd -P "$WORK/odd" && pwd)
@@ -404,12 +458,6 @@ quvaidx scan: cannot scan $WORK/tree/notes.txt: not a folder" ] || fail "stderr"
   run scan --list "$WORK/odd"; expect 0
   [ "$(LC_ALL=C sort "$WORK/out")" = "$(printf '%s\n' "music	$odd/tab\\tname.mp3" \
     "photo	$odd/back\\\\slash.png" "photo	$odd/new\\nline.jpg")" ] || fail "escapes"
-  if [ ! -e /var/run/quvamkthumbd.pid ]; then # no thumbnail daemon here
-    run scan --queue-thumbs --json "$WORK/tree"; expect 1
-    [[ $ERR == "quvaidx scan: cannot queue /"*" for thumbnails: the thumbnail daemon is not running"* &&
-      $ERR != *$'\n'* ]] || fail "stderr '$ERR'"
-    json 'd["thumbnails"] == {"photos": 6, "folders": 4, "queued": 0, "not_queued": 4}'
-  fi
   # An unreadable folder: reported, and the rest is scanned. Root reads any
   # folder, so it scans as nobody, who needs a way into $WORK.
   mkdir -p "$WORK/tree/locked/inner"
@@ -419,47 +467,97 @@ quvaidx scan: cannot scan $WORK/tree/notes.txt: not a folder" ] || fail "stderr"
   run scan --json "$WORK/tree"
   as_self
   chmod 755 "$WORK/tree/locked"
-  expect 1
   [ "$ERR" = "quvaidx scan: cannot read $root/locked: Permission denied" ] ||
     fail "stderr '$ERR'"
+  expect 1
   expect_counts "${TREE_COUNTS/unreadable_folders=0/unreadable_folders=1}"
+}
+
+# preview_daemon: a stand-in for the preview daemon of pid file
+# $WORK/previewd.pid, which appends "woke" to $WORK/woke on SIGUSR1.
+preview_daemon() {
+  start previewd up python3 -c 'import signal, sys, time
+signal.signal(signal.SIGUSR1, lambda *a: open(sys.argv[1], "a").write("woke\n"))
+print("up", flush=True); time.sleep(20)' "$WORK/woke"
+  echo "$BG" >"$WORK/previewd.pid"
+  PREVIEW=(--queue "$WORK/q" --pidfile "$WORK/previewd.pid")
+}
+
+# Folders outside every share, names the queue cannot carry and files of no
+# interest are refused, each with its reason, and never stop the others.
+case_thumb() {
+  local share out real
+  mkdir -p "$WORK/share/a" "$WORK/share/"$'new\nline' "$WORK/outside" "$QUVA_HOST_ETC"
+  share=$(cd -P "$WORK/share" && pwd)
+  out=$(cd -P "$WORK/outside" && pwd)
+  printf '[photos]\npath = %s\n' "$share" >"$QUVA_HOST_ETC/shares.conf"
+  touch "$share/a/x.jpg" "$share/a/song.mp3" "$share/"$'new\nline/y.jpg' \
+    "$share/clip.mp4" "$out/z.jpg"
+  mkfifo "$share/fifo"
+  # Without a running daemon nothing is queued.
+  t 2 "quvaidx thumb: the thumbnail daemon (quvamkthumbd) is not running: $WORK/none.pid names no live process; nothing was queued" \
+    thumb --queue "$WORK/q" --pidfile "$WORK/none.pid" "$share"
+  t 2 "quvaidx scan: the thumbnail daemon (quvamkthumbd) is not running" \
+    scan --queue-thumbs --queue "$WORK/q" --pidfile "$WORK/none.pid" "$share"
+  [ ! -e "$WORK/q" ] || fail "a queue was written"
+  preview_daemon
+  # Each path: what was queued, or why not.
+  run thumb "${PREVIEW[@]}" -0 - < <(printf '%s\0' "$share/a/x.jpg" "$share" \
+    "$share/a/song.mp3" "$out/z.jpg" "$share/"$'new\nline/y.jpg' "$share/fifo" "$WORK/none")
+  expect 1 "queued $share/a (the folder of x.jpg) for quvamkthumbd
+queued $share for quvamkthumbd"
+  [ "$ERR" = "quvaidx thumb: not queued: $share/a/song.mp3: not a web photo
+quvaidx thumb: not queued: $out/z.jpg: $out is outside every share
+quvaidx thumb: not queued: $share/"$'new\nline/y.jpg'": the name holds a line feed, which a queue line cannot carry
+quvaidx thumb: not queued: $share/fifo: neither a directory nor a regular file
+quvaidx thumb: $WORK/none: No such file or directory" ] || fail "stderr '$ERR'"
+  expect_file "$WORK/q" "$share/a\n$share\n"
+  until_ok grep -qx woke "$WORK/woke" || fail "the daemon was not woken"
+  [ "$(wc -l <"$WORK/woke")" -eq 1 ] || fail "woken more than once"
+  t 1 "quvaidx thumb: not queued: $share/a/song.mp3: not a web photo" \
+    thumb "${PREVIEW[@]}" "$share/a/song.mp3"
+  t 0 "queued $share/clip.mp4 for quvamkflvd" thumb --video "${PREVIEW[@]}" "$share/clip.mp4"
+  # scan --queue-thumbs: the refused folders are reported; the others queued.
+  rm "$WORK/q"
+  run scan --queue-thumbs --json "${PREVIEW[@]}" "$WORK/share" "$WORK/outside"
+  expect 1
+  json 'd["thumbnails"] == {"photos": 3, "folders": 3, "queued": 1, "not_queued": 2}'
+  [ "$ERR" = "quvaidx scan: not queued: $share/new\\nline: the name holds a line feed, which a queue line cannot carry
+quvaidx scan: not queued: $out: outside every share" ] || fail "stderr '$ERR'"
+  expect_file "$WORK/q" "$share/a\n"
 }
 
 case_spool() {
   local q=$WORK/q.queue long trim_pid add_pid
   long=/$(printf '%*s' 4094 '' | tr ' ' x)
-  run spool add "$q" /share/a; ok ""
-  run spool add "$q" /share/a /share/b /share/b # each entry queued once
-  ok ""
+  t 0 "" spool add "$q" /share/a
+  t 0 "" spool add "$q" /share/a /share/b /share/b # each entry queued once
   # One refused entry anywhere and nothing is added.
-  run spool add "$q" /share/c $'/share/x\n/share/y'
-  expect_error "quvaidx spool: an entry must not hold a line feed (entry 2); nothing was added"
-  run spool add "$q" /share/c ''
-  expect_error "quvaidx spool: an empty entry cannot be queued (entry 2)"
-  run spool add "$q" "${long}y"
-  expect_error "quvaidx spool: an entry is 4096 bytes long; a queue line holds at most 4095"
+  t 2 "quvaidx spool: an entry must not hold a line feed (entry 2); nothing was added" \
+    spool add "$q" /share/c $'/share/x\n/share/y'
+  t 2 "quvaidx spool: an empty entry cannot be queued (entry 2)" spool add "$q" /share/c ''
+  t 2 "quvaidx spool: an entry is 4096 bytes long; a queue line holds at most 4095" \
+    spool add "$q" "${long}y"
   expect_file "$q" '/share/a\n/share/b\n'
-  run spool add "$q" "$long" # the longest entry fits
-  ok
-  run spool add -- "$q" -dash; ok
-  expect_file "$q" "/share/a\n/share/b\n$long\n-dash\n"
-  run spool add "$WORK" /share/a
-  expect_error "quvaidx spool: $WORK is not a regular file"
-  # trim drops the first N lines in place and keeps the mode; a last line
-  # without a line feed stays as it is.
+  t 0 "" spool add "$q" "$long" # the longest entry fits
+  t 0 "" spool add -- "$q" -dash
+  t 0 "" spool add "$q" - < <(printf '/in/1\n\n/in/2\n')
+  expect_file "$q" "/share/a\n/share/b\n$long\n-dash\n/in/1\n/in/2\n"
+  t 2 "quvaidx spool: $WORK is not a regular file" spool add "$WORK" /share/a
+  # trim drops the first N entries in place (they become empty lines) and
+  # keeps the mode; a last line without a line feed stays as it is.
   printf '/a\n/b\n/c\n/d\n/e' >"$q"
   chmod 640 "$q"
-  run spool trim "$q" 0; ok ""
+  t 0 "" spool trim "$q" 0
   expect_file "$q" '/a\n/b\n/c\n/d\n/e'
-  run spool trim "$q" 2; ok ""
-  expect_file "$q" '/c\n/d\n/e'
+  t 0 "" spool trim "$q" 2
+  expect_entries "$q" '/c\n/d\n/e'
   [ "$(stat -c %a "$q")" = 640 ] || fail "mode $(stat -c %a "$q")"
-  run spool trim "$q" 9; ok ""
+  t 0 "" spool trim "$q" 9
   expect_file "$q" ''
   [ "$(ls -A "$WORK" | tr '\n' ' ')" = "err expected out q.queue " ] ||
     fail "files left beside the queue: $(ls -A "$WORK")"
-  run spool trim "$WORK/none" 1
-  expect_error "quvaidx spool: $WORK/none: No such file or directory"
+  t 2 "quvaidx spool: $WORK/none: No such file or directory" spool trim "$WORK/none" 1
   # trim and add wait for the queue's lock; the entry added meanwhile is
   # kept, whichever goes first.
   printf '/a\n/b\n/c\n' >"$q"
@@ -476,26 +574,7 @@ case_spool() {
   exec 9<&- # unlocks
   wait "$trim_pid" && wait "$add_pid" ||
     fail "trim or add failed: $(cat "$WORK/trim.out" "$WORK/add.out")"
-  expect_file "$q" '/b\n/c\n/d\n'
-}
-
-case_thumb() {
-  local kind daemon before
-  run thumb "$WORK/none"
-  expect_error "quvaidx thumb: $WORK/none: No such file or directory"
-  mkfifo "$WORK/fifo"
-  run thumb --video "$WORK/fifo"
-  expect_error "quvaidx thumb: $WORK/fifo is neither a directory nor a regular file"
-  # No preview daemon runs on a test machine: nothing is queued.
-  before=$(ls -l /var/spool/{thumb,flv}_create.queue 2>&1 || true)
-  for kind in "thumbnail quvamkthumbd" "web-video quvamkflvd"; do
-    read -r kind daemon <<<"$kind"
-    [ ! -e "/var/run/$daemon.pid" ] || continue
-    if [ "$kind" = thumbnail ]; then run thumb "$WORK"; else run thumb -V "$WORK"; fi
-    expect_error "quvaidx thumb: the $kind daemon ($daemon) is not running: /var/run/$daemon.pid names no live process; nothing was queued"
-  done
-  [ "$(ls -l /var/spool/{thumb,flv}_create.queue 2>&1 || true)" = "$before" ] ||
-    fail "a queue was touched"
+  expect_entries "$q" '/b\n/c\n/d\n'
 }
 
 # figures PID: descriptors, virtual and resident memory (kB) from /proc.
@@ -505,15 +584,10 @@ figures() {
 }
 
 case_stats() {
-  local total lines pid before after
+  local total pid before after
   total=$(awk '$1 == "MemTotal:" { print $2 }' /proc/meminfo)
-  run stats; ok
-  mapfile -t lines <"$WORK/out"
-  [[ ${#lines[@]} -eq 5 && ${lines[0]} =~ ^pid\ +[0-9]+$ &&
-    ${lines[1]} =~ ^descriptors\ +[0-9]+$ &&
-    ${lines[2]} =~ ^resident\ memory\ +[0-9]+\ kB$ &&
-    ${lines[3]} =~ ^virtual\ memory\ +[0-9]+\ kB$ &&
-    ${lines[4]} == "total memory     $total kB" ]] || fail "own figures"
+  t 0 '*' stats
+  has out "total memory     $total kB"
   sleep 30 >/dev/null 2>&1 9<&- &
   pid=$!
   PIDS+=("$pid")
@@ -521,16 +595,29 @@ case_stats() {
   # Its figures may still change as it starts: the tool's lie between those
   # read before and after it.
   before=$(figures "$pid")
-  run stats --json "$pid"
+  t 0 '*' stats --json "$pid"
   after=$(figures "$pid")
-  ok
   json 'd["pid"] == int(A[0]) and d["mem_total_kb"] == int(A[1]) and all(
     min(b, a) <= d[k] <= max(b, a) for k, b, a in zip(
     ["descriptors", "vmsize_kb", "rss_kb"], *(map(int, s.split()) for s in A[2:])))' \
     "$pid" "$total" "$before" "$after"
   kill -KILL "$pid"
   wait "$pid" 2>/dev/null || true
-  run stats "$pid"; expect_error "quvaidx stats: no process $pid"
+  t 2 "quvaidx stats: no process $pid" stats "$pid"
+}
+
+# One meaning per short option across the tool, and every command takes
+# -V for the version.
+case_options() {
+  local command letters version
+  version=$("$TOOL" --version)
+  for command in $("$TOOL" --help | awk '/^Commands:/ { on = 1; next }
+      on && !NF { exit } on && $1 != "help" { print $1 }'); do
+    t 0 "$version" "$command" -V
+    "$TOOL" "$command" --help | grep -oE '^  -[^-], --[a-z0-9-]+' >>"$WORK/letters"
+  done
+  letters=$(sort -u "$WORK/letters" | awk '{ print $1 }' | uniq -d)
+  [ -z "$letters" ] || fail "short options with two meanings: $letters"
 }
 
 # The media fixtures of tests/mediaparserd ($MEDIA_FIXTURES), under the names
@@ -538,13 +625,11 @@ case_stats() {
 make_media_samples() {
   local fx=${MEDIA_FIXTURES:-}
   [ -f "$fx/stamp" ] || fail "MEDIA_FIXTURES does not name the media fixtures"
-  cp "$fx/song_id3v24.mp3" song.mp3
-  cp "$fx/song_id3v1_cp1251.mp3" legacy.mp3
-  cp "$fx/video_rot90.mp4" clip.mp4
-  cp "$fx/photo_exif.jpg" photo.jpg
-  cp "$fx/photo.png" tiny.png
-  cp "$fx/song.wav" song.wav
-  cp song.mp3 renamed.mp4
+  for copy in song_id3v24.mp3:song.mp3 song_id3v1_cp1251.mp3:legacy.mp3 \
+    video_rot90.mp4:clip.mp4 photo_exif.jpg:photo.jpg photo.png:tiny.png \
+    song.wav:song.wav song_id3v24.mp3:renamed.mp4; do
+    cp "$fx/${copy%%:*}" "${copy#*:}"
+  done
   printf 'hello' >fake.png
   mkfifo fifo.mp3
 }
@@ -558,25 +643,21 @@ case_mediainfo() {
   make_media_samples
   mkdir -p "$QUVA_HOST_ETC"
   printf '[system]\ncode_page = windows-1251\n' >"$QUVA_HOST_ETC/host.conf"
-  run mediainfo --socket "$WORK/none.sock" --attempts 1 tiny.png
-  expect_error "quvaidx mediainfo: no reply from the media parser on $WORK/none.sock after 1 attempt"
   start mp "quvamediaparserd: listening on $sock" "$MEDIAPARSERD" \
     --foreground --socket "$sock" --socket-mode 0666 --pidfile "$WORK/mp.pid"
   # The readable view: labelled lines of what each file holds.
-  run mediainfo --socket "$sock" song.mp3 clip.mp4 photo.jpg legacy.mp3; ok
-  for line in "song.mp3" "  Title        Überschrift ✓" "  Track        3" \
-      "  Duration     0:01" "  Audio        MP3 32 kb/s 22.05 kHz mono" \
-      "  Covers       1" "  Video        H.264 High 320x240 25 fps" \
-      "  Rotation     90° clockwise" "  Camera       Canon EOS 5D Mark IV" \
-      "  Exposure     1/125 s, f/2.8, ISO 400" "  Picture      640x480" \
-      "  Title        Привет" "  Artist       Кино"; do
-    has out "$line"
-  done
+  t 0 '*' mediainfo --socket "$sock" song.mp3 clip.mp4 photo.jpg legacy.mp3
+  has out "song.mp3" "  Title        Überschrift ✓" "  Track        3" \
+    "  Duration     0:01" "  Audio        MP3 32 kb/s 22.05 kHz mono" \
+    "  Covers       1" "  Video        H.264 High 320x240 25 fps" \
+    "  Rotation     90° clockwise" "  Camera       Canon EOS 5D Mark IV" \
+    "  Exposure     1/125 s, f/2.8, ISO 400" "  Picture      640x480" \
+    "  Title        Привет" "  Artist       Кино"
   # The daemon reads the content; the name only names the media table.
-  run mediainfo --socket "$sock" renamed.mp4; ok
+  t 0 '*' mediainfo --socket "$sock" renamed.mp4
   has out "  Type         music (the name says video)"
-  # Relative names are sent as absolute paths.
-  run mediainfo --socket "$sock" --json song.mp3 photo.jpg clip.mp4; ok
+  # Relative names, here from standard input, are sent as absolute paths.
+  t 0 '*' mediainfo --socket "$sock" --json - <<<$'song.mp3\nphoto.jpg\nclip.mp4'
   json '[[r["file"], r["table"], r["media_type"], m["szPath"], m["szName"],
     m["fileSize"], m["szContainerType"], len(m)] for r in d
     for m in [r["media"]]] == [[n, t, t, os.path.abspath(n), n,
@@ -585,37 +666,32 @@ case_mediainfo() {
     "song.mp3 music mp3" "photo.jpg photo image2" \
     "clip.mp4 video mov,mp4,m4a,3gp,3g2,mj2"
   # The raw view of the record's fields.
-  run mediainfo --socket "$sock" --raw photo.jpg; ok
-  has out "szPath:          $WORK/photo.jpg"
-  has out "resolutionX:     640"
-  has out "szExposure:      1/125"
+  t 0 '*' mediainfo --socket "$sock" --raw photo.jpg
+  has out "szPath:          $WORK/photo.jpg" "resolutionX:     640" "szExposure:      1/125"
   ! grep -q "^szTitle:" "$WORK/out" || fail "an empty field was listed"
-  run mediainfo --socket "$sock" --raw song.wav; ok # integers stay whole
+  t 0 '*' mediainfo --socket "$sock" --raw song.wav # integers stay whole
   has out "audio_bitrate:   1411200"
-  run mediainfo --socket "$sock" --all song.mp3 # empty fields as well
-  ok
-  has out "szDesc:          "
-  has out "audio_bitrate:   32000"
+  t 0 '*' mediainfo --socket "$sock" --all song.mp3 # empty fields as well
+  has out "szDesc:          " "audio_bitrate:   32000"
   [ "$(grep -c : "$WORK/out")" -eq 48 ] || fail "not 48 lines"
-  run resolution --socket "$sock" photo.jpg; ok "640x480"
-  run resolution --socket "$sock" --json clip.mp4; ok
+  t 0 "640x480" resolution --socket "$sock" photo.jpg
+  t 0 '*' resolution --socket "$sock" --json clip.mp4
   json 'd["width"] == 320 and d["height"] == 240'
   # Missing files, special files and no media are refused with a reason,
   # and the daemon goes on answering.
-  run resolution --socket "$sock" fake.png
-  expect_error "quvaidx resolution: fake.png: not a media file" 1
+  t 1 "quvaidx resolution: fake.png: not a media file" resolution --socket "$sock" fake.png
   run mediainfo --socket "$sock" fifo.mp3 fake.png tiny.png
   expect 1
-  has err "quvaidx mediainfo: fifo.mp3: not a regular file"
-  has err "quvaidx mediainfo: fake.png: not a media file"
+  has err "quvaidx mediainfo: fifo.mp3: not a regular file" \
+    "quvaidx mediainfo: fake.png: not a media file"
   has out "  Picture      200x100"
   # Another user learns only about what it could read itself.
   if [ "$(id -u)" -eq 0 ]; then
     chmod 600 song.wav
     as_nobody
-    run mediainfo --socket "$sock" "$WORK/song.wav"
-    expect_error "quvaidx mediainfo: $WORK/song.wav: Permission denied" 1
-    run mediainfo --socket "$sock" "$WORK/song.mp3"; ok
+    t 1 "quvaidx mediainfo: $WORK/song.wav: Permission denied" \
+      mediainfo --socket "$sock" "$WORK/song.wav"
+    t 0 '*' mediainfo --socket "$sock" "$WORK/song.mp3"
     as_self
   fi
 }

@@ -1,7 +1,9 @@
 #!/usr/bin/env bash
 # The bash completion of quvaidx offers what the tool's --help says:
-# commands, each command's options, daemon names after --daemon, files
-# after an option that takes a value. completion_test.sh TOOL COMPLETION
+# commands, a command's operations, the options of the operation at hand
+# (each once, and none already given), daemon names for a NAME, files for a
+# PATH, nothing more after a flag of a command without operands.
+#   completion_test.sh TOOL COMPLETION
 set -euo pipefail
 tool=$1
 # shellcheck source=/dev/null
@@ -17,29 +19,41 @@ complete_words() {
   _quvaidx
   echo "${COMPREPLY[*]}"
 }
-check() {
-  local expected=$1
-  shift
-  local got
-  got=$(complete_words "$@")
+common="--verbose --help --version"
+while IFS='|' read -r expected words; do
+  read -ra words <<<"$words"
+  [ "${words[-1]}" = '""' ] && words[-1]=""
+  got=$(complete_words "${words[@]}")
   [ "$got" = "$expected" ] || {
-    echo "FAIL: quvaidx $* -> '$got', expected '$expected'" >&2
+    echo "FAIL: quvaidx ${words[*]} -> '$got', expected '$expected'" >&2
     exit 1
   }
-}
-
-check "send serve" se
-check "--verbose --help --version" --
-check "--nowait" -v taskq --now
-check "--timeout" send --ti
-check "controld" send -d co
-check "mediad" send --daemon me
-check "$work/request.json" send --socket "$work/req"
-check "thumb" help th
-# Every command the tool lists is offered, and each has --help.
+done <<CASES
+send serve|se
+--verbose --help --version|--
+thumb|help th
+create push pop count delete|taskq ""
+add trim|spool ""
+--type --nowait --attempts $common|taskq pop /k 7 --
+--nowait --attempts $common|taskq pop /k 7 --type 2 --
+--size $common|taskq create /k 7 --
+--null $common|spool add /q --
+--nowait|-v taskq --now
+--timeout|send --ti
+controld|send -d co
+mediad|send --daemon me
+$work/request.json|send --socket $work/req
+--socket --pidfile $common|serve --daemon ""
+--daemon --attempts --timeout --handshake --compact $common|send -s x --
+controld scand workerd plugind mediad|daemons ""
+CASES
+# Every command the tool lists is offered, with --help once.
 for command in $(complete_words ""); do
   [ "$command" = help ] && continue
-  [[ " $(complete_words "$command" --) " == *" --help "* ]] ||
-    { echo "FAIL: no --help offered for $command" >&2; exit 1; }
+  offered=" $(complete_words "$command" --) "
+  [ "$(grep -o ' --help ' <<<"$offered" | wc -l)" -eq 1 ] ||
+    { echo "FAIL: --help not offered once for $command: $offered" >&2; exit 1; }
+  [ "$(tr ' ' '\n' <<<"$offered" | sort | uniq -d)" = "" ] ||
+    { echo "FAIL: an option offered twice for $command" >&2; exit 1; }
 done
 echo "completion check passed"

@@ -147,4 +147,16 @@ TEST_F(IndexQueueTest, LinkAtTheQueuePathIsNotFollowed) {
                           " is a symbolic link; not trimmed");
 }
 
+// A queue holds text: the writer makes it 0666 less the umask, never
+// executable.
+TEST_F(IndexQueueTest, NewQueueIsNotExecutable) {
+  const mode_t old_umask = umask(0);
+  const int result = WriteIndexQueue("/share/a", queue_.c_str());
+  umask(old_umask);
+  ASSERT_EQ(result, 0);
+  struct stat st;
+  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0666u);
+}
+
 }  // namespace

@@ -3,7 +3,8 @@
 // Paths come from the library's daemon directory (DaemonInfo); whether a
 // daemon is alive is the host's decision (QLIBCProcAliveByPidFile), the same
 // check that keeps a second instance from starting. Nothing is written and
-// no daemon is contacted.
+// no daemon is contacted. Asked for NAMEs, it exits as `systemctl
+// is-active` does: 0 only when every one is alive.
 #include <stdio.h>
 
 #include <string>
@@ -21,6 +22,9 @@ namespace quvaidx_cli {
 namespace {
 
 constexpr char kName[] = "daemons";
+// Exit status when a daemon asked for is not alive, as systemctl is-active
+// reports a unit that is not running.
+constexpr int kExitNotRunning = 3;
 
 struct Row {
   std::string name, pid_file, executable, socket;
@@ -35,12 +39,17 @@ quvaidx_tools::CommandLine MakeLine(bool* json) {
       "and whether each is alive: its pid file names a running process that\n"
       "started before the file was written. Without NAMEs all are listed:\n" +
           DaemonNameList() + ".\n",
-      {quvaidx_tools::Flag(
-          "json", 'j', json,
-          "print a JSON array of objects with the members\nname, pid_file, "
-          "executable, socket, pid (null\nwhen the pid file is missing or "
-          "bad) and alive")},
-      "Exit status: 0, or 2 on a usage error or an unknown NAME.\n");
+      {JsonOption(json,
+                  "print a JSON array of objects with the members\nname, "
+                  "pid_file, executable, socket, pid (null\nwhen the pid file "
+                  "is missing or bad) and alive")},
+      "Exit status:\n"
+      "  0  every NAME is alive (without NAMEs: the list was printed)\n"
+      "  2  usage error or an unknown NAME\n"
+      "  3  a NAME is not alive\n"
+      "\n"
+      "Examples:\n"
+      "  $ quvaidx daemons mediad >/dev/null && echo the media parser runs\n");
 }
 
 Row Describe(DaemonInfo& info, const std::string& name) {
@@ -101,31 +110,37 @@ void PrintTable(const std::vector<Row>& rows) {
 
 int RunDaemons(int argc, char** argv) {
   bool json = false;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&json), argc, argv, &first);
-  if (status != kContinue) return status;
   std::vector<std::string> names;
-  for (int i = first; i < argc; ++i) {
-    if (!IsDaemonName(argv[i])) {
-      PrintError(kName, std::string("unknown daemon '") + argv[i] +
+  if (int status = ParseCommand(MakeLine(&json), {"NAME", 0, -1, nullptr}, argc,
+                                argv, &names);
+      status != kContinue) {
+    return status;
+  }
+  for (const std::string& name : names) {
+    if (!IsDaemonName(name)) {
+      PrintError(kName, "unknown daemon '" + name +
                             "'; known daemons: " + DaemonNameList());
       return kExitError;
     }
-    names.push_back(argv[i]);
   }
-  if (names.empty()) {
+  const bool all = names.empty();
+  if (all) {
     for (const quvaidx::IndexDaemonPaths& daemon : quvaidx::kIndexDaemons)
       names.push_back(daemon.name);
   }
   DaemonInfo info;
   std::vector<Row> rows;
-  for (const std::string& name : names) rows.push_back(Describe(info, name));
+  bool every_one_alive = true;
+  for (const std::string& name : names) {
+    rows.push_back(Describe(info, name));
+    every_one_alive = every_one_alive && rows.back().alive;
+  }
   if (json) {
     PrintJsonRows(rows);
   } else {
     PrintTable(rows);
   }
-  return kExitOk;
+  return all || every_one_alive ? kExitOk : kExitNotRunning;
 }
 
 }  // namespace quvaidx_cli

@@ -7,40 +7,30 @@
 namespace quvaidx_cli {
 namespace {
 
+// The characters JSON escapes by a letter, and their escapes.
+constexpr struct {
+  char c;
+  const char* escape;
+} kShortEscapes[] = {{'"', "\\\""}, {'\\', "\\\\"}, {'\b', "\\b"},
+                     {'\f', "\\f"}, {'\n', "\\n"},  {'\r', "\\r"},
+                     {'\t', "\\t"}};
+
 void AppendString(const char* begin, const char* end, std::string* out) {
   out->push_back('"');
   for (const char* p = begin; p < end; ++p) {
     unsigned char c = static_cast<unsigned char>(*p);
-    switch (c) {
-      case '"':
-        out->append("\\\"");
-        break;
-      case '\\':
-        out->append("\\\\");
-        break;
-      case '\b':
-        out->append("\\b");
-        break;
-      case '\f':
-        out->append("\\f");
-        break;
-      case '\n':
-        out->append("\\n");
-        break;
-      case '\r':
-        out->append("\\r");
-        break;
-      case '\t':
-        out->append("\\t");
-        break;
-      default:
-        if (c < 0x20 || c == 0x7F) {
-          char escaped[8];
-          snprintf(escaped, sizeof(escaped), "\\u%04x", c);
-          out->append(escaped);
-        } else {
-          out->push_back(static_cast<char>(c));
-        }
+    const char* escape = nullptr;
+    for (const auto& known : kShortEscapes) {
+      if (known.c == *p) escape = known.escape;
+    }
+    if (escape != nullptr) {
+      out->append(escape);
+    } else if (c < 0x20 || c == 0x7F) {
+      char escaped[8];
+      snprintf(escaped, sizeof(escaped), "\\u%04x", c);
+      out->append(escaped);
+    } else {
+      out->push_back(static_cast<char>(c));
     }
   }
   out->push_back('"');

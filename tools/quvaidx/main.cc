@@ -48,8 +48,10 @@ const Command* FindCommand(const char* name) {
 quvaidx_tools::CommandLine ToolLine() {
   std::string commands = "Commands:\n";
   for (const Command& command : kCommands) {
+    // Two blanks at least after the name: help2man makes each command a
+    // paragraph of its own.
     char line[128];
-    snprintf(line, sizeof(line), "  %-10s %s\n", command.name, command.summary);
+    snprintf(line, sizeof(line), "  %-12s%s\n", command.name, command.summary);
     commands += line;
   }
   quvaidx_tools::CommandLine line;

@@ -2,15 +2,16 @@
 // answers about files, as the library's callers receive them.
 //
 // Both send exactly the requests of QUVAIDX_GetMediaInfo and
-// QUVAIDX_GetMediaResolution ({"command": ..., "path": FILE}, one exchange
-// with AutoSendRecvPacket, descriptor -1, no handshake) and read the reply
-// the same way: it counts only when "success" is a boolean true or a
-// nonzero number; the record comes from "media" through
+// QUVAIDX_GetMediaResolution ({"command": ..., "path": FILE}, no handshake)
+// and read the reply the same way: it counts only when "success" is a boolean
+// true or a nonzero number; the record comes from "media" through
 // MediaInfoJson2Object, and "width" and "height" are read as 32-bit
-// integers (0 when missing or out of range). Only the number of connection
-// attempts differs: the library's calls wait up to half an hour for a
-// daemon, the tool --attempts (default 3) seconds. For a video, the readable
-// view also asks GET_VIDEO_METADATA, for its rotation and pixel aspect.
+// integers (0 when missing or out of range). Only the exchange differs: the
+// library's calls wait up to half an hour for a daemon and repeat a request
+// whose connection was closed, the tool's exchange (daemon_client.h) tries
+// --attempts (default 3) times within --timeout and sends it once. For
+// a video, the readable view also asks GET_VIDEO_METADATA, for its rotation
+// and pixel aspect.
 #include <errno.h>
 #include <limits.h>
 #include <stdio.h>
@@ -23,8 +24,8 @@
 
 #include "cli.h"
 #include "commands.h"
+#include "daemon_client.h"
 #include "media_view.h"
-#include "quvaidx/daemon_info.h"
 #include "quvaidx/ipc.h"
 #include "quvaidx/media_type.h"
 #include "quvaidx/mediainfo.h"
@@ -32,9 +33,6 @@
 
 namespace quvaidx_cli {
 namespace {
-
-constexpr int kDefaultAttempts = 3;
-constexpr int kMaxAttempts = 3600;
 
 // The record's fields in their order, for the readable listing.
 constexpr const char* kFields[] = {
@@ -89,28 +87,12 @@ constexpr const char* kFields[] = {
 
 // What one invocation asks for, from the command line.
 struct Options {
-  std::string socket;  // the media parser's socket
-  int attempts = kDefaultAttempts;
-  bool json = false;  // print JSON instead of the readable view
-  bool raw = false;   // print "name: value" lines of the record's fields
-  bool all = false;   // raw, and list fields that are 0 or empty too
+  DaemonClient client;     // the media parser
+  bool json = false;       // print JSON instead of the readable view
+  bool raw = false;        // print "name: value" lines of the record's fields
+  bool all = false;        // raw, and list fields that are 0 or empty too
+  bool null_list = false;  // FILE "-": NUL-separated names on stdin
 };
-
-// As the library reads "success": a boolean true or a nonzero number.
-bool Succeeded(const Json::Value& reply) {
-  if (!reply.isObject() || !reply.isMember("success")) return false;
-  const Json::Value& success = reply["success"];
-  switch (success.type()) {
-    case Json::booleanValue:
-      return success.asBool();
-    case Json::intValue:
-    case Json::uintValue:
-    case Json::realValue:
-      return success.asDouble() != 0.0;
-    default:
-      return false;
-  }
-}
 
 // As the library reads "width" and "height": a 32-bit integer (a real
 // within range cut toward zero, true as 1), anything else 0.
@@ -177,14 +159,7 @@ int Ask(const char* name, const Options& options, const char* command,
     PrintError(name, file + ": path too long for a request");
     return kExitError;
   }
-  if (AutoSendRecvPacket(options.socket.c_str(), -1, value, options.attempts) !=
-      0) {
-    PrintError(name, "no reply from the media parser on " + options.socket +
-                         " after " + std::to_string(options.attempts) +
-                         (options.attempts == 1 ? " attempt" : " attempts") +
-                         " (is mediaparserd running?)");
-    return kExitError;
-  }
+  if (Exchange(name, options.client, &value) != kExitOk) return kExitError;
   if (!Succeeded(value)) {
     const Json::Value& reason = value.isObject() ? value["reason"] : value;
     PrintError(name, file + ": " +
@@ -222,10 +197,10 @@ void PrintRecord(const std::string& file, const Json::Value& media, bool all) {
 quvaidx_tools::CommandLine MakeLine(const char* name, Options* options) {
   using namespace quvaidx_tools;
   const bool info = strcmp(name, "mediainfo") == 0;
-  std::vector<Option> flags = {
-      Flag("json", 'j', &options->json,
-           info ? "print JSON: an array of {\"file\", \"table\", \"media\"}"
-                : "print JSON")};
+  std::vector<Option> flags = {JsonOption(
+      &options->json,
+      info ? "print JSON: an array of {\"file\", \"table\", \"media\"}"
+           : "print JSON")};
   if (info) {
     flags.push_back(Flag("raw", 'r', &options->raw,
                          "list the record's fields that are set, one\n\"name: "
@@ -238,20 +213,21 @@ quvaidx_tools::CommandLine MakeLine(const char* name, Options* options) {
           return std::string();
         },
         "as --raw, with the fields that are 0 or\nempty"));
+    flags.push_back(NullOption(&options->null_list));
   }
-  flags.push_back(Text("socket", 's', "PATH", &options->socket,
-                       std::string("the daemon's socket (default ") +
-                           QUVAIDX_MEDIAD_SOCKET + ")"));
-  flags.push_back(Number("attempts", 'a', "N", 1, kMaxAttempts,
-                         &options->attempts,
-                         "connection attempts, one second apart\n(default " +
-                             std::to_string(kDefaultAttempts) + ")"));
+  options->client = IndexDaemonClient("mediad");
+  for (Option& option : DaemonOptions(
+           &options->client, std::string("the daemon's socket (default\n") +
+                                 QUVAIDX_MEDIAD_SOCKET + ")")) {
+    flags.push_back(std::move(option));
+  }
   return Subcommand(
-      name, {info ? "[OPTIONS] FILE..." : "[OPTIONS] FILE"},
+      name, {info ? "[OPTIONS] FILE...|-" : "[OPTIONS] FILE"},
       std::string(info ? "Asks the media-parser daemon for the media record "
                          "of each\nFILE and shows what it holds: title, "
                          "artist, duration,\ncodecs, camera and the like, one "
-                         "labelled line each.\n"
+                         "labelled line each. With -,\nthe FILEs are read from "
+                         "standard input, one per line.\n"
                        : "Asks the media-parser daemon for the pixel size of "
                          "FILE and\nprints it as WIDTHxHEIGHT (0x0 when the "
                          "daemon does not know\nit).\n") +
@@ -260,32 +236,34 @@ quvaidx_tools::CommandLine MakeLine(const char* name, Options* options) {
       flags,
       "Exit status: 0 when the daemon answered for every FILE, 1 when it\n"
       "refused one (its reason is printed), 2 on a usage error or when no\n"
-      "reply could be obtained.\n");
+      "reply could be obtained (why is printed).\n");
 }
 
-// Parses the options shared by both commands; the FILE arguments start at
-// *first afterwards. Returns kContinue to go on, else the exit status.
-int ParseOptions(int argc, char** argv, Options* options, int* first) {
-  const char* name = argv[0];
-  options->socket = QUVAIDX_MEDIAD_SOCKET;
-  int status = ParseArguments(MakeLine(name, options), argc, argv, first);
-  if (status != kContinue) return status;
-  if (*first >= argc) return UsageError(name, "missing FILE");
-  return CheckSocketPath(name, options->socket) ? kContinue : kExitError;
+// Parses the command line of `argv[0]` into *options and *files. Returns
+// kContinue to go on, else the exit status.
+int ParseOptions(int argc, char** argv, Options* options,
+                 std::vector<std::string>* files) {
+  const bool info = strcmp(argv[0], "mediainfo") == 0;
+  OperandRule rule = {"FILE", 1, info ? -1 : 1,
+                      info ? &options->null_list : nullptr};
+  return ParseCommand(MakeLine(argv[0], options), rule, argc, argv, files);
 }
 
 }  // namespace
 
 int RunMediaInfo(int argc, char** argv) {
   Options options;
-  int first = 0;  // the first FILE
-  int status = ParseOptions(argc, argv, &options, &first);
-  if (status != kContinue) return status;
-  status = kExitOk;
+  std::vector<std::string> files;
+  if (int status = ParseOptions(argc, argv, &options, &files);
+      status != kContinue) {
+    return status;
+  }
+  int status = kExitOk;
   Json::Value records(Json::arrayValue);
-  for (int i = first; i < argc; ++i) {
+  for (size_t i = 0; i < files.size(); ++i) {
+    const std::string& file = files[i];
     Json::Value reply;
-    int result = Ask(argv[0], options, "GET_MEDIA_INFO", argv[i], &reply);
+    int result = Ask(argv[0], options, "GET_MEDIA_INFO", file, &reply);
     if (result == kExitError) return kExitError;  // the next would wait too
     if (result != kExitOk) {
       status = result;
@@ -295,7 +273,6 @@ int RunMediaInfo(int argc, char** argv) {
     MediaInfoJson2Object(reply["media"], record);
     Json::Value media;
     MediaInfoObject2Json(record, media);
-    std::string file = argv[i];
     const Json::Value& kind = reply["media_type"];
     if (options.json) {
       Json::Value& entry = records.append(Json::Value(Json::objectValue));
@@ -305,7 +282,7 @@ int RunMediaInfo(int argc, char** argv) {
       entry["media"].swap(media);
       continue;
     }
-    if (i > first) printf("\n");
+    if (i > 0) printf("\n");
     if (options.raw) {
       PrintRecord(file, media, options.all);
       continue;
@@ -333,16 +310,13 @@ int RunMediaInfo(int argc, char** argv) {
 
 int RunResolution(int argc, char** argv) {
   Options options;
-  int first = 0;  // the FILE
-  int status = ParseOptions(argc, argv, &options, &first);
-  if (status != kContinue) return status;
-  if (argc - first > 1) {
-    return UsageError(argv[0], std::string("expects one FILE; unexpected "
-                                           "argument '") +
-                                   argv[first + 1] + "'");
+  std::vector<std::string> file;
+  if (int status = ParseOptions(argc, argv, &options, &file);
+      status != kContinue) {
+    return status;
   }
   Json::Value reply;
-  status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", argv[first], &reply);
+  int status = Ask(argv[0], options, "GET_MEDIA_RESOLUTION", file[0], &reply);
   if (status != kExitOk) return status;
   int32_t width = ReadInt32(reply, "width");
   int32_t height = ReadInt32(reply, "height");

@@ -21,7 +21,7 @@
 
 #include "cli.h"
 #include "commands.h"
-#include "quvaidx/system.h"
+#include "preview_queue.h"
 #include "scan_tree.h"
 
 namespace quvaidx_cli {
@@ -36,13 +36,36 @@ struct Options {
   bool list = false;
   bool json = false;
   bool queue_thumbs = false;
+  bool null_list = false;          // DIR "-": NUL-separated names on stdin
+  PreviewTarget thumbs;            // where --queue-thumbs queues
   std::vector<std::string> roots;  // absolute, resolved
 };
 
 quvaidx_tools::CommandLine MakeLine(Options* o) {
   using quvaidx_tools::Flag;
+  std::vector<quvaidx_tools::Option> options = {
+      Flag("list", 'l', &o->list,
+           "print each file that passed the rules with its\ntable, "
+           "\"TABLE<tab>PATH\", on stdout; the\nsummary then goes to "
+           "stderr. Control characters\nand '\\' in paths are written "
+           "as C escapes"),
+      JsonOption(&o->json,
+                 "print one JSON object: the summary and, with\n--list, "
+                 "\"files\": [{\"table\", \"path\"}...]\n(names that are "
+                 "not UTF-8 are not exact there)"),
+      Flag("queue-thumbs", 0, &o->queue_thumbs,
+           "queue every folder holding photos that need\nthumbnails for "
+           "the thumbnail daemon, which must\nbe running; a folder outside "
+           "every share, or\nwhose name holds a line feed, is refused "
+           "with\none line and the others are queued"),
+      NullOption(&o->null_list),
+  };
+  for (quvaidx_tools::Option& option :
+       PreviewTargetOptions(&o->thumbs, " (with --queue-thumbs)")) {
+    options.push_back(std::move(option));
+  }
   return Subcommand(
-      kName, {"[--list] [--json] [--queue-thumbs] DIR..."},
+      kName, {"[--list] [--json] [--queue-thumbs] DIR...|-"},
       "Walks each folder tree DIR with the index's rules and reports what\n"
       "the index would hold: files per media table (music, video, photo,\n"
       "playlist, other), videos playable on the web, photos that need\n"
@@ -54,31 +77,20 @@ quvaidx_tools::CommandLine MakeLine(Options* o) {
       "folders inside a share's recycle bin, network and image mounts,\n"
       "symbolic links (never followed), folder loops, and devices, sockets\n"
       "and pipes. Each DIR is resolved to its absolute path first (a DIR\n"
-      "that is a symbolic link is followed); paths are shown that way.\n",
-      {
-          Flag("list", 'l', &o->list,
-               "print each file that passed the rules with its\ntable, "
-               "\"TABLE<tab>PATH\", on stdout; the\nsummary then goes to "
-               "stderr. Control characters\nand '\\' in paths are written "
-               "as C escapes"),
-          Flag("json", 'j', &o->json,
-               "print one JSON object: the summary and, with\n--list, "
-               "\"files\": [{\"table\", \"path\"}...]\n(names that are "
-               "not UTF-8 are not exact there)"),
-          Flag("queue-thumbs", 0, &o->queue_thumbs,
-               "queue every folder holding photos that need\nthumbnails for "
-               "the thumbnail daemon, which must\nbe running"),
-      },
+      "that is a symbolic link is followed); paths are shown that way.\n"
+      "With -, the DIRs are read from standard input, one per line.\n",
+      options,
       "On a terminal, a scan that takes over a second shows its progress\n"
-      "on stderr. Unreadable folders get one line each on stderr.\n"
+      "on stderr. Unreadable folders, and folders not queued, get one line\n"
+      "each on stderr.\n"
       "\n"
       "Exit status: 0; 1 when a folder could not be read or a folder could\n"
-      "not be queued; 2 on a usage error or a DIR that is missing or not a\n"
-      "folder.\n"
+      "not be queued; 2 on a usage error, a DIR that is missing or not a\n"
+      "folder, or --queue-thumbs while the thumbnail daemon is not running.\n"
       "\n"
-      "Example:\n"
-      "  quvaidx scan /share/Multimedia\n"
-      "  quvaidx scan --list /share/Photos | grep '^photo'\n");
+      "Examples:\n"
+      "  $ quvaidx scan /share/Multimedia\n"
+      "  $ quvaidx scan --list /share/Photos | grep '^photo'\n");
 }
 
 double Now() {
@@ -111,8 +123,12 @@ void AppendEscaped(const std::string& path, std::string* out) {
 // folders and, on request, thumbnail queueing.
 class Reporter : public ScanObserver {
  public:
-  Reporter(const Options& options, bool show_progress)
-      : options_(options), show_progress_(show_progress), start_(Now()) {}
+  // `queuer` is null without --queue-thumbs.
+  Reporter(const Options& options, bool show_progress, PreviewQueuer* queuer)
+      : options_(options),
+        show_progress_(show_progress),
+        start_(Now()),
+        queuer_(queuer) {}
 
   void OnFile(const std::string& path, TableIndex table) override {
     line_.clear();
@@ -134,25 +150,28 @@ class Reporter : public ScanObserver {
   }
 
   void OnThumbFolder(const std::string& path) override {
-    if (!options_.queue_thumbs) return;
+    if (queuer_ == nullptr) return;
     if (queue_failed_) {
       ++not_queued_;
       return;
     }
-    if (WriteThumbQueue(path.c_str(), THUMB_TYPE_PHOTO) == 0) {
+    std::string report;
+    PreviewQueuer::Outcome outcome = queuer_->Queue(path, &report);
+    if (outcome == PreviewQueuer::kQueued) {
       ++queued_;
       return;
     }
-    // The daemon is down or its queue unwritable: every later folder would
-    // fail the same way, so one line says it and the rest are only counted.
+    // A refused folder is reported and the walk goes on; a queue that
+    // cannot be written would fail every later folder the same way, so
+    // one line says it and the rest are only counted.
     ++not_queued_;
-    queue_failed_ = true;
+    queue_failed_ = outcome == PreviewQueuer::kFailed;
     ClearProgress();
+    std::string line = "not queued: ";
+    AppendEscaped(path, &line);
     PrintError(kName,
-               "cannot queue " + path +
-                   " for thumbnails: the thumbnail daemon is not running or "
-                   "its queue cannot be written; no more folders are queued "
-                   "(--verbose shows the library's report)");
+               line + ": " + report +
+                   (queue_failed_ ? "; no more folders are queued" : ""));
   }
 
   void OnUnreadable(const std::string& path, const char* reason) override {
@@ -222,7 +241,8 @@ class Reporter : public ScanObserver {
   bool progress_shown_ = false;  // a progress line is on the terminal
   bool first_file_ = true;       // no file listed yet
   std::string line_;             // one list line, reused
-  bool queue_failed_ = false;    // WriteThumbQueue failed once
+  PreviewQueuer* queuer_;        // null without --queue-thumbs
+  bool queue_failed_ = false;    // the queue could not be written
   uint64_t queued_ = 0;          // folders queued for thumbnails
   uint64_t not_queued_ = 0;      // folders that could not be queued
 };
@@ -312,25 +332,19 @@ void PrintSummary(FILE* out, const Options& options, const ScanCounts& counts,
 
 // Resolves every DIR to an absolute path naming a folder. Prints one line
 // per DIR that fails and returns false if any did.
-bool ResolveRoots(int count, char** args, Options* options) {
+bool ResolveRoots(const std::vector<std::string>& dirs, Options* options) {
   bool ok = true;
-  for (int i = 0; i < count; ++i) {
-    char* resolved = realpath(args[i], nullptr);
-    if (resolved == nullptr) {
-      PrintError(kName, std::string("cannot scan ") + args[i] + ": " +
-                            strerror(errno));
-      ok = false;
-      continue;
-    }
+  for (const std::string& dir : dirs) {
+    std::string resolved;
     struct stat st;
-    if (stat(resolved, &st) != 0 || !S_ISDIR(st.st_mode)) {
-      PrintError(kName,
-                 std::string("cannot scan ") + args[i] + ": not a folder");
+    if (!ResolvePath(kName, dir, &resolved)) {
+      ok = false;
+    } else if (stat(resolved.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+      PrintError(kName, dir + ": not a folder");
       ok = false;
     } else {
       options->roots.push_back(resolved);
     }
-    free(resolved);
   }
   return ok;
 }
@@ -339,23 +353,30 @@ bool ResolveRoots(int count, char** args, Options* options) {
 
 int RunScan(int argc, char** argv) {
   Options options;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&options), argc, argv, &first);
-  if (status != kContinue) return status;
-  if (first >= argc) return UsageError(kName, "missing the folder DIR");
-  if (!ResolveRoots(argc - first, argv + first, &options)) return kExitError;
+  std::vector<std::string> dirs;
+  if (int status = ParseCommand(MakeLine(&options),
+                                {"the folder DIR", 1, -1, &options.null_list},
+                                argc, argv, &dirs);
+      status != kContinue) {
+    return status;
+  }
+  if (!ResolveRoots(dirs, &options)) return kExitError;
+  PreviewQueuer queuer(kName, options.thumbs);
+  if (options.queue_thumbs && !queuer.Ready()) return kExitError;
 
   // Progress shares the terminal with nothing but the final summary: not
   // with a list written to the same terminal.
   bool show_progress =
       isatty(STDERR_FILENO) && !(options.list && isatty(STDOUT_FILENO));
-  Reporter reporter(options, show_progress);
+  Reporter reporter(options, show_progress,
+                    options.queue_thumbs ? &queuer : nullptr);
   TreeScanner scanner(&reporter, options.list);
   if (options.json && options.list) fputs("{\n  \"files\" : [\n", stdout);
   double start = Now();
   for (const std::string& root : options.roots) scanner.Scan(root);
   double elapsed = Now() - start;
   reporter.ClearProgress();
+  queuer.Wake();
 
   const ScanCounts& counts = scanner.counts();
   if (options.json) {

@@ -110,14 +110,7 @@ void TreeScanner::Scan(const std::string& root) {
   }
 
   std::vector<Frame> frames;
-  Frame root_frame{st.st_dev, st.st_ino, path_.size(), {}};
-  ReadFolder(fd, &root_frame);
-  if (root_frame.subfolders.empty()) {
-    close(fd);
-    return;
-  }
-  on_path_.emplace(root_frame.dev, root_frame.ino);
-  frames.push_back(std::move(root_frame));
+  if (!Enter(fd, st, &frames)) return;
   int current = fd;  // the folder of frames.back(), or -1 when lost
 
   while (!frames.empty()) {
@@ -127,17 +120,10 @@ void TreeScanner::Scan(const std::string& root) {
       top.next += strlen(name) + 1;
       SetPath(top.path_length, name);
       int child = OpenSubfolder(current, top, name, &st);
-      if (child < 0) continue;
-      Frame frame{st.st_dev, st.st_ino, path_.size(), {}};
-      ReadFolder(child, &frame);
-      // A folder without subfolders is finished here: no need to descend
-      // into it and climb back.
-      if (frame.subfolders.empty()) {
-        close(child);
-        continue;
-      }
-      on_path_.emplace(frame.dev, frame.ino);
-      frames.push_back(std::move(frame));  // `top` is invalid from here
+      // A folder without subfolders is finished at once: no need to
+      // descend into it and climb back.
+      if (child < 0 || !Enter(child, st, &frames)) continue;
+      // `top` is invalid from here.
       CloseIfOpen(current);
       current = child;
       continue;
@@ -158,6 +144,19 @@ void TreeScanner::Scan(const std::string& root) {
     }
   }
   CloseIfOpen(current);
+}
+
+bool TreeScanner::Enter(int fd, const struct stat& st,
+                        std::vector<Frame>* frames) {
+  Frame frame{st.st_dev, st.st_ino, path_.size(), {}};
+  ReadFolder(fd, &frame);
+  if (frame.subfolders.empty()) {
+    close(fd);
+    return false;
+  }
+  on_path_.emplace(frame.dev, frame.ino);
+  frames->push_back(std::move(frame));
+  return true;
 }
 
 void TreeScanner::ReadFolder(int fd, Frame* frame) {

@@ -124,6 +124,12 @@ class TreeScanner {
   // `frame`. Does not close `fd`. A read that fails is reported; what was
   // read before it is kept.
   void ReadFolder(int fd, Frame* frame);
+  // Reads the open folder `fd` (path_ names it, `st` describes it) and,
+  // when it has subfolders to visit, puts it on the current path as the
+  // last of `frames` and returns true: `fd` is then its descriptor. A
+  // folder without subfolders is finished at once: `fd` is closed and the
+  // result is false.
+  bool Enter(int fd, const struct stat& st, std::vector<Frame>* frames);
   // Handles one entry of the folder being read; `type` is a DT_ value.
   void VisitEntry(int dir_fd, const char* name, unsigned char type,
                   Frame* frame, bool* has_thumb_photos);

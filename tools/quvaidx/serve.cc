@@ -23,6 +23,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include <event2/event.h>
 #include <json/json.h>
@@ -97,7 +98,7 @@ quvaidx_tools::CommandLine MakeLine(Options* o) {
                "(printing \"Daemon alive. No need to\nstart\"); else write "
                "this process's id into\nFILE and remove FILE on exit"),
           quvaidx_tools::Flag(
-              "daemon", 'd', &o->detach,
+              "daemon", 0, &o->detach,
               "with --pidfile: detach into the background\nafter the "
               "checks and print nothing more; wait\nfor FILE and the "
               "socket, stop it with\nkill -TERM \"$(cat FILE)\""),
@@ -138,20 +139,17 @@ void OnStopSignal(evutil_socket_t signal_number, short, void* arg) {
   event_base_loopexit(stop->base, nullptr);
 }
 
-// Explains why the server could not listen on `path`. BuildServer has
-// decided and logged why; this only puts it in the user's words.
-std::string ListenFailure(const std::string& path) {
-  struct stat info;
-  if (lstat(path.c_str(), &info) != 0) {
-    return "cannot listen on " + path +
-           " (is its directory there and writable? --verbose shows the "
-           "library's report)";
+// Why the server could not listen on `path`, in the user's words, from the
+// errno BuildServer left.
+std::string ListenFailure(const std::string& path, int error) {
+  switch (error) {
+    case EADDRINUSE:  // the library removes only a socket nobody answers on
+      return "a daemon is already listening on " + path;
+    case EEXIST:
+      return path + " exists and is not a socket; not replacing it";
+    default:
+      return "cannot listen on " + path + ": " + strerror(error);
   }
-  if (!S_ISSOCK(info.st_mode)) {
-    return path + " exists and is not a socket; not replacing it";
-  }
-  // The library removes a socket nobody answers on: this one answered.
-  return "a daemon is already listening on " + path;
 }
 
 // True when another process holds the lock of `pid_file`, as a daemon that
@@ -182,7 +180,7 @@ int Serve(const std::string& path) {
       evsignal_add(sigint, nullptr) || evsignal_add(sigterm, nullptr)) {
     Fail("cannot watch for SIGINT and SIGTERM");
   } else if (BuildServer(base, path.c_str(), &args) != 0) {
-    Fail(ListenFailure(path));
+    Fail(ListenFailure(path, errno));
   } else {
     if (!g_detached) {
       printf("quvaidx serve: listening on %s\n", path.c_str());
@@ -281,12 +279,11 @@ bool TakePidFile(const std::string& pid_file, bool detach) {
 
 int RunServe(int argc, char** argv) {
   Options options;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&options), argc, argv, &first);
-  if (status != kContinue) return status;
-  if (first < argc) {
-    return UsageError(kName,
-                      std::string("unexpected argument '") + argv[first] + "'");
+  std::vector<std::string> none;
+  if (int status = ParseCommand(MakeLine(&options), {"", 0, 0, nullptr}, argc,
+                                argv, &none);
+      status != kContinue) {
+    return status;
   }
   std::string& path = options.socket;
   std::string& pid_file = options.pid_file;
@@ -305,7 +302,7 @@ int RunServe(int argc, char** argv) {
   WaitForBoot();
   if (pid_file.empty()) return Serve(path);
   if (!TakePidFile(pid_file, detach)) return kExitError;
-  status = Serve(path);
+  int status = Serve(path);
   DeletePidFile(pid_file.c_str());
   return status;
 }

@@ -2,9 +2,11 @@
 //
 // `add` goes through WriteIndexQueue, so an entry already queued is not
 // queued twice. `trim` goes through TrimQueueHead, the library's consumer
-// side: it takes the queue's exclusive flock, removes the head with
-// FileRemoveHeadingLine and lets go. Every entry is checked before the first is
-// written, so a bad one leaves the queue as it was.
+// side: under the queue's exclusive flock it blanks the first N entries in
+// place, as the queue's daemon does with the entries it finished. Every
+// entry is checked before the first is written, so a bad one leaves the
+// queue as it was. An ENTRY "-" reads the
+// entries from standard input, one per line (or NUL-terminated, with -0).
 #include <errno.h>
 #include <limits.h>
 #include <stdio.h>
@@ -13,9 +15,11 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include "cli.h"
 #include "commands.h"
+#include "preview_queue.h"
 #include "quvaidx/spool_consumer.h"
 #include "quvaidx/system.h"
 
@@ -24,9 +28,9 @@ namespace {
 
 constexpr char kName[] = "spool";
 
-quvaidx_tools::CommandLine MakeLine() {
+quvaidx_tools::CommandLine MakeLine(bool* null_list) {
   return Subcommand(
-      kName, {"add  QUEUE ENTRY...", "trim QUEUE N"},
+      kName, {"add  QUEUE ENTRY...|-", "trim QUEUE N"},
       "Works on a spool queue: a text file of one entry per line, appended\n"
       "under an exclusive flock and consumed from its head.\n"
       "\n"
@@ -35,20 +39,22 @@ quvaidx_tools::CommandLine MakeLine() {
       "        not be empty, hold a line feed or exceed " +
           std::to_string(kMaxQueueEntry) +
           " bytes; when one\n"
-          "        does, nothing is added.\n"
+          "        does, nothing is added. With -, the entries are read "
+          "from\n        standard input, one per line.\n"
           "  trim  removes the first N lines (all of them when N is beyond "
           "the\n        end) while holding the queue's exclusive flock, as a "
           "consumer\n        does; waits for the lock as long as another "
           "process holds it\n",
-      {},
+      {NullOption(null_list)},
       "An ENTRY that starts with '-' goes after \"--\".\n"
       "\n"
       "Exit status: 0 on success, 2 on a usage error, a refused entry or a\n"
       "failed operation.\n"
       "\n"
-      "Example:\n"
-      "  quvaidx spool add /tmp/q.queue /share/Photos/2015 /share/Photos/2016\n"
-      "  quvaidx spool trim /tmp/q.queue 1\n");
+      "Examples:\n"
+      "  $ quvaidx spool add /tmp/q.queue /share/Photos/2015 "
+      "/share/Photos/2016\n"
+      "  $ quvaidx spool trim /tmp/q.queue 1\n");
 }
 
 // Why `entry` cannot be queued, or "" when it can.
@@ -65,47 +71,11 @@ std::string EntryProblem(const std::string& entry) {
   return "";
 }
 
-// The directory part of `path`: "." when it has none.
-std::string DirectoryOf(const std::string& path) {
-  size_t slash = path.rfind('/');
-  if (slash == std::string::npos) return ".";
-  if (slash == 0) return "/";
-  return path.substr(0, slash);
-}
-
-// Checks that QUEUE can be written, so that the library's open is not
-// refused: it retries a refused open for sixteen seconds. Prints one line
-// and returns false otherwise.
-bool CheckWritableQueue(const std::string& queue) {
-  struct stat st;
-  if (stat(queue.c_str(), &st) == 0) {
-    if (!S_ISREG(st.st_mode)) {
-      PrintError(kName, queue + " is not a regular file");
-      return false;
-    }
-    if (access(queue.c_str(), W_OK) != 0) {
-      PrintError(kName, queue + ": " + strerror(errno));
-      return false;
-    }
-    return true;
-  }
-  if (errno != ENOENT) {
-    PrintError(kName, queue + ": " + strerror(errno));
-    return false;
-  }
-  std::string dir = DirectoryOf(queue);
-  if (access(dir.c_str(), W_OK | X_OK) != 0) {
-    PrintError(kName,
-               "cannot create " + queue + ": " + dir + ": " + strerror(errno));
-    return false;
-  }
-  return true;
-}
-
-int Add(int count, char** args) {
-  if (count < 2) return UsageError(kName, "add needs QUEUE and an ENTRY");
-  std::string queue = args[0];
-  for (int i = 1; i < count; ++i) {
+// `args`: QUEUE and the entries.
+int Add(const std::vector<std::string>& args) {
+  if (args.size() < 2) return UsageError(kName, "add needs QUEUE and an ENTRY");
+  const std::string& queue = args[0];
+  for (size_t i = 1; i < args.size(); ++i) {
     std::string problem = EntryProblem(args[i]);
     if (!problem.empty()) {
       PrintError(kName, problem + " (entry " + std::to_string(i) +
@@ -113,28 +83,27 @@ int Add(int count, char** args) {
       return kExitError;
     }
   }
-  if (!CheckWritableQueue(queue)) return kExitError;
-  for (int i = 1; i < count; ++i) {
-    if (WriteIndexQueue(args[i], queue.c_str()) != 0) {
-      PrintError(kName, std::string("cannot add '") + args[i] + "' to " +
-                            queue + " (--verbose shows the library's report)");
+  if (!CheckWritableQueue(kName, queue)) return kExitError;
+  for (size_t i = 1; i < args.size(); ++i) {
+    if (WriteIndexQueue(args[i].c_str(), queue.c_str()) != 0) {
+      PrintError(kName, "cannot add '" + args[i] + "' to " + queue +
+                            " (--verbose shows the library's report)");
       return kExitError;
     }
   }
   return kExitOk;
 }
 
-int Trim(int count, char** args) {
-  if (count < 2) return UsageError(kName, "trim needs QUEUE and N");
-  if (count > 2) {
-    return UsageError(kName,
-                      std::string("unexpected argument '") + args[2] + "'");
+// `args`: QUEUE and N.
+int Trim(const std::vector<std::string>& args) {
+  if (args.size() < 2) return UsageError(kName, "trim needs QUEUE and N");
+  if (args.size() > 2) {
+    return UsageError(kName, "unexpected argument '" + args[2] + "'");
   }
-  const char* queue = args[0];
+  const char* queue = args[0].c_str();
   int lines = 0;
-  if (!ParseInt(args[1], 0, INT_MAX, &lines)) {
-    return UsageError(kName, std::string("N needs a whole number of lines "
-                                         "from 0 to ") +
+  if (!ParseInt(args[1].c_str(), 0, INT_MAX, &lines)) {
+    return UsageError(kName, "N needs a whole number of lines from 0 to " +
                                  std::to_string(INT_MAX) + ", not '" + args[1] +
                                  "'");
   }
@@ -149,11 +118,9 @@ int Trim(int count, char** args) {
   }
   // Under the queue's lock, following a queue another consumer replaced
   // while this one waited.
-  int result = TrimQueueHead(queue, lines);
-  if (result != 0) {
+  if (TrimQueueHead(queue, lines) != 0) {
     PrintError(kName, std::string("cannot trim ") + queue +
-                          ": the queue is unchanged, or a temporary file "
-                          "beside it was left behind");
+                          " (--verbose shows the library's report)");
     return kExitError;
   }
   return kExitOk;
@@ -162,15 +129,18 @@ int Trim(int count, char** args) {
 }  // namespace
 
 int RunSpool(int argc, char** argv) {
-  int first = 0;
-  int status = ParseArguments(MakeLine(), argc, argv, &first);
-  if (status != kContinue) return status;
-  int count = argc - first;
-  char** args = argv + first;
-  if (count < 1) return UsageError(kName, "missing the operation: add or trim");
-  std::string op = args[0];
-  if (op == "add") return Add(count - 1, args + 1);
-  if (op == "trim") return Trim(count - 1, args + 1);
+  bool null_list = false;
+  std::vector<std::string> args;
+  if (int status = ParseCommand(
+          MakeLine(&null_list),
+          {"the operation: add or trim", 1, -1, &null_list}, argc, argv, &args);
+      status != kContinue) {
+    return status;
+  }
+  const std::string op = args[0];
+  args.erase(args.begin());
+  if (op == "add") return Add(args);
+  if (op == "trim") return Trim(args);
   return UsageError(kName, "unknown operation '" + op + "'");
 }
 

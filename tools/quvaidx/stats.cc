@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include <json/json.h>
 
@@ -30,10 +31,10 @@ quvaidx_tools::CommandLine MakeLine(bool* json) {
       "PID (default: this tool's own process) and the machine's total\n"
       "memory, in kB, from /proc. A figure that cannot be read is shown as\n"
       "\"-\".\n",
-      {quvaidx_tools::Flag(
-          "json", 'j', json,
-          "print a JSON object with the members pid,\ndescriptors, rss_kb, "
-          "vmsize_kb and\nmem_total_kb (null when unreadable)")},
+      {JsonOption(json,
+                  "print a JSON object with the members pid,\ndescriptors, "
+                  "rss_kb, vmsize_kb and\nmem_total_kb (null when "
+                  "unreadable)")},
       "Exit status: 0, or 2 on a usage error or when no process PID "
       "exists.\n");
 }
@@ -64,19 +65,17 @@ Json::Value JsonNumber(long value) {
 
 int RunStats(int argc, char** argv) {
   bool json = false;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&json), argc, argv, &first);
-  if (status != kContinue) return status;
-  Figures figures = {static_cast<int>(getpid()), -1, -1, -1, -1};
-  if (argc - first > 1) {
-    return UsageError(
-        kName, std::string("unexpected argument '") + argv[first + 1] + "'");
+  std::vector<std::string> pid;
+  if (int status = ParseCommand(MakeLine(&json), {"PID", 0, 1, nullptr}, argc,
+                                argv, &pid);
+      status != kContinue) {
+    return status;
   }
-  if (first < argc && !ParseInt(argv[first], 1, INT_MAX, &figures.pid)) {
-    return UsageError(kName, std::string("PID needs a whole number from 1 "
-                                         "to ") +
-                                 std::to_string(INT_MAX) + ", not '" +
-                                 argv[first] + "'");
+  Figures figures = {static_cast<int>(getpid()), -1, -1, -1, -1};
+  if (!pid.empty() && !ParseInt(pid[0].c_str(), 1, INT_MAX, &figures.pid)) {
+    return UsageError(kName, "PID needs a whole number from 1 to " +
+                                 std::to_string(INT_MAX) + ", not '" + pid[0] +
+                                 "'");
   }
   if (!ProcessExists(figures.pid)) {
     PrintError(kName, "no process " + std::to_string(figures.pid));

@@ -14,6 +14,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include <json/json.h>
 
@@ -46,7 +47,7 @@ quvaidx_tools::CommandLine MakeLine(Request* r) {
   return Subcommand(
       kName,
       {"create PATH PROJECT [--size KIB]",
-       "push   PATH PROJECT JSON [--type N]",
+       "push   PATH PROJECT JSON|- [--type N]",
        "pop    PATH PROJECT [--type N] [--nowait [--attempts N]]",
        "count  PATH PROJECT", "delete PATH PROJECT"},
       "Works on the task queue named by the existing file PATH and the\n"
@@ -54,18 +55,19 @@ quvaidx_tools::CommandLine MakeLine(Request* r) {
       "\n"
       "  create  makes a fresh, empty queue (an old one under the same name\n"
       "          is discarded with its tasks) and prints its identifier\n"
-      "  push    adds the task JSON; waits while the queue is full\n"
+      "  push    adds the task JSON (-: read from standard input); waits\n"
+      "          while the queue is full\n"
       "  pop     takes one task off and prints it on one line; waits for\n"
       "          one unless --nowait is given\n"
       "  count   prints the number of tasks in the queue\n"
       "  delete  removes the queue, if there is one\n",
       {
-          Noted(Number("size", 's', "KIB", 1, kMaxSizeKib, &r->size_kib,
+          Noted(Number("size", 0, "KIB", 1, kMaxSizeKib, &r->size_kib,
                        "create: the queue's byte limit in KiB\n(default: "
                        "the system's; a limit the system\nrefuses is "
                        "silently not applied)"),
                 &r->size_given),
-          Noted(Number("type", 't', "N", -INT_MAX, INT_MAX, &r->type,
+          Noted(Number("type", 0, "N", -INT_MAX, INT_MAX, &r->type,
                        "push: the task's type, 1 or more (default 1);\n"
                        "pop: 0 takes the oldest task (default), N > 0\nthe "
                        "oldest of type N, N < 0 the oldest of the\nlowest "
@@ -81,11 +83,11 @@ quvaidx_tools::CommandLine MakeLine(Request* r) {
       "Exit status: 0 on success, 1 when pop found no task, 2 on a usage\n"
       "error, a missing key file or queue, or a failed operation.\n"
       "\n"
-      "Example:\n"
-      "  touch /tmp/q.key && quvaidx taskq create /tmp/q.key 7\n"
-      "  quvaidx taskq push /tmp/q.key 7 '{\"path\":\"/share/a.jpg\"}'\n"
-      "  quvaidx taskq pop /tmp/q.key 7 --nowait\n"
-      "  quvaidx taskq delete /tmp/q.key 7\n");
+      "Examples:\n"
+      "  $ touch /tmp/q.key && quvaidx taskq create /tmp/q.key 7\n"
+      "  $ quvaidx taskq push /tmp/q.key 7 '{\"path\":\"/share/a.jpg\"}'\n"
+      "  $ quvaidx taskq pop /tmp/q.key 7 --nowait\n"
+      "  $ quvaidx taskq delete /tmp/q.key 7\n");
 }
 
 std::string QueueName(const Request& request) {
@@ -118,17 +120,9 @@ int Create(const Request& request) {
 
 int Push(const Request& request) {
   Json::Value task;
-  if (!ParseJsonObject(kName, request.json, "task",
-                       "{\"path\":\"/share/a.jpg\"}", &task)) {
-    return kExitError;
-  }
-  size_t size = Json::FastWriter().write(task).size();
-  if (size > kMaxTaskText) {
-    PrintError(kName, "the task is " + std::to_string(size) +
-                          " bytes long; a queue carries at most " +
-                          std::to_string(kMaxTaskText));
-    return kExitError;
-  }
+  const JsonInput input = {"task", "{\"path\":\"/share/a.jpg\"}", kMaxTaskText,
+                           "a queue"};
+  if (!ReadJsonObject(kName, request.json, input, &task)) return kExitError;
   int id = OpenQueue(request);
   if (id < 0) return kExitError;
   if (PushTaskToQueue(id, task, request.type_given ? request.type : 1) != 0) {
@@ -216,7 +210,8 @@ int Delete(const Request& request) {
 
 // Checks the positional arguments and which options suit the operation.
 // Prints one error and returns false on a mistake.
-bool CheckRequest(Request* request, int count, char** args) {
+bool CheckRequest(Request* request, const std::vector<std::string>& args) {
+  const int count = static_cast<int>(args.size());
   if (count < 1) {
     UsageError(kName,
                "missing the operation: create, push, pop, count or "
@@ -238,14 +233,12 @@ bool CheckRequest(Request* request, int count, char** args) {
     return false;
   }
   if (count > wanted) {
-    UsageError(kName,
-               std::string("unexpected argument '") + args[wanted] + "'");
+    UsageError(kName, "unexpected argument '" + args[wanted] + "'");
     return false;
   }
   request->path = args[1];
-  if (!ParseInt(args[2], 1, 255, &request->project)) {
-    UsageError(kName, std::string("PROJECT needs a whole number from 1 to "
-                                  "255, not '") +
+  if (!ParseInt(args[2].c_str(), 1, 255, &request->project)) {
+    UsageError(kName, "PROJECT needs a whole number from 1 to 255, not '" +
                           args[2] + "'");
     return false;
   }
@@ -278,10 +271,13 @@ bool CheckRequest(Request* request, int count, char** args) {
 
 int RunTaskq(int argc, char** argv) {
   Request request;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&request), argc, argv, &first);
-  if (status != kContinue) return status;
-  if (!CheckRequest(&request, argc - first, argv + first)) return kExitError;
+  std::vector<std::string> args;
+  if (int status = ParseCommand(MakeLine(&request), {"", 0, -1, nullptr}, argc,
+                                argv, &args);
+      status != kContinue) {
+    return status;
+  }
+  if (!CheckRequest(&request, args)) return kExitError;
   const std::string& op = request.operation;
   if (op == "create") return Create(request);
   if (op == "push") return Push(request);

@@ -1,120 +1,102 @@
 // quvaidx thumb: asking the thumbnail or web-video daemon for previews.
 //
-// Each PATH goes to WriteThumbQueue by its canonical absolute path, since
-// the daemon reads the queue from a working directory of its own. The
-// paths and the daemon are checked first, so that a missing path or a
-// daemon that is not running is reported on one line and nothing at all is
+// Each PATH is queued by its canonical absolute path, since the daemon
+// reads the queue from a working directory of its own, and each gets one
+// line: what was queued (stdout) or why nothing was (stderr). The daemon
+// is checked first, so that when it is not running nothing at all is
 // queued.
-#include <errno.h>
 #include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
-#include <sys/stat.h>
 
 #include <string>
 #include <vector>
 
 #include "cli.h"
 #include "commands.h"
-#include "quvahost/quvahost.h"
+#include "preview_queue.h"
 #include "quvaidx/paths.h"
-#include "quvaidx/system.h"
 
 namespace quvaidx_cli {
 namespace {
 
 constexpr char kName[] = "thumb";
 
-// The daemons that serve the two queues, from the library's table of
-// well-known paths.
-struct PreviewDaemon {
-  const char* name;
-  const char* pid_file;
-  const char* queue;
-  const char* work;  // the kind of daemon, for messages
+struct Options {
+  PreviewTarget target;
+  bool null_list = false;
 };
-constexpr PreviewDaemon kPhotoDaemon = {
-    quvaidx::kThumbSpoolQueue.daemon, quvaidx::kThumbSpoolQueue.pid_file,
-    quvaidx::kThumbSpoolQueue.queue, "thumbnail"};
-constexpr PreviewDaemon kVideoDaemon = {
-    quvaidx::kFlvSpoolQueue.daemon, quvaidx::kFlvSpoolQueue.pid_file,
-    quvaidx::kFlvSpoolQueue.queue, "web-video"};
 
-quvaidx_tools::CommandLine MakeLine(bool* video) {
+quvaidx_tools::CommandLine MakeLine(Options* o) {
+  std::vector<quvaidx_tools::Option> options = {
+      quvaidx_tools::Flag("video", 0, &o->target.video,
+                          "queue web-video work instead of thumbnails"),
+      NullOption(&o->null_list)};
+  for (quvaidx_tools::Option& option : PreviewTargetOptions(&o->target, "")) {
+    options.push_back(std::move(option));
+  }
   return Subcommand(
-      kName, {"[--video] PATH..."},
+      kName, {"[--video] [OPTIONS] PATH...|-"},
       std::string("Queues preview work for each PATH, a directory or a "
                   "regular file, and\nwakes the daemon that does it:\n"
                   "  photos (default)  the folder of a web photo, or a "
                   "directory, goes to\n                    ") +
-          kPhotoDaemon.queue + " for " + kPhotoDaemon.name +
+          quvaidx::kThumbSpoolQueue.queue + " for " +
+          quvaidx::kThumbSpoolQueue.daemon +
           "\n  --video           a web video, or a directory, goes to\n"
           "                    " +
-          kVideoDaemon.queue + " for " + kVideoDaemon.name +
-          "\nFiles of no interest queue nothing. Paths are queued as "
-          "canonical\nabsolute paths. The daemon must be running (its pid "
-          "file names a live\nprocess); otherwise nothing is queued.\n",
-      {quvaidx_tools::Flag("video", 'V', video,
-                           "queue web-video work instead of thumbnails")},
-      "Exit status: 0 when every PATH was handled, 2 on a usage error, a\n"
-      "missing PATH, a daemon that is not running or a failed queue "
-      "write.\n");
-}
-
-// The canonical absolute path of `path`, which must name a directory or a
-// regular file. Prints one line and returns false otherwise.
-bool ResolvePath(const char* path, std::string* resolved) {
-  struct stat st;
-  if (stat(path, &st) != 0) {
-    PrintError(kName, std::string(path) + ": " + strerror(errno));
-    return false;
-  }
-  if (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode)) {
-    PrintError(kName, std::string(path) +
-                          " is neither a directory nor a regular file");
-    return false;
-  }
-  char* real = GetRealPath(path);
-  if (real == nullptr) {
-    PrintError(kName, std::string("cannot resolve ") + path);
-    return false;
-  }
-  *resolved = real;
-  free(real);
-  return true;
+          quvaidx::kFlvSpoolQueue.queue + " for " +
+          quvaidx::kFlvSpoolQueue.daemon +
+          "\nEach PATH gets one line: what was queued, on stdout, or why "
+          "nothing\nwas, on stderr (a file of no interest, a folder outside "
+          "every share,\na name holding a line feed). Paths are queued as "
+          "canonical absolute\npaths. With -, the PATHs are read from "
+          "standard input, one per line.\nThe daemon must be running (its "
+          "pid file names a live process);\notherwise nothing is queued.\n",
+      options,
+      "Exit status: 0 when something was queued for every PATH, 1 when\n"
+      "nothing was for some PATH, 2 on a usage error, a daemon that is not\n"
+      "running or a failed queue write.\n"
+      "\n"
+      "Examples:\n"
+      "  $ quvaidx thumb /share/Photos/2015\n"
+      "  $ find /share/Videos -name '*.mp4' -print0 | quvaidx thumb --video "
+      "-0 -\n");
 }
 
 }  // namespace
 
 int RunThumb(int argc, char** argv) {
-  bool video = false;
-  int first = 0;
-  int status = ParseArguments(MakeLine(&video), argc, argv, &first);
-  if (status != kContinue) return status;
-  if (first >= argc) return UsageError(kName, "missing PATH");
+  Options o;
   std::vector<std::string> paths;
-  for (int i = first; i < argc; ++i) {
-    std::string resolved;
-    if (!ResolvePath(argv[i], &resolved)) return kExitError;
-    paths.push_back(resolved);
+  if (int status = ParseCommand(MakeLine(&o), {"PATH", 1, -1, &o.null_list},
+                                argc, argv, &paths);
+      status != kContinue) {
+    return status;
   }
-  const PreviewDaemon& daemon = video ? kVideoDaemon : kPhotoDaemon;
-  // The library makes the same check, but reports it only to the system log.
-  if (QLIBCProcAliveByPidFile(daemon.pid_file) != 1) {
-    PrintError(kName, std::string("the ") + daemon.work + " daemon (" +
-                          daemon.name + ") is not running: " + daemon.pid_file +
-                          " names no live process; nothing was queued");
-    return kExitError;
-  }
-  const _tag_THUMB_TYPE_ type = video ? THUMB_TYPE_VIDEO : THUMB_TYPE_PHOTO;
+  PreviewQueuer queuer(kName, o.target);
+  if (!queuer.Ready()) return kExitError;
+  int status = kExitOk;
   for (const std::string& path : paths) {
-    if (WriteThumbQueue(path.c_str(), type) != 0) {
-      PrintError(kName, "cannot queue " + path + " for " + daemon.name +
-                            " (--verbose shows the library's report)");
-      return kExitError;
+    std::string resolved, report;
+    PreviewQueuer::Outcome outcome = PreviewQueuer::kRefused;
+    if (ResolvePath(kName, path, &resolved)) {
+      outcome = queuer.Queue(resolved, &report);
+    }
+    if (outcome == PreviewQueuer::kQueued) {
+      printf("queued %s for %s\n", report.c_str(), queuer.daemon());
+      fflush(stdout);  // in step with the refusals on stderr
+      continue;
+    }
+    status = kExitFalse;
+    if (!report.empty())
+      PrintError(kName, "not queued: " + path + ": " + report);
+    if (outcome == PreviewQueuer::kFailed) {
+      status = kExitError;
+      break;
     }
   }
-  return kExitOk;
+  fflush(stdout);
+  queuer.Wake();
+  return status;
 }
 
 }  // namespace quvaidx_cli

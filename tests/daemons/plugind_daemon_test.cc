@@ -1,0 +1,434 @@
+// The plug-in daemon as a real process on a private socket: asked with the
+// library's typed requests (pointed at it through the library's socket
+// seam), and by processes of other users (forked, with ids no file here
+// belongs to) about root-only files, 0700 folders, links planted in the
+// metadata directory and other users' folders; its loop answering at once
+// while requests wait on a media parser that never answers.
+//
+// Map: helpers; typed requests; answers for other users; convert records;
+// a stuck media parser.
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <stdio.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "daemon_process.h"
+#include "fs_identity.h"
+#include "quvaidx/daemon.h"
+#include "quvaidx/index_requests.h"
+#include "quvaidx/ipc.h"
+#include "requests/index_requests_internal.h"
+#include "support/fake_host.h"
+#include "support/fd_check.h"
+#include "support/scripted_peer.h"
+#include "support/unprivileged.h"
+
+namespace {
+
+using quvahost::test::FakeHost;
+using quvahost::test::HostOp;
+using quvaidx::daemon_test::DaemonProcess;
+using quvaidx::test::ListenUnix;
+using quvaidx::test::ReadFile;
+using quvaidx::test::RunAsUser;
+using quvaidx::test::ScriptedPeer;
+using quvaidx::test::TempDir;
+using quvaidx::test::WriteFile;
+using Clock = std::chrono::steady_clock;
+
+// Users no file here belongs to and the user database does not know.
+constexpr unsigned kAlice = 48221;
+constexpr unsigned kMallory = 48222;
+
+bool Exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
+
+Json::Value Request(const std::string& command, const std::string& path = "") {
+  Json::Value request(Json::objectValue);
+  request["command"] = command;
+  if (!path.empty()) {
+    request["path"] = path;
+    request["type"] = 1;
+  }
+  return request;
+}
+
+Json::Value ConvertAdd(const std::string& video, const std::string& copy) {
+  Json::Value request = Request("INDEX_CONVERT_ADD");
+  request["src"]["szPath"] = video;
+  request["src"]["szTitle"] = "the user's text";
+  request["convert"]["szPath"] = copy;
+  return request;
+}
+
+// A connection to the daemon on which requests are sent and replies read
+// one by one.
+class Client {
+ public:
+  explicit Client(const std::string& socket)
+      : fd_(ConnectPeer(socket.c_str(), false, 1)) {}
+  ~Client() { DisconnectPeer(fd_); }
+  bool Send(Json::Value request) { return SendPacket(fd_, request) == 0; }
+  // The next reply, or null when none came within `ms`.
+  Json::Value Reply(int ms) {
+    struct pollfd ready = {fd_, POLLIN, 0};
+    Json::Value reply;
+    if (poll(&ready, 1, ms) == 1) RecvPacket(fd_, reply);
+    return reply;
+  }
+
+ private:
+  int fd_;
+};
+
+// The daemon on a private socket open to everyone, in a directory tree
+// everyone may search, with a scripted media parser beside it when a test
+// asks for one.
+class PluginDaemonTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to ask as other users";
+    ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
+    std::filesystem::create_directories(dir_.File("share"));
+  }
+
+  bool Start(std::vector<std::string> more = {}) {
+    std::vector<std::string> args = {
+        "--foreground",  "--stderr", "--socket",       socket_,
+        "--pidfile",     pid_file_,  "--media-parser", media_,
+        "--socket-mode", "0666"};
+    args.insert(args.end(), more.begin(), more.end());
+    return daemon_.Start(PLUGIND_PATH, args, dir_.path(), "plugind",
+                         "listening");
+  }
+
+  // The reply to `request` asked by a process of `uid` (its group the same
+  // number) holding `groups`; null when the exchange failed.
+  Json::Value AskAs(unsigned uid, const Json::Value& request,
+                    const std::vector<unsigned>& groups = {}) {
+    int pipe_fds[2];
+    if (pipe(pipe_fds) != 0) return Json::Value();
+    int status = RunAsUser(uid, uid, groups, [&] {
+      close(pipe_fds[0]);
+      Json::Value value = request;
+      if (AutoSendRecvPacketBySocketPath(socket_.c_str(), value, 1) != 0) {
+        return 1;
+      }
+      const std::string text = Json::FastWriter().write(value);
+      return write(pipe_fds[1], text.data(), text.size()) ==
+                     static_cast<ssize_t>(text.size())
+                 ? 0
+                 : 1;  // a pipe takes it whole: the reply is a packet
+    });
+    close(pipe_fds[1]);
+    std::string text;
+    char buffer[4096];
+    for (ssize_t n; (n = read(pipe_fds[0], buffer, sizeof(buffer))) > 0;) {
+      text.append(buffer, static_cast<size_t>(n));
+    }
+    close(pipe_fds[0]);
+    Json::Value reply;
+    if (status != 0 || !Json::Reader().parse(text, reply)) return Json::Value();
+    return reply;
+  }
+
+  // A media parser that, as the real one, reads a file only as the process
+  // that asks could (its credentials and groups from the connection), and
+  // reports the file's first line as the video codec, having first run
+  // `meanwhile` (as a swap of the path); it counts the questions.
+  void ScriptParser(std::function<void()> meanwhile = nullptr) {
+    parser_ = std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd,
+                                                                       int) {
+      Json::Value request;
+      if (RecvPacket(fd, request) != 0) return;
+      ++asked_;
+      if (meanwhile) meanwhile();
+      struct ucred peer;
+      socklen_t length = sizeof(peer);
+      quvaidx_daemons::FsUser user;
+      user.groups.resize(64);
+      socklen_t groups = 64 * sizeof(gid_t);
+      getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length);
+      getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, user.groups.data(), &groups);
+      user.groups.resize(groups / sizeof(gid_t));
+      user.uid = peer.uid;
+      user.gid = peer.gid;
+      std::string content;
+      {
+        quvaidx_daemons::FsIdentity as_peer(user);
+        if (as_peer.taken()) content = ReadFile(request["path"].asString());
+      }
+      Json::Value reply = MakeResponse(!content.empty(), nullptr);
+      if (content.empty()) reply["reason"] = "Permission denied";
+      reply["media"]["szVideoCodec"] = content.substr(0, content.find('\n'));
+      SendPacket(fd, reply);
+    });
+    chmod(media_.c_str(), 0666);  // as its socket unit leaves it
+  }
+
+  // Makes `path` (and its folders) with `content`, owned by `uid`, mode
+  // `mode`.
+  void Make(const std::string& path, const std::string& content, unsigned uid,
+            mode_t mode) {
+    std::filesystem::create_directories(
+        std::filesystem::path(path).parent_path());
+    WriteFile(path, content);
+    ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
+    ASSERT_EQ(chmod(path.c_str(), mode), 0);
+  }
+  void MakeDir(const std::string& path, unsigned uid, mode_t mode) {
+    std::filesystem::create_directories(path);
+    ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
+    ASSERT_EQ(chmod(path.c_str(), mode), 0);
+  }
+
+  TempDir dir_;
+  std::string socket_ = dir_.File("plugind.sock");
+  std::string pid_file_ = dir_.File("plugind.pid");
+  std::string media_ = dir_.File("mediaparser.sock");
+  DaemonProcess daemon_;
+  std::unique_ptr<ScriptedPeer> parser_;
+  std::atomic<int> asked_{0};
+};
+
+// ---------------------------------------------------------------------------
+// Typed requests
+
+// The daemon answers what the library's typed requests send, and the
+// library reads its answers; SIGTERM ends it with its socket and pid file
+// gone.
+TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
+  const std::string photo = dir_.File("share/a.jpg");
+  const std::string video = dir_.File("share/clip.mkv");
+  const std::string ea = dir_.File("share/.quvameta/");
+  const std::string copy = ea + "clip.mkv/QUVAPHOTO_FILM_M.mp4";
+  Make(photo, "photo", 0, 0644);
+  Make(video, "hevc\n", 0, 0644);
+  const quvaidx::IndexSockets previous =
+      quvaidx::SetIndexSockets({media_.c_str(), socket_.c_str()});
+  // Plug-ins are named only while their pid file names a live process:
+  // not when it is missing (web_video) or names a dead one.
+  WriteFile(dir_.File("quvamkthumbd.pid"), std::to_string(getpid()));
+  WriteFile(dir_.File("dead.pid"), "999999999");
+  ASSERT_TRUE(
+      Start({"--plugin", "photo_thumbnail=" + dir_.File("quvamkthumbd.pid"),
+             "--plugin", "web_video=" + dir_.File("quvamkflvd.pid"), "--plugin",
+             "other=" + dir_.File("dead.pid")}))
+      << daemon_.Errors();
+
+  const std::string jpeg(64, 'j');
+  Make(ea + "a.jpg/QUVAPHOTO_THUMB_XL.jpg", jpeg, 0, 0644);
+  Make(ea + "a.jpg/QUVAPHOTO:THUMB_S.jpg", jpeg, 0, 0644);
+  int map = -1;
+  EXPECT_EQ(QUVAIDX_GetThumbSizeMap(photo.c_str(), THUMB_TYPE_PHOTO, &map), 0);
+  EXPECT_EQ(map, 0x9);
+  map = -1;
+  EXPECT_EQ(QUVAIDX_GetDirThumbSizeMap(dir_.File("share").c_str(),
+                                       THUMB_TYPE_PHOTO, &map),
+            0);
+  EXPECT_EQ(map, 0x9);
+
+  ScriptParser();
+  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 1);
+  Make(copy, "converted video", 0, 0644);
+  EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 0);
+  static __tag_QUVA_MEDIA_INFO source;
+  static __tag_QUVA_MEDIA_INFO converted;
+  snprintf(source.szPath, sizeof(source.szPath), "%s", video.c_str());
+  snprintf(converted.szPath, sizeof(converted.szPath), "%s", copy.c_str());
+  EXPECT_EQ(QUVAIDX_IndexConvertAdd(&source, &converted, Json::Value("job 7")),
+            0);
+  Json::Value record;
+  ASSERT_TRUE(Json::Reader().parse(ReadFile(copy + ".json"), record));
+  EXPECT_EQ(record["conversion_type"], "CONVERTA_MEDIUM");
+  EXPECT_EQ(record["package"], "job 7");
+
+  FakeHost host;  // the index daemon counts as alive for this process
+  host.Answer(HostOp::kProcAliveByPidFile, {1});
+  Json::Value names;
+  EXPECT_EQ(QUVAIDX_GetAllPluginName(names), 0);
+  Json::Value expected(Json::arrayValue);
+  expected.append("photo_thumbnail");
+  EXPECT_EQ(names, expected);
+
+  ASSERT_TRUE(daemon_.Signal(SIGTERM));
+  EXPECT_TRUE(daemon_.WaitExit(10));
+  EXPECT_FALSE(Exists(socket_));
+  EXPECT_FALSE(Exists(pid_file_));
+  quvaidx::SetIndexSockets(previous);
+}
+
+// ---------------------------------------------------------------------------
+// Answers for other users
+
+// A user learns through the daemon only what it could read itself: not
+// whether files in a 0700 folder exist, not the names of the photos there,
+// not the thumbnails behind a link planted towards them, not the codecs of
+// a root-only video (the media parser is not even asked), nor those of one
+// swapped in by name while the media parser is asked (it is asked as the
+// user). What it may read is answered, by the groups its process holds;
+// root as before.
+TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
+  const std::string jpeg(64, 'j');
+  const std::string mine = dir_.File("share/mallory/clip.mkv");
+  MakeDir(dir_.File("share/private"), 0, 0700);
+  Make(dir_.File("share/private/secret.jpg"), "photo", 0, 0644);
+  Make(dir_.File("share/private/.quvameta/secret.jpg/QUVAPHOTO_THUMB_XL.jpg"),
+       jpeg, 0, 0644);
+  Make(dir_.File("share/private/clip.mkv"), "hevc\n", 0, 0644);
+  Make(dir_.File("share/root.mkv"), "root's codec\n", 0, 0600);
+  Make(dir_.File("share/group.mkv"), "group's codec\n", 0, 0640);
+  ASSERT_EQ(chown(dir_.File("share/group.mkv").c_str(), 0, 48300), 0);
+  MakeDir(dir_.File("share/mallory"), kMallory, 0755);
+  Make(dir_.File("share/mallory/secret.jpg"), "photo", kMallory, 0644);
+  Make(mine, "mallory's codec\n", kMallory, 0644);
+  ASSERT_EQ(symlink(dir_.File("share/private/.quvameta").c_str(),
+                    dir_.File("share/mallory/.quvameta").c_str()),
+            0);
+  ScriptParser([&] {  // the name now leads to root's video
+    unlink(mine.c_str());
+    symlink(dir_.File("share/root.mkv").c_str(), mine.c_str());
+  });
+  ASSERT_TRUE(Start()) << daemon_.Errors();
+
+  for (const Json::Value& request : {
+           Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("share/private")),
+           Request("GET_THUMB_SIZE_MAP", dir_.File("share/private/secret.jpg")),
+           Request("GET_THUMB_SIZE_MAP", dir_.File("share/private/gone.jpg")),
+           Request("IS_VIDEO_NEED_CONVERT",
+                   dir_.File("share/private/clip.mkv")),
+           Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/root.mkv")),
+           Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/group.mkv")),
+       }) {
+    EXPECT_EQ(AskAs(kMallory, request),
+              MakeResponse(false, "Permission denied"))
+        << request;
+  }
+  EXPECT_EQ(asked_, 0);
+  Json::Value reply = AskAs(
+      kMallory,
+      Request("GET_THUMB_SIZE_MAP", dir_.File("share/mallory/secret.jpg")));
+  EXPECT_EQ(reply["size_map"], 0) << reply;
+  reply = AskAs(kMallory, Request("IS_VIDEO_NEED_CONVERT", mine));
+  EXPECT_EQ(reply, MakeResponse(false,
+                                "the media parser cannot read the "
+                                "file: Permission denied"));
+  reply = AskAs(kMallory,
+                Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/group.mkv")),
+                {48300});
+  EXPECT_EQ(reply["video_codec"], "group's codec") << reply;
+  reply =
+      AskAs(0, Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("share/private")));
+  EXPECT_EQ(reply["size_map"], 0x8);
+  EXPECT_EQ(reply["photo"], dir_.File("share/private/secret.jpg"));
+}
+
+// ---------------------------------------------------------------------------
+// Convert records
+
+// A record is written only by a peer that may write into the video's EA
+// directory, and belongs to it: never into another user's folder, whether
+// named outright or through an EA directory planted as a link to it.
+TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
+  const std::string alice = dir_.File("share/alice");
+  const std::string mallory = dir_.File("share/mallory");
+  const std::string copy = alice + "/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4";
+  for (const char* dir : {"", "/.quvameta", "/.quvameta/a.mkv"}) {
+    MakeDir(alice + dir, kAlice, 0755);
+  }
+  Make(alice + "/a.mkv", "video", kAlice, 0644);
+  Make(copy, "converted video", kAlice, 0644);
+  MakeDir(mallory + "/.quvameta", kMallory, 0755);
+  Make(mallory + "/a.mkv", "video", kMallory, 0644);
+  ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
+                    (mallory + "/.quvameta/a.mkv").c_str()),
+            0);
+  ASSERT_TRUE(Start()) << daemon_.Errors();
+
+  Json::Value reply = AskAs(kMallory, ConvertAdd(alice + "/a.mkv", copy));
+  EXPECT_EQ(reply["reason"], "cannot create the record: Permission denied");
+  reply = AskAs(kMallory,
+                ConvertAdd(mallory + "/a.mkv",
+                           mallory + "/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4"));
+  EXPECT_EQ(reply["reason"], "no EA directory beside " + mallory +
+                                 "/a.mkv: a link is in the way");
+  EXPECT_FALSE(Exists(copy + ".json"));
+
+  reply = AskAs(kAlice, ConvertAdd(alice + "/a.mkv", copy));
+  ASSERT_EQ(reply["record"], copy + ".json") << reply;
+  struct stat st;
+  ASSERT_EQ(stat((copy + ".json").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, kAlice);
+  EXPECT_EQ(st.st_mode & 0777, 0644u);
+  EXPECT_NE(ReadFile(copy + ".json").find("the user's text"),
+            std::string::npos);
+}
+
+// ---------------------------------------------------------------------------
+// A stuck media parser
+
+// While requests wait on a media parser that accepts and never answers, a
+// HANDSHAKE is answered at once; a request beyond the bound is refused at
+// once; a connection's own later request waits for its earlier one; each
+// waiting request fails after the media parser's time; SIGTERM ends the
+// daemon at once however many wait.
+TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
+  Make(dir_.File("share/clip.mkv"), "video", 0, 0644);
+  int stuck = ListenUnix(media_, 64);
+  ASSERT_GE(stuck, 0);
+  ASSERT_TRUE(Start(
+      {"--workers", "5", "--max-requests", "5", "--media-parser-timeout", "3"}))
+      << daemon_.Errors();
+  const Json::Value convert =
+      Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/clip.mkv"));
+  std::vector<std::unique_ptr<Client>> waiting;
+  for (int i = 0; i < 4; ++i) {
+    waiting.push_back(std::make_unique<Client>(socket_));
+    ASSERT_TRUE(waiting.back()->Send(convert));
+  }
+  const std::string timed_out = "the media parser does not answer (timed out)";
+  {
+    Client ordered(socket_);  // the fifth; its HANDSHAKE waits behind it
+    ASSERT_TRUE(ordered.Send(convert) && ordered.Send(Request("HANDSHAKE")));
+    usleep(200 * 1000);  // all five taken
+    Client refused(socket_);
+    ASSERT_TRUE(refused.Send(convert));
+    const auto start = Clock::now();
+    Client asking(socket_);
+    ASSERT_TRUE(asking.Send(Request("HANDSHAKE")));
+    EXPECT_EQ(asking.Reply(1000), MakeResponse(true, nullptr));
+    EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(500));
+    EXPECT_EQ(refused.Reply(500)["reason"],
+              "busy: 5 requests are being answered; try again later");
+    EXPECT_TRUE(ordered.Reply(100).isNull());
+    EXPECT_EQ(ordered.Reply(5000)["reason"], timed_out);
+    EXPECT_GE(Clock::now() - start, std::chrono::milliseconds(2500));
+    EXPECT_EQ(ordered.Reply(500), MakeResponse(true, nullptr));
+  }
+  for (auto& client : waiting) {
+    EXPECT_EQ(client->Reply(500)["reason"], timed_out);
+    ASSERT_TRUE(client->Send(convert));
+  }
+  usleep(100 * 1000);  // the other clients gone, these four waiting
+  const auto stopping = Clock::now();
+  ASSERT_TRUE(daemon_.Signal(SIGTERM));
+  EXPECT_TRUE(daemon_.WaitExit(5)) << daemon_.Errors();
+  EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(1500));
+  close(stuck);
+}
+
+}  // namespace
