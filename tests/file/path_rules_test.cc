@@ -28,28 +28,23 @@ using quvaidx::test::TempDir;
 // Reserved names are skipped exactly; a recycle bin counts only right after
 // the share name.
 TEST(PathNames, ReservedEntriesAndRecycleBins) {
-  const struct {
-    const char* name;
-    int index;
-  } names[] = {{".", 0},          {"..", 0},         {"...", 1},
-               {"Photos.app", 0}, {".app", 0},       {"Photos.APP", 1},
-               {"a.app.mp4", 1},  {"a.apps", 1},     {"._", 0},
-               {"._x.jpg", 0},    {".hidden", 1},    {"a._b", 1},
-               {"#recycle", 0},   {"#recycle2", 1},  {"#Recycle", 1},
-               {"#snapshot", 0},  {"#snapshots", 1}, {"#Snapshot", 1},
-               {"x#snapshot", 1}, {".quvameta", 0},  {".quvameta2", 1}};
-  for (const auto& c : names)
-    EXPECT_EQ(c.index, EntryNameShouldIndex(c.name)) << c.name;
+  const std::pair<const char*, int> names[] = {
+      {".", 0},          {"..", 0},         {"...", 1},
+      {"Photos.app", 0}, {".app", 0},       {"Photos.APP", 1},
+      {"a.app.mp4", 1},  {"a.apps", 1},     {"._", 0},
+      {"._x.jpg", 0},    {".hidden", 1},    {"a._b", 1},
+      {"#recycle", 0},   {"#recycle2", 1},  {"#Recycle", 1},
+      {"#snapshot", 0},  {"#snapshots", 1}, {"#Snapshot", 1},
+      {"x#snapshot", 1}, {".quvameta", 0},  {".quvameta2", 1}};
+  for (const auto& [name, index] : names)
+    EXPECT_EQ(index, EntryNameShouldIndex(name)) << name;
   EXPECT_EQ(0, EntryNameShouldIndex(nullptr));
-  const struct {
-    const char* path;
-    int under;
-  } paths[] = {
+  const std::pair<const char*, int> paths[] = {
       {"/vol1/video/#recycle", 1},    {"/vol1/video/#recycle/a.mp4", 1},
       {"/vol1/video/#recyclebin", 0}, {"/vol1/video/#Recycle", 0},
       {"/vol1/video/a/#recycle", 0},  {"/vol1/#recycle", 0}};
-  for (const auto& c : paths)
-    EXPECT_EQ(c.under, QUVAPathUnderRecyle(c.path)) << c.path;
+  for (const auto& [path, under] : paths)
+    EXPECT_EQ(under, QUVAPathUnderRecyle(path)) << path;
   EXPECT_EQ(0, QUVAPathUnderRecyle(nullptr));
 }
 

@@ -8,6 +8,7 @@
 #include <syslog.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -89,24 +90,23 @@ TEST_F(ShareFolderTest, DefaultSharesAreThreeNamesInAnyCase) {
 }
 
 TEST_F(ShareFolderTest, ShareRelativePathsBecomeDiskPaths) {
-  const struct {
-    const char* path;
-    int out_size;
-    const char* out;  // "untouched": -1
-  } cases[] = {{"/video/movies/a.mkv", 64, "/vol1/video/movies/a.mkv"},
-               {"/video/a", 8, "/vol1/v"},  // cut to the out size
-               {"/video/", 64, "/vol1/video"},
-               {"/video", 64, "/vol1/video"},
-               {"/Video/a", 64, "untouched"},
-               {"/music/a", 64, "untouched"},
-               {"video/a", 64, "untouched"},  // not share-relative
-               {"/video/a", 0, "untouched"}};
-  for (const auto& c : cases) {
+  // The path, the out size, what is written ("untouched": -1); a path
+  // without a share name is not share-relative, the out size cuts.
+  const std::tuple<const char*, int, const char*> cases[] = {
+      {"/video/movies/a.mkv", 64, "/vol1/video/movies/a.mkv"},
+      {"/video/a", 8, "/vol1/v"},
+      {"/video/", 64, "/vol1/video"},
+      {"/video", 64, "/vol1/video"},
+      {"/Video/a", 64, "untouched"},
+      {"/music/a", 64, "untouched"},
+      {"video/a", 64, "untouched"},
+      {"/video/a", 0, "untouched"}};
+  for (const auto& [path, out_size, written] : cases) {
     char out[64] = "untouched";
-    EXPECT_EQ(QUVAIndexSharePathGet(c.path, out, c.out_size),
-              strcmp(c.out, "untouched") ? 0 : -1)
-        << c.path;
-    EXPECT_STREQ(out, c.out) << c.path;
+    EXPECT_EQ(QUVAIndexSharePathGet(path, out, out_size),
+              strcmp(written, "untouched") ? 0 : -1)
+        << path;
+    EXPECT_STREQ(out, written) << path;
   }
   EXPECT_EQ(QUVAIndexSharePathGet(nullptr, nullptr, 64), -1);
   host_.Fail(HostOp::kShareGet, EIO);

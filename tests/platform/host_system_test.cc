@@ -24,15 +24,13 @@ namespace {
 TEST(BootStepTest, FileContents) {
   HostEtc etc;
   EXPECT_EQ(QUVASystemGetBootStep(), QUVA_BOOT_STEP_READY);  // no file
-  const struct {
-    const char* text;
-    int step;
-  } cases[] = {{" 3 \r\n", 3}, {"0", 0},    {"", -1},
-               {"four", -1},   {"4 4", -1}, {"2147483648", -1}};
-  for (const auto& c : cases) {
-    WriteFile(etc.File("boot_step"), c.text);
-    EXPECT_EQ(QUVASystemGetBootStep(), c.step) << c.text;
-    EXPECT_TRUE(c.step >= 0 || QLIBCErrGet() == EINVAL);
+  const std::pair<const char*, int> cases[] = {
+      {" 3 \r\n", 3}, {"0", 0},    {"", -1},
+      {"four", -1},   {"4 4", -1}, {"2147483648", -1}};
+  for (const auto& [text, step] : cases) {
+    WriteFile(etc.File("boot_step"), text);
+    EXPECT_EQ(QUVASystemGetBootStep(), step) << text;
+    EXPECT_TRUE(step >= 0 || QLIBCErrGet() == EINVAL);
   }
   HostEtc other;  // the directory is looked up on every call
   ASSERT_EQ(mkdir(other.File("boot_step").c_str(), 0755), 0);

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <string>
+#include <tuple>
 
 #include "support/fake_host.h"
 
@@ -59,33 +60,32 @@ Found Get(const char* key, bool by_path = false) {
 // Only the first section of a name counts; a share with a bad path or
 // status is not found.
 TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
-  const struct {
-    const char *name, *path;  // path null: not found
-    unsigned status;
-  } cases[] = {{"video", "/vol1/video", 0x20},
-               {"movies", "/vol1/video/movies", 0},
-               {"music", "/vol1/music", 1},
-               {"hex", "/h", 0x2A},
-               {"max", "/m", 0xFFFFFFFF},
-               {"hexA", "/h", 0xAF},
-               {"hexF", "/h", 0xFA},
-               {"hexG", nullptr, 0},
-               {"long", nullptr, 0},
-               {"Video", nullptr, 0},
-               {"broken-relative", nullptr, 0},
-               {"broken-dotdot", nullptr, 0},
-               {"broken-status", nullptr, 0},
-               {"no-path", nullptr, 0},
-               {"over", nullptr, 0},
-               {"neg", nullptr, 0},
-               {"two", nullptr, 0},
-               {"empty", nullptr, 0}};
-  for (const auto& c : cases) {
-    Found found = Get(c.name);
-    EXPECT_EQ(found.result, c.path ? 0 : -1) << c.name;
-    EXPECT_EQ(found.path, c.path ? c.path : "") << c.name;
-    EXPECT_EQ(found.status, c.status) << c.name;
-    EXPECT_TRUE(c.path || QLIBCErrGet() == ENOENT) << c.name;
+  // name, path (null: not found), status
+  const std::tuple<const char*, const char*, unsigned> cases[] = {
+      {"video", "/vol1/video", 0x20},
+      {"movies", "/vol1/video/movies", 0},
+      {"music", "/vol1/music", 1},
+      {"hex", "/h", 0x2A},
+      {"max", "/m", 0xFFFFFFFF},
+      {"hexA", "/h", 0xAF},
+      {"hexF", "/h", 0xFA},
+      {"hexG", nullptr, 0},
+      {"long", nullptr, 0},
+      {"Video", nullptr, 0},
+      {"broken-relative", nullptr, 0},
+      {"broken-dotdot", nullptr, 0},
+      {"broken-status", nullptr, 0},
+      {"no-path", nullptr, 0},
+      {"over", nullptr, 0},
+      {"neg", nullptr, 0},
+      {"two", nullptr, 0},
+      {"empty", nullptr, 0}};
+  for (const auto& [name, path, status] : cases) {
+    Found found = Get(name);
+    EXPECT_EQ(found.result, path ? 0 : -1) << name;
+    EXPECT_EQ(found.path, path ? path : "") << name;
+    EXPECT_EQ(found.status, status) << name;
+    EXPECT_TRUE(path || QLIBCErrGet() == ENOENT) << name;
   }
   unlink(Db().c_str());
   EXPECT_EQ(Get("video").result, -1);
@@ -93,16 +93,15 @@ TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
 }
 
 TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
-  const struct {
-    const char* path;
-    const char* share;  // "": no share holds it
-  } cases[] = {{"/vol1/video//a.mkv", "video"},
-               {"/vol1/videos/a.mkv", ""},
-               {"/vol1/video/./movies/x", "movies"},
-               {"/vol1/video/../music", ""},
-               {"vol1/video", ""}};
-  for (const auto& c : cases)
-    EXPECT_EQ(Get(c.path, true).name, c.share) << c.path;
+  const std::pair<const char*, const char*> cases[] = {
+      // "": no share
+      {"/vol1/video//a.mkv", "video"},
+      {"/vol1/videos/a.mkv", ""},
+      {"/vol1/video/./movies/x", "movies"},
+      {"/vol1/video/../music", ""},
+      {"vol1/video", ""}};
+  for (const auto& [path, share] : cases)
+    EXPECT_EQ(Get(path, true).name, share) << path;
   WriteFile(Db(), "[root]\npath = /\n[a]\npath = /a\n");
   EXPECT_EQ(Get("/b/c", true).name, "root");
   EXPECT_EQ(Get("/a/c", true).name, "a");
@@ -113,19 +112,17 @@ TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
 TEST_F(ShareDbTest, NamesAndPathsFitTheRecord) {
   const std::string name(QUVA_SHARE_NAME_SIZE - 1, 'n');
   const std::string path = "/" + std::string(QUVA_SHARE_PATH_SIZE - 2, 'p');
-  const struct {
-    std::string name, path;
-    int result;
-  } cases[] = {{name, "/a", 0},
-               {name + "n", "/a", -1},
-               {"p", path, 0},
-               {"p", path + "p", -1}};
-  for (const auto& c : cases) {
-    WriteFile(Db(), "[" + c.name + "]\npath = " + c.path + "\n");
-    Found found = Get(c.name.c_str());
-    EXPECT_EQ(found.result, c.result) << c.name.size() << " " << c.path.size();
-    EXPECT_EQ(found.path, c.result == 0 ? c.path : "");
-    EXPECT_TRUE(c.result == 0 || QLIBCErrGet() == ENOENT);
+  const std::tuple<std::string, std::string, int> cases[] = {
+      {name, "/a", 0},
+      {name + "n", "/a", -1},
+      {"p", path, 0},
+      {"p", path + "p", -1}};
+  for (const auto& [share, share_path, result] : cases) {
+    WriteFile(Db(), "[" + share + "]\npath = " + share_path + "\n");
+    Found found = Get(share.c_str());
+    EXPECT_EQ(found.result, result) << share.size() << " " << share_path.size();
+    EXPECT_EQ(found.path, result == 0 ? share_path : "");
+    EXPECT_TRUE(result == 0 || QLIBCErrGet() == ENOENT);
   }
 }
 

@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -136,18 +137,15 @@ TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
 // file is refused at once: a trimmer must not wait on a FIFO planted at a
 // queue path for a writer that never comes.
 TEST_F(FileTest, TrimDropsTheFirstLines) {
-  const struct {
-    std::string text;
-    int n;
-    std::string left;
-  } kCases[] = {{"a\nb\nc\n", 1, "b\nc\n"},
-                {"a\nb\n", 0, "a\nb\n"},
-                {"a\nb\n", -4, "a\nb\n"},
-                {"a\nb\n", 99, ""},
-                {"a\nb\nlast", 2, "last"},
-                {"\n\nx\n", 2, "x\n"},
-                {std::string(200000, 'f') + "\n" + std::string(70000, 's'), 1,
-                 std::string(70000, 's')}};  // across copy blocks
+  const std::tuple<std::string, int, std::string> kCases[] = {
+      {"a\nb\nc\n", 1, "b\nc\n"},
+      {"a\nb\n", 0, "a\nb\n"},
+      {"a\nb\n", -4, "a\nb\n"},
+      {"a\nb\n", 99, ""},
+      {"a\nb\nlast", 2, "last"},
+      {"\n\nx\n", 2, "x\n"},
+      {std::string(200000, 'f') + "\n" + std::string(70000, 's'), 1,
+       std::string(70000, 's')}};  // across copy blocks
   WriteFile(source_, "");
   ASSERT_EQ(chmod(source_.c_str(), 02640), 0);
   ASSERT_EQ(
@@ -155,10 +153,10 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
       0);
   struct stat before, after;
   ASSERT_EQ(stat(source_.c_str(), &before), 0);
-  for (const auto& c : kCases) {
-    WriteFile(source_, c.text);
-    ASSERT_EQ(FileRemoveHeadingLine(source_.c_str(), c.n), 0);
-    EXPECT_EQ(ReadFile(source_), c.left) << c.text.substr(0, 9) << " " << c.n;
+  for (const auto& [text, n, left] : kCases) {
+    WriteFile(source_, text);
+    ASSERT_EQ(FileRemoveHeadingLine(source_.c_str(), n), 0);
+    EXPECT_EQ(ReadFile(source_), left) << text.substr(0, 9) << " " << n;
   }
   ASSERT_EQ(stat(source_.c_str(), &after), 0);
   EXPECT_EQ(after.st_mode & 07777, before.st_mode & 07777);
