@@ -407,7 +407,9 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
            {"empty.jpg", ""},
            {"cut.mp4", mp4.substr(0, 200)},  // inside its header
            {"nomoov.mp4", mp4.substr(0, 40) + mp4.substr(mdat)},
-           {"cut.jpg", ReadFile(Fixture("photo_exif.jpg")).substr(0, 40)}}) {
+           {"cut.jpg", ReadFile(Fixture("photo_exif.jpg")).substr(0, 40)},
+           {"nosize.png",  // a header of zero width and height
+            ReadFile(Fixture("photo.png")).replace(16, 8, 8, '\0')}}) {
     WriteFile(dir.File(name), bytes);
   }
   ASSERT_EQ(mkfifo(dir.File("fifo.mp3").c_str(), 0600), 0);
@@ -426,7 +428,8 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
       {dir.File("none.mp3"), "No such file or directory"},
       {"relative/song.mp3", "path is not absolute"},
       {std::string("/tmp/a\0b.mp3", 12), "path holds a zero byte"},
-      {"/" + std::string(5000, 'a'), "path too long"}};
+      {"/" + std::string(5000, 'a'), "path too long"},
+      {dir.File("nosize.png"), "damaged image (no pixel size)"}};
   for (const auto& [path, reason] : cases) {
     EXPECT_FALSE(Parse(path)) << path;
     EXPECT_EQ(reason_.rfind(reason, 0), 0u) << path << ": " << reason_;
