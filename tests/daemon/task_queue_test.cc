@@ -97,7 +97,8 @@ TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
 
 // An empty non-blocking pop sleeps once per attempt and logs nothing; a task
 // that is not JSON is still taken off the queue. A blocking pop ignores the
-// attempts and waits: for a push, or until the queue is removed under it.
+// attempts and waits: for a push, or until the queue is removed under it. A
+// pop from a queue that is gone fails at once, logged.
 TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   LogCapture log;
   Json::Value out;
@@ -126,9 +127,12 @@ TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   });
   EXPECT_EQ(PopTaskFromQueue(id_, 0, true, 1, out), -1);
   remover.join();
+  EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 5, out), -1);  // no queue: at once
+  EXPECT_EQ(sleep_.calls(), 3);
   EXPECT_EQ(log.Normalized(),
-            std::vector<std::string>{
-                "quvaidx_daemon:N [Error] msgrcv: Identifier removed"});
+            (std::vector<std::string>{
+                "quvaidx_daemon:N [Error] msgrcv: Identifier removed",
+                "quvaidx_daemon:N [Error] msgrcv: Invalid argument"}));
   EXPECT_EQ(GetNumOfMessageInQueue(id_), -1);
 }
 
@@ -142,7 +146,9 @@ TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeftAndMissingOnesFail) {
   ASSERT_EQ(msgctl(fresh, IPC_STAT, &status), 0);
   EXPECT_EQ(status.msg_qbytes, 2048u);
   id_ = fresh;
-  LogCapture log;  // calls without a queue or a key file fail
+  LogCapture log;  // only calls without a queue or a key file fail, logged
+  EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), fresh);
+  EXPECT_TRUE(log.lines().empty());
   ASSERT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(DeleteMessageQueue(key_file_.c_str(), kProject), 0);
   EXPECT_EQ(GetMessageQueue(key_file_.c_str(), kProject), -1);

@@ -3,6 +3,7 @@
 #include <syslog.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -23,23 +24,22 @@ const decltype(&BlQUVAIndexIsVideo) kIs[] = {
     BlQUVAIndexIsPlaylist,   BlQUVAIndexIsMusic};
 
 TEST(ExtensionPredicates, AnswerEveryListForEveryCase) {
-  const struct {
-    const char* ext;
-    const char* answers;  // video-web photo-web raw jpeg video photo pls music
-    int table;
-  } cases[] = {{"Jpeg", "01010100", MEDIA_TABLE_PHOTO},
-               {"gif", "01000100", MEDIA_TABLE_PHOTO},
-               {"ico", "00000100", MEDIA_TABLE_PHOTO},
-               {"CR2", "01100100", MEDIA_TABLE_PHOTO},
-               {"MP3", "00000001", MEDIA_TABLE_MUSIC},
-               {"mp4", "10001000", MEDIA_TABLE_VIDEO},
-               {"ts", "00001000", MEDIA_TABLE_VIDEO},
-               {"DVR-MS", "00001000", MEDIA_TABLE_VIDEO},
-               {"PLS", "00000010", MEDIA_TABLE_PLAYLIST}};
-  for (const auto& c : cases) {
+  // The extension, the answers (video-web photo-web raw jpeg video photo
+  // pls music) and the table.
+  const std::tuple<const char*, const char*, int> cases[] = {
+      {"Jpeg", "01010100", MEDIA_TABLE_PHOTO},
+      {"gif", "01000100", MEDIA_TABLE_PHOTO},
+      {"ico", "00000100", MEDIA_TABLE_PHOTO},
+      {"CR2", "01100100", MEDIA_TABLE_PHOTO},
+      {"MP3", "00000001", MEDIA_TABLE_MUSIC},
+      {"mp4", "10001000", MEDIA_TABLE_VIDEO},
+      {"ts", "00001000", MEDIA_TABLE_VIDEO},
+      {"DVR-MS", "00001000", MEDIA_TABLE_VIDEO},
+      {"PLS", "00000010", MEDIA_TABLE_PLAYLIST}};
+  for (const auto& [ext, answers, table] : cases) {
     for (int i = 0; i < 8; ++i)
-      EXPECT_EQ(c.answers[i] - '0', kIs[i](c.ext)) << c.ext << " " << i;
-    EXPECT_EQ(c.table, GetMediaTableTypeFromExt(c.ext)) << c.ext;
+      EXPECT_EQ(answers[i] - '0', kIs[i](ext)) << ext << " " << i;
+    EXPECT_EQ(table, GetMediaTableTypeFromExt(ext)) << ext;
   }
   // No trimming, no prefix match, no folding beyond ASCII ("mp3" | 0x80).
   for (const char* miss : {"", "jpgx", "mp3 ", ".mp3", "\xed\xf0\xb3"}) {
@@ -66,23 +66,21 @@ TEST(PathPredicates, UseTheTextAfterTheLastDotOfTheWholePath) {
       BlQUVAIndexIsSubtitleFile,   BlQUVAIndexIsVideoFile,
       BlQUVAIndexIsVideoOnWebFile, BlQUVAIndexIsPhotoOnWebConvertFile,
       BlQUVAIndexIsPhotoOnWebFile, BlQUVAIndexIsMusicFile};
-  const struct {
-    const char* path;
-    const char* ext;      // expected QUVAIndexExtGet, null for none
-    const char* answers;  // subtitle video video-web convert photo-web music
-  } cases[] = {{"/m/movie.srt", "srt", "110000"},
-               {"/m/clip.m2ts", "m2ts", "011000"},
-               {"/m/Pic.JPG", "JPG", "000110"},
-               {"/m/._song.mp3", "mp3", "000001"},
-               {"/media/album.old/track", "old/track", "000000"},
-               {"/media/song", nullptr, "000000"},
-               {"name.", "", "000000"}};
-  for (const auto& c : cases) {
-    const char* end = c.path + strlen(c.path);  // the result points into it
-    EXPECT_EQ(c.ext ? end - strlen(c.ext) : nullptr, QUVAIndexExtGet(c.path))
-        << c.path;
+  // The path, its QUVAIndexExtGet (null for none) and the answers
+  // (subtitle video video-web convert photo-web music).
+  const std::tuple<const char*, const char*, const char*> cases[] = {
+      {"/m/movie.srt", "srt", "110000"},
+      {"/m/clip.m2ts", "m2ts", "011000"},
+      {"/m/Pic.JPG", "JPG", "000110"},
+      {"/m/._song.mp3", "mp3", "000001"},
+      {"/media/album.old/track", "old/track", "000000"},
+      {"/media/song", nullptr, "000000"},
+      {"name.", "", "000000"}};
+  for (const auto& [path, ext, answers] : cases) {
+    const char* end = path + strlen(path);  // the result points into it
+    EXPECT_EQ(ext ? end - strlen(ext) : nullptr, QUVAIndexExtGet(path)) << path;
     for (int i = 0; i < 6; ++i)
-      EXPECT_EQ(c.answers[i] - '0', is[i](c.path)) << c.path << " " << i;
+      EXPECT_EQ(answers[i] - '0', is[i](path)) << path << " " << i;
   }
   EXPECT_EQ(nullptr, QUVAIndexExtGet(nullptr));
 }
@@ -125,12 +123,10 @@ TEST(ConvertVideoType, FindsBareNamesAndCutsTheType) {
 }
 
 TEST(CodecNames, GapsGiveTheDefaultAndNamesRoundTrip) {
-  const struct {
-    int number;
-    const char* name;
-  } cases[] = {{1, "aac_main"}, {12, "aac_ttsi"}, {31, "aac_he_l3"}};
-  for (const auto& c : cases)
-    EXPECT_STREQ(c.name, QUVAAacCodecNameGet(c.number)) << c.number;
+  const std::pair<int, const char*> cases[] = {
+      {1, "aac_main"}, {12, "aac_ttsi"}, {31, "aac_he_l3"}};
+  for (const auto& [number, name] : cases)
+    EXPECT_STREQ(name, QUVAAacCodecNameGet(number)) << number;
   for (int gap : {0, 10, 11, 18, 29, 30, -1})
     EXPECT_STREQ("aac_invalid", QUVAAacCodecNameGet(gap)) << gap;
   for (int n = 1; n < 40; ++n) {

@@ -102,7 +102,8 @@ TEST_F(PacketTest, OddBodiesAndPiecesAreReceived) {
 }
 
 // A stream that ends inside a header or a body fails with -1, not -2; a
-// reset and a broken pipe are -2, without a signal or a line.
+// reset and a broken pipe are -2, without a signal or a line; other
+// failures are -1 with a line.
 TEST_F(PacketTest, EndOfStreamIsMinusOneResetAndBrokenPipeMinusTwo) {
   LogCapture log(7);
   for (const std::string& part :
@@ -123,6 +124,9 @@ TEST_F(PacketTest, EndOfStreamIsMinusOneResetAndBrokenPipeMinusTwo) {
   EXPECT_EQ(Recv(), -2);
   EXPECT_EQ(SendPacket(fds_[0], value), -2);  // a SIGPIPE would end the test
   EXPECT_TRUE(log.lines().empty());
+  EXPECT_EQ(SendPacket(-1, value), -1);  // any other failure: -1 and a line
+  EXPECT_EQ(RecvPacket(-1, value), -1);
+  EXPECT_EQ(log.Count("quvaidx_ipc_core:N [Error] 9, Bad file descriptor"), 2);
 }
 
 // Bodies of up to 16380 bytes are sent and up to 16383 received; larger ones

@@ -68,25 +68,48 @@ job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a libvorbis -q:a 0 "${tags[@]}" song
 job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a aac -b:a 96k "${tags[@]}" song_lc.m4a
 job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a pcm_s16le \
   -metadata title="Wave Title" -metadata artist="Wave Artist" song.wav
+# The other tag readers: AIFF (ID3v2), TTA, and Ogg's Opus, Speex and FLAC;
+# ASF and WavPack (APE) with the tags whose keys ffmpeg and TagLib share, and
+# an APE album artist under the key only TagLib knows.
+for format in "aiff pcm_s16be -write_id3v2 1" "tta tta" "opus libopus" \
+  "spx libspeex -ar 16000" "oga flac"; do
+  set -- $format
+  job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a "$2" "${@:3}" "${tags[@]}" "song.$1"
+done
+job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a wmav2 "${tags[@]:0:8}" \
+  -metadata genre=Rock -metadata track=3/12 song.wma
+job ff -f lavfi -i "$(tone 44100)" -ac 2 -c:a wavpack "${tags[@]:0:6}" \
+  -metadata genre=Rock -metadata track=3/12 -metadata "Album Artist=Various Artists" song.wv
 
 # Video: H.264 High with AAC in MP4, to be shown turned by 90 degrees; H.264
-# Main with Vorbis in Matroska, anamorphic (4:3 samples).
+# Main with Vorbis in Matroska, anamorphic (4:3 samples), whose second stream
+# has a tag that is not the file's.
 job ff -f lavfi -i testsrc=size=320x240:rate=25:duration=1 -f lavfi -i "$(tone 48000)" \
   -c:v libx264 -profile:v high -preset superfast -pix_fmt yuv420p \
   -c:a aac -b:a 64k -metadata title="Rotated Clip" video_rot90.mp4
 job ff -f lavfi -i testsrc=size=320x240:rate=30:duration=1 -f lavfi -i "$(tone 44100)" \
   -c:v libx264 -profile:v main -preset superfast -pix_fmt yuv420p -aspect 16:9 \
-  -c:a libvorbis -metadata title="Matroska Clip" -metadata artist="Clip Maker" video.mkv
+  -c:a libvorbis -metadata title="Matroska Clip" -metadata artist="Clip Maker" \
+  -metadata:s:a:0 genre="Stream Genre" video.mkv
+# Profiles from the configuration record alone: H.264 Constrained Baseline
+# with AAC, and HEVC Main without sound.
+job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -f lavfi -i "$(tone 48000)" \
+  -c:v libx264 -profile:v baseline -preset superfast -pix_fmt yuv420p -c:a aac \
+  -b:a 32k video_baseline.mp4
+job ff -f lavfi -i testsrc=size=160x120:rate=25:duration=1 -c:v libx265 \
+  -preset superfast -x265-params log-level=error -pix_fmt yuv420p -tag:v hvc1 video_hevc.mp4
 
-# Photos: a JPEG to get EXIF, a PNG.
+# Photos: a JPEG to get EXIF; PNG, GIF, TIFF (read whole), BMP, WebP.
 job ff -f lavfi -i testsrc=size=640x480:rate=1 -frames:v 1 photo_exif.jpg
-job ff -f lavfi -i testsrc=size=200x100:rate=1 -frames:v 1 photo.png
+for format in png gif tif bmp webp; do
+  job ff -f lavfi -i testsrc=size=200x100:rate=1 -frames:v 1 "photo.$format"
+done
 collect
 
 # One exiftool run writes the EXIF of the photo and the video's rotation.
 exiftool -Make="Canon" -Model="Canon EOS 5D Mark IV" -ExposureTime=1/125 \
   -FNumber=2.8 -ISO=400 -Orientation#=6 "-DateTimeOriginal=2021:05:01 12:34:56" \
-  photo_exif.jpg -execute -Rotation=90 video_rot90.mp4 \
+  photo_exif.jpg photo.tif -execute -Rotation=90 video_rot90.mp4 \
   -common_args -q -overwrite_original
 
 rm plain.mp3 lc22k.m4a cover.png

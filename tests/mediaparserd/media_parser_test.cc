@@ -84,8 +84,9 @@ Json::Value ProbeStream(const Json::Value& probe, const char* kind) {
   return Json::Value();
 }
 
-// ffprobe's profile names of the H.264 fixtures.
-int64_t H264Profile(const std::string& name) {
+// ffprobe's profile names of the video fixtures, as numbers.
+int64_t VideoProfile(const std::string& codec, const std::string& name) {
+  if (codec == "hevc") return name == "Main" ? 1 : -1;
   if (name == "High") return 100;
   if (name == "Main") return 77;
   if (name == "Constrained Baseline") return 578;
@@ -99,175 +100,185 @@ bool HeadLooksLikePhoto(const std::string& path) {
                         static_cast<int64_t>(head.size()));
 }
 
+// The UUID of the file system holding `path` by the oracle: blkid probing
+// the device node behind its st_dev (nothing where the device cannot be
+// read, as in some containers, or where there is none, as for a tmpfs).
+std::string BlkidUuid(const std::string& path) {
+  struct stat status;
+  if (stat(path.c_str(), &status) != 0) return "?";
+  std::string node = CommandOutput("sed -n 's/^DEVNAME=//p' /sys/dev/block/" +
+                                   std::to_string(major(status.st_dev)) + ":" +
+                                   std::to_string(minor(status.st_dev)) +
+                                   "/uevent 2>/dev/null");
+  if (node.empty()) return "";
+  node.pop_back();
+  std::string uuid = CommandOutput("blkid -p -s UUID -o value " +
+                                   Quoted("/dev/" + node) + " 2>/dev/null");
+  if (!uuid.empty()) uuid.pop_back();
+  return uuid;
+}
+
 // Every technical field against `ffprobe -of json`, and the tags that
-// libavformat reads correctly (UTF-8 and UTF-16 ones) against its tags.
-// exiv2 as Debian builds it also reads QuickTime, RIFF, Matroska and ASF:
-// only still images may look like photos, so that those go to libavformat.
-TEST_F(MediaParserTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
+// libavformat reads correctly (UTF-8 and UTF-16 ones) against its tags;
+// the file's own fields against its status. exiv2 as Debian builds it also
+// reads QuickTime, RIFF, Matroska and ASF: only still images may look like
+// photos, so that those go to libavformat.
+class OracleTest : public MediaParserTest,
+                   public ::testing::WithParamInterface<const char*> {};
+
+TEST_P(OracleTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
   HostCodePage host("UTF-8");
-  const char* fixtures[] = {"song_id3v24.mp3", "song_id3v23_utf16.mp3",
-                            "song.flac",       "song.ogg",
-                            "song_lc.m4a",     "song_he.m4a",
-                            "song.wav",        "video_rot90.mp4",
-                            "video.mkv",       "photo.png"};
-  for (const char* name : fixtures) {
-    SCOPED_TRACE(name);
-    std::string path = Fixture(name);
-    const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
-    Json::Value probe = CommandJson(
-        "ffprobe -v error -show_format -show_streams -of json " + Quoted(path));
-    ASSERT_TRUE(probe.isObject());
-    const Json::Value& format = probe["format"];
-    EXPECT_EQ(r.szContainerType,
-              ContainerTypeName(format["format_name"].asString()));
-    EXPECT_EQ(r.fileSize, static_cast<uint64_t>(Number(format["size"])));
-    EXPECT_TRUE(IsValidUTF8(r.szFsUUID));
-    int covers = 0;
-    for (const Json::Value& stream : probe["streams"]) {
-      covers += Number(stream["disposition"]["attached_pic"]) != 0;
-    }
-    Json::Value audio = ProbeStream(probe, "audio");
-    Json::Value video = ProbeStream(probe, "video");
-    const bool photo = strncmp(name, "photo", 5) == 0;
-    EXPECT_EQ(HeadLooksLikePhoto(path), photo);
-    EXPECT_EQ(media_.kind == MediaKind::kPhoto, photo);
-    if (photo) {
-      EXPECT_EQ(r.resolutionX, Number(video["width"]));
-      EXPECT_EQ(r.resolutionY, Number(video["height"]));
-      continue;
-    }
-    EXPECT_NEAR(r.duration, atof(format["duration"].asCString()), 1e-3);
-    EXPECT_EQ(r.frame_bitrate, Number(format["bit_rate"]));
-    EXPECT_EQ(r.coverCount, covers);
-    EXPECT_EQ(media_.kind,
-              video.isNull() ? MediaKind::kMusic : MediaKind::kVideo);
-    if (!audio.isNull()) {
-      EXPECT_EQ(r.frequency, Number(audio["sample_rate"]));
-      EXPECT_EQ(r.channel, Number(audio["channels"]));
-      int64_t rate = Number(audio["bit_rate"]);
-      if (rate == 0 && video.isNull()) rate = Number(format["bit_rate"]);
-      EXPECT_EQ(r.audio_bitrate, rate);
-      std::string codec = audio["codec_name"].asString();
-      if (codec == "aac") {
-        // The HE-AAC fixture signals SBR explicitly but carries no SBR data,
-        // so ffprobe's decoder reports LC; its doubled sample rate shows the
-        // signalling.
-        codec = audio["profile"].asString() == "HE-AAC" ||
-                        std::string(name) == "song_he.m4a"
-                    ? "aac_he"
-                    : "aac_lc";
-      }
-      EXPECT_EQ(r.szAudioCodec, codec);
-    }
-    if (!video.isNull()) {
-      EXPECT_EQ(r.resolutionX, Number(video["width"]));
-      EXPECT_EQ(r.resolutionY, Number(video["height"]));
-      EXPECT_EQ(r.szVideoCodec, video["codec_name"].asString());
-      EXPECT_EQ(r.videoProfile, H264Profile(video["profile"].asString()));
-      EXPECT_EQ(r.videoLevel, Number(video["level"]));
-      EXPECT_EQ(r.video_bitrate, Number(video["bit_rate"]));
-      auto [num, den] = Ratio(video["avg_frame_rate"], '/');
-      EXPECT_EQ(r.frame_rate_num, num);
-      EXPECT_EQ(r.frame_rate_den, den);
-      int rotation = 0;
-      for (const Json::Value& side : video["side_data_list"]) {
-        if (side.isMember("rotation")) {
-          rotation = ((-side["rotation"].asInt()) % 360 + 360) % 360;
-        }
-      }
-      EXPECT_EQ(media_.video.rotation, rotation);
-      auto [sar_w, sar_h] = Ratio(video["sample_aspect_ratio"], ':');
-      if (sar_w <= 0 || sar_h <= 0) sar_w = sar_h = 1;
-      EXPECT_EQ(media_.video.parWidth, sar_w);
-      EXPECT_EQ(media_.video.parHeight, sar_h);
-    }
-    // Tags: the container's, or (Ogg) the audio stream's.
-    Json::Value tags = format["tags"];
-    if (tags.isNull()) tags = audio["tags"];
-    auto tag = [&tags](const char* key) {
-      for (const std::string& member : tags.getMemberNames()) {
-        if (strcasecmp(member.c_str(), key) == 0)
-          return tags[member].asString();
-      }
-      return std::string();
-    };
-    EXPECT_EQ(r.szTitle, tag("title"));
-    EXPECT_EQ(r.szArtist, tag("artist"));
-    EXPECT_EQ(r.szAlbum, tag("album"));
-    EXPECT_EQ(r.szAlbumArtist, tag("album_artist").empty()
-                                   ? tag("albumartist")
-                                   : tag("album_artist"));
-    EXPECT_EQ(r.szGenre, tag("genre"));
-    EXPECT_EQ(r.szComposer, tag("composer"));
-    EXPECT_EQ(r.szComment, tag("comment"));
-    EXPECT_EQ(r.track, atoi(tag("track").c_str()));
-    EXPECT_EQ(r.disc, atoi(tag("disc").c_str()));
-    EXPECT_EQ(r.year, atoi(tag("date").c_str()));
-  }
-}
-
-// The camera's fields of a JPEG against exiftool; its orientation is kept
-// as the tag says, and only videos are turned.
-TEST_F(MediaParserTest, PhotoFieldsAgreeWithExiftool) {
-  std::string path = Fixture("photo_exif.jpg");
+  const char* name = GetParam();
+  std::string path = Fixture(name);
   const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
-  Json::Value exif = CommandJson("exiftool -j " + Quoted(path))[0];
-  ASSERT_TRUE(exif.isObject());
-  EXPECT_EQ(media_.kind, MediaKind::kPhoto);
-  EXPECT_TRUE(HeadLooksLikePhoto(path));
-  EXPECT_EQ(r.szMake, exif["Make"].asString());
-  EXPECT_EQ(r.szModel, exif["Model"].asString());
-  EXPECT_EQ(r.szExposure, exif["ExposureTime"].asString());
-  EXPECT_DOUBLE_EQ(atof(r.szAperture), exif["FNumber"].asDouble());
-  EXPECT_EQ(r.iso, exif["ISO"].asInt());
-  std::string taken = exif["DateTimeOriginal"].asString();
-  taken[4] = taken[7] = '-';
-  EXPECT_EQ(r.szTakenTime, taken);
-  EXPECT_EQ(r.resolutionX, exif["ImageWidth"].asInt());
-  EXPECT_EQ(r.resolutionY, exif["ImageHeight"].asInt());
-  EXPECT_STREQ(r.szContainerType, "image2");
-  EXPECT_EQ(media_.orientation, 6);  // "Rotate 90 CW"
-  EXPECT_EQ(media_.video.rotation, 0);
-}
-
-// The file's own fields, and the UUID of its file system against the
-// oracle: blkid probing the device node behind the file's st_dev (nothing
-// where the device cannot be read, as in some containers, or where there is
-// no device, as for a tmpfs).
-TEST_F(MediaParserTest, FileFieldsComeFromTheFileAndItsFileSystem) {
-  std::string path = Fixture("song.ogg");
-  const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+  Json::Value probe = CommandJson(
+      "ffprobe -v error -show_format -show_streams -of json " + Quoted(path));
+  ASSERT_TRUE(probe.isObject());
+  const Json::Value& format = probe["format"];
+  EXPECT_EQ(r.szContainerType,
+            ContainerTypeName(format["format_name"].asString()));
+  EXPECT_EQ(r.fileSize, static_cast<uint64_t>(Number(format["size"])));
+  EXPECT_EQ(r.szPath, path);
+  EXPECT_STREQ(r.szName, name);
   struct stat status;
   ASSERT_EQ(stat(path.c_str(), &status), 0);
-  EXPECT_EQ(r.szPath, path);
-  EXPECT_STREQ(r.szName, "song.ogg");
   char date[32];
   strftime(date, sizeof(date), "%Y-%m-%d %H:%M:%S",
            localtime(&status.st_mtime));
   EXPECT_STREQ(r.szDate, date);
   EXPECT_STREQ(r.szMDate, date);
-  std::string node = CommandOutput("sed -n 's/^DEVNAME=//p' /sys/dev/block/" +
-                                   std::to_string(major(status.st_dev)) + ":" +
-                                   std::to_string(minor(status.st_dev)) +
-                                   "/uevent 2>/dev/null");
-  std::string uuid;
-  if (!node.empty()) {
-    node.pop_back();
-    uuid = CommandOutput("blkid -p -s UUID -o value " + Quoted("/dev/" + node) +
-                         " 2>/dev/null");
-    if (!uuid.empty()) uuid.pop_back();
+  EXPECT_EQ(r.szFsUUID, BlkidUuid(path));
+  int covers = 0;
+  for (const Json::Value& stream : probe["streams"]) {
+    covers += Number(stream["disposition"]["attached_pic"]) != 0;
   }
-  EXPECT_EQ(r.szFsUUID, uuid);
+  Json::Value audio = ProbeStream(probe, "audio");
+  Json::Value video = ProbeStream(probe, "video");
+  const bool photo = strncmp(name, "photo", 5) == 0;
+  EXPECT_EQ(HeadLooksLikePhoto(path), photo);
+  EXPECT_EQ(media_.kind == MediaKind::kPhoto, photo);
+  if (photo) {
+    EXPECT_EQ(r.resolutionX, Number(video["width"]));
+    EXPECT_EQ(r.resolutionY, Number(video["height"]));
+    return;
+  }
+  EXPECT_NEAR(r.duration, atof(format["duration"].asCString()), 1e-3);
+  EXPECT_EQ(r.frame_bitrate, Number(format["bit_rate"]));
+  EXPECT_EQ(r.coverCount, covers);
+  EXPECT_EQ(media_.kind,
+            video.isNull() ? MediaKind::kMusic : MediaKind::kVideo);
+  if (!audio.isNull()) {
+    EXPECT_EQ(r.frequency, Number(audio["sample_rate"]));
+    EXPECT_EQ(r.channel, Number(audio["channels"]));
+    int64_t rate = Number(audio["bit_rate"]);
+    if (rate == 0 && video.isNull()) rate = Number(format["bit_rate"]);
+    EXPECT_EQ(r.audio_bitrate, rate);
+    std::string codec = audio["codec_name"].asString();
+    if (codec == "aac") {
+      // The HE-AAC fixture signals SBR explicitly but carries no SBR data,
+      // so ffprobe's decoder reports LC; its doubled sample rate shows the
+      // signalling.
+      codec = audio["profile"].asString() == "HE-AAC" ||
+                      std::string(name) == "song_he.m4a"
+                  ? "aac_he"
+                  : "aac_lc";
+    }
+    EXPECT_EQ(r.szAudioCodec, codec);
+  }
+  if (!video.isNull()) {
+    EXPECT_EQ(r.resolutionX, Number(video["width"]));
+    EXPECT_EQ(r.resolutionY, Number(video["height"]));
+    EXPECT_EQ(r.szVideoCodec, video["codec_name"].asString());
+    EXPECT_EQ(r.videoProfile, VideoProfile(video["codec_name"].asString(),
+                                           video["profile"].asString()));
+    EXPECT_EQ(r.videoLevel, Number(video["level"]));
+    EXPECT_EQ(r.video_bitrate, Number(video["bit_rate"]));
+    auto [num, den] = Ratio(video["avg_frame_rate"], '/');
+    EXPECT_EQ(r.frame_rate_num, num);
+    EXPECT_EQ(r.frame_rate_den, den);
+    int rotation = 0;
+    for (const Json::Value& side : video["side_data_list"]) {
+      if (side.isMember("rotation")) {
+        rotation = ((-side["rotation"].asInt()) % 360 + 360) % 360;
+      }
+    }
+    EXPECT_EQ(media_.video.rotation, rotation);
+    auto [sar_w, sar_h] = Ratio(video["sample_aspect_ratio"], ':');
+    if (sar_w <= 0 || sar_h <= 0) sar_w = sar_h = 1;
+    EXPECT_EQ(media_.video.parWidth, sar_w);
+    EXPECT_EQ(media_.video.parHeight, sar_h);
+  }
+  // Tags: the container's, or (Ogg) the audio stream's.
+  Json::Value tags = format["tags"];
+  if (tags.isNull()) tags = audio["tags"];
+  auto tag = [&tags](const char* key) {
+    for (const std::string& member : tags.getMemberNames()) {
+      if (strcasecmp(member.c_str(), key) == 0) return tags[member].asString();
+    }
+    return std::string();
+  };
+  EXPECT_EQ(r.szTitle, tag("title"));
+  EXPECT_EQ(r.szArtist, tag("artist"));
+  EXPECT_EQ(r.szAlbum, tag("album"));
+  EXPECT_EQ(r.szAlbumArtist,
+            tag("album_artist") + tag("albumartist") + tag("album artist"));
+  EXPECT_EQ(r.szGenre, tag("genre"));
+  EXPECT_EQ(r.szComposer, tag("composer"));
+  EXPECT_EQ(r.szComment, tag("comment"));
+  EXPECT_EQ(r.track, atoi(tag("track").c_str()));
+  EXPECT_EQ(r.disc, atoi(tag("disc").c_str()));
+  EXPECT_EQ(r.year, atoi(tag("date").c_str()));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Fixtures, OracleTest,
+    ::testing::Values("song_id3v24.mp3", "song_id3v23_utf16.mp3", "song.flac",
+                      "song.ogg", "song_lc.m4a", "song_he.m4a", "song.wav",
+                      "song.aiff", "song.wma", "song.wv", "song.tta",
+                      "song.opus", "song.oga", "video_rot90.mp4", "video.mkv",
+                      "video_baseline.mp4", "video_hevc.mp4", "photo.png",
+                      "photo.gif", "photo.tif", "photo.bmp", "photo.webp"));
+
+// A file system without a superblock (a tmpfs) has no UUID.
+TEST_F(MediaParserTest, FileSystemWithoutSuperblockHasNoUuid) {
   if (access("/dev/shm", W_OK) != 0) GTEST_SKIP() << "no /dev/shm";
   char dir[] = "/dev/shm/quvaidx-test-XXXXXX";
   ASSERT_NE(mkdtemp(dir), nullptr);
   std::string copy = std::string(dir) + "/song.ogg";
-  WriteFile(copy, ReadFile(path));
+  WriteFile(copy, ReadFile(Fixture("song.ogg")));
   bool parsed = Parse(copy);
   unlink(copy.c_str());
   rmdir(dir);
   ASSERT_TRUE(parsed) << reason_;
   EXPECT_STREQ(media_.record.szFsUUID, "");
+}
+
+// The camera's fields of a JPEG and of a TIFF (which exiv2 reads whole)
+// against exiftool; the orientation is kept as the tag says, and only videos
+// are turned.
+TEST_F(MediaParserTest, PhotoFieldsAgreeWithExiftool) {
+  for (const char* name : {"photo_exif.jpg", "photo.tif"}) {
+    SCOPED_TRACE(name);
+    std::string path = Fixture(name);
+    const __tag_QUVA_MEDIA_INFO& r = MustParse(path);
+    Json::Value exif = CommandJson("exiftool -j " + Quoted(path))[0];
+    ASSERT_TRUE(exif.isObject());
+    EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+    EXPECT_TRUE(HeadLooksLikePhoto(path));
+    EXPECT_EQ(r.szMake, exif["Make"].asString());
+    EXPECT_EQ(r.szModel, exif["Model"].asString());
+    EXPECT_EQ(r.szExposure, exif["ExposureTime"].asString());
+    EXPECT_DOUBLE_EQ(atof(r.szAperture), exif["FNumber"].asDouble());
+    EXPECT_EQ(r.iso, exif["ISO"].asInt());
+    std::string taken = exif["DateTimeOriginal"].asString();
+    taken[4] = taken[7] = '-';
+    EXPECT_EQ(r.szTakenTime, taken);
+    EXPECT_EQ(r.resolutionX, exif["ImageWidth"].asInt());
+    EXPECT_EQ(r.resolutionY, exif["ImageHeight"].asInt());
+    EXPECT_STREQ(r.szContainerType, "image2");
+    EXPECT_EQ(media_.orientation, 6);  // "Rotate 90 CW"
+    EXPECT_EQ(media_.video.rotation, 0);
+  }
 }
 
 // The texts of ID3v1 tags and of ID3v2 frames declared Latin-1 are decoded
@@ -311,86 +322,100 @@ TEST_F(MediaParserTest, LegacyTagsAreReadInTheHostCodePage) {
   }
 }
 
-// An ID3v2.3 text frame: `id`, its encoding byte, `text`.
-std::string Id3v2Frame(const char* id, char encoding, const std::string& text) {
-  std::string body = std::string(1, encoding) + text;
+// An ID3v2.3 frame `id` holding `body`.
+std::string Id3v2Frame(const char* id, const std::string& body) {
   std::string frame = id;
-  for (int shift : {24, 16, 8, 0}) {
+  for (int shift : {24, 16, 8, 0})
     frame += static_cast<char>(body.size() >> shift);
-  }
   return frame + std::string(2, '\0') + body;
 }
 
-// An ID3v2.3 tag around `frames`.
-std::string Id3v2Tag(const std::string& frames) {
-  std::string tag = "ID3\x03" + std::string(2, '\0');
-  for (int shift : {21, 14, 7, 0}) {
-    tag += static_cast<char>((frames.size() >> shift) & 0x7F);
-  }
-  return tag + frames;
-}
-
 // Frames whose declared encoding is none of the four give a clean text or
-// none, and the rest of the tag still counts.
-TEST_F(MediaParserTest, FrameWithAnUnknownEncodingIsReadSafely) {
+// none, and the rest of the tag still counts: of the comments, the one
+// without a description (others hold player data), numbered genres by
+// their names, the leading number of the disc.
+TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
   HostCodePage host("UTF-8");
   TempDir dir;
-  std::string song = ReadFile(Fixture("song_id3v1_cp1251.mp3"));
-  for (char encoding : {'\x04', '\x65', '\xFF'}) {
-    std::string path = dir.File("odd.mp3");
-    WriteFile(path, Id3v2Tag(Id3v2Frame("TIT2", encoding,
-                                        std::string("AB\0CD\xFF\xFE", 7)) +
-                             Id3v2Frame("TPE1", '\0', "Kino")) +
-                        song);
-    ASSERT_TRUE(Parse(path)) << reason_;
+  auto latin1 = [](const char* text) { return std::string(1, '\0') + text; };
+  const std::string described =
+      Id3v2Frame("COMM", std::string("\0engiTunNORM\0 0001", 18));
+  const std::string frames = Id3v2Frame("TPE1", latin1("Kino")) +
+                             Id3v2Frame("TCON", latin1("(17)")) +
+                             Id3v2Frame("TPOS", latin1("2/3"));
+  const std::tuple<char, std::string, const char*> cases[] = {
+      {'\x04', Id3v2Frame("COMM", std::string("\0eng\0Notes", 10)), "Notes"},
+      {'\x65', Id3v2Frame("COMM", std::string("\0eng\0Notes", 10)), "Notes"},
+      {'\xFF', "", " 0001"}};  // only a described comment: that one
+  for (const auto& [encoding, comment, expected] : cases) {
+    std::string tag = "ID3\x03" + std::string(2, '\0');
+    std::string all =
+        Id3v2Frame("TIT2", encoding + std::string("AB\0CD\xFF\xFE", 7)) +
+        described + comment + frames;
+    for (int shift : {21, 14, 7, 0})
+      tag += static_cast<char>((all.size() >> shift) & 0x7F);
+    WriteFile(dir.File("odd.mp3"),
+              tag + all + ReadFile(Fixture("song_id3v1_cp1251.mp3")));
+    ASSERT_TRUE(Parse(dir.File("odd.mp3"))) << reason_;
     EXPECT_TRUE(IsValidUTF8(media_.record.szTitle));
     EXPECT_STREQ(media_.record.szArtist, "Kino");
+    EXPECT_STREQ(media_.record.szComment, expected);
+    EXPECT_STREQ(media_.record.szGenre, "Rock");
+    EXPECT_EQ(media_.record.disc, 2);
     EXPECT_EQ(media_.record.year, 1999);  // from the ID3v1 tag
   }
 }
 
 // What a file is depends on its content: a renamed MP3 is an MP3, a text
-// named like a photo is nothing.
+// named like a photo is nothing; TagLib reads the tags of the container
+// found, whatever the name says.
 TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
   TempDir dir;
-  struct Case {
-    const char* fixture;
-    const char* name;
+  const struct {
+    const char *fixture, *name;
     MediaKind kind;
-    const char* container;
-  } cases[] = {{"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3"},
-               {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm"},
-               {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2"}};
-  for (const Case& c : cases) {
+    const char *container, *title;
+  } cases[] = {
+      {"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3",
+       "Überschrift ✓"},
+      {"song.spx", "song.flac", MediaKind::kMusic, "ogg", "Song Title"},
+      {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm",
+       "Matroska Clip"},
+      {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2", ""}};
+  for (const auto& c : cases) {
     WriteFile(dir.File(c.name), ReadFile(Fixture(c.fixture)));
     ASSERT_TRUE(Parse(dir.File(c.name))) << c.name << ": " << reason_;
     EXPECT_EQ(media_.kind, c.kind) << c.name;
     EXPECT_STREQ(media_.record.szContainerType, c.container) << c.name;
+    EXPECT_STREQ(media_.record.szTitle, c.title) << c.name;
   }
   EXPECT_STREQ(media_.record.szMake, "Canon");
 }
 
 // Every file that is not readable media is refused with a reason a person
-// can read, never answered with a zeroed record.
+// can read, never answered with a zeroed record; a file cut after its
+// header still tells what the header tells.
 TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   TempDir dir;
   FdLeakCheck fds;
-  WriteFile(dir.File("fake.png"), "hello");
-  WriteFile(dir.File("zeros.mp3"), std::string(1 << 20, '\0'));
-  WriteFile(dir.File("empty.jpg"), "");
-  std::string mp4 = ReadFile(Fixture("video_rot90.mp4"));
-  WriteFile(dir.File("cut.mp4"), mp4.substr(0, 200));  // inside its header
-  size_t mdat = mp4.find("mdat") - 4;  // the fixture's moov comes before it
-  WriteFile(dir.File("nomoov.mp4"), mp4.substr(0, 40) + mp4.substr(mdat));
-  std::string jpeg = ReadFile(Fixture("photo_exif.jpg"));
-  WriteFile(dir.File("cut.jpg"), jpeg.substr(0, 40));
+  const std::string mp4 = ReadFile(Fixture("video_rot90.mp4"));
+  const size_t mdat = mp4.find("mdat") - 4;  // the fixture's moov is before
+  for (const auto& [name, bytes] :
+       std::initializer_list<std::pair<const char*, std::string>>{
+           {"fake.png", "hello"},
+           {"zeros.mp3", std::string(1 << 20, '\0')},
+           {"empty.jpg", ""},
+           {"cut.mp4", mp4.substr(0, 200)},  // inside its header
+           {"nomoov.mp4", mp4.substr(0, 40) + mp4.substr(mdat)},
+           {"cut.jpg", ReadFile(Fixture("photo_exif.jpg")).substr(0, 40)},
+           {"nosize.png",  // a header of zero width and height
+            ReadFile(Fixture("photo.png")).replace(16, 8, 8, '\0')}}) {
+    WriteFile(dir.File(name), bytes);
+  }
   ASSERT_EQ(mkfifo(dir.File("fifo.mp3").c_str(), 0600), 0);
   ASSERT_EQ(mkdir(dir.File("album.png").c_str(), 0700), 0);
   ASSERT_EQ(symlink("/dev/zero", dir.File("zero.mp3").c_str()), 0);
-  struct Case {
-    std::string path;
-    const char* reason;  // the start of the reason
-  } cases[] = {
+  const std::pair<std::string, const char*> cases[] = {
       {dir.File("fake.png"), "not a media file"},
       {dir.File("zeros.mp3"), "not a media file"},
       {dir.File("empty.jpg"), "empty file"},
@@ -404,25 +429,76 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
       {"relative/song.mp3", "path is not absolute"},
       {std::string("/tmp/a\0b.mp3", 12), "path holds a zero byte"},
       {"/" + std::string(5000, 'a'), "path too long"},
-  };
-  for (const Case& c : cases) {
-    EXPECT_FALSE(Parse(c.path)) << c.path;
-    EXPECT_EQ(reason_.rfind(c.reason, 0), 0u) << c.path << ": " << reason_;
+      {dir.File("nosize.png"), "damaged image (no pixel size)"}};
+  for (const auto& [path, reason] : cases) {
+    EXPECT_FALSE(Parse(path)) << path;
+    EXPECT_EQ(reason_.rfind(reason, 0), 0u) << path << ": " << reason_;
   }
   EXPECT_TRUE(fds.NoLeak());
-}
-
-// A file cut after its header still tells what the header tells.
-TEST_F(MediaParserTest, TruncatedFilesTellWhatTheirHeadersTell) {
-  TempDir dir;
   HostCodePage host("UTF-8");
   for (const char* name : {"video_rot90.mp4", "song.flac", "song_id3v24.mp3"}) {
     std::string whole = ReadFile(Fixture(name));
-    std::string path = dir.File(name);
-    WriteFile(path, whole.substr(0, whole.size() / 2));
-    ASSERT_TRUE(Parse(path)) << name << ": " << reason_;
+    WriteFile(dir.File(name), whole.substr(0, whole.size() / 2));
+    ASSERT_TRUE(Parse(dir.File(name))) << name << ": " << reason_;
     EXPECT_GT(media_.record.duration, 0.5f) << name;
     EXPECT_STRNE(media_.record.szTitle, "") << name;
+  }
+}
+
+// A photo whose pixel size cannot be read (no frame header) is still a
+// photo when any one of its camera fields can be; with none, it is a
+// damaged image.
+TEST_F(MediaParserTest, PhotoWithoutPixelSizeIsKnownByAnyCameraField) {
+  TempDir dir;
+  const std::string jpeg = dir.File("p.jpg");
+  const std::tuple<const char*, const char*, const char*> cases[] = {
+      {"-Make=Leica", "szMake", "\"Leica\""},
+      {"-Model=M6", "szModel", "\"M6\""},
+      {"-ExposureTime=1/60", "szExposure", "\"1/60\""},
+      {"-FNumber=2", "szAperture", "\"2.0\""},
+      {"-ISO=100", "iso", "100"},
+      {"-DateTimeOriginal=2020:01:02 03:04:05", "szTakenTime",
+       "\"2020-01-02 03:04:05\""},
+      {"-Artist=nobody", "", ""}};
+  for (const auto& [tag, field, value] : cases) {
+    WriteFile(jpeg, ReadFile(Fixture("photo_exif.jpg")));
+    CommandOutput("exiftool -q -all= -overwrite_original " + Quoted(tag) + " " +
+                  Quoted(jpeg));
+    std::string bytes = ReadFile(jpeg);
+    size_t sof = bytes.find("\xFF\xC0");  // the frame header, with the size
+    ASSERT_NE(sof, std::string::npos) << tag;
+    bytes.erase(sof, 2 + (static_cast<uint8_t>(bytes[sof + 2]) << 8 |
+                          static_cast<uint8_t>(bytes[sof + 3])));
+    WriteFile(jpeg, bytes);
+    if (field[0] == '\0') {
+      EXPECT_FALSE(Parse(jpeg));
+      EXPECT_EQ(reason_, "damaged image (no pixel size)");
+      continue;
+    }
+    ASSERT_TRUE(Parse(jpeg)) << tag << ": " << reason_;
+    EXPECT_EQ(media_.kind, MediaKind::kPhoto);
+    Json::Value json;
+    MediaInfoObject2Json(media_.record, json);
+    EXPECT_EQ(Json::FastWriter().write(json[field]), std::string(value) + "\n");
+    EXPECT_EQ(media_.record.resolutionX + media_.record.resolutionY, 0);
+  }
+}
+
+// A header that gives no picture size does not tell all: the picture is
+// decoded for it.
+TEST_F(MediaParserTest, HeaderWithoutPictureSizeIsNotTrusted) {
+  TempDir dir;
+  const std::string video = ReadFile(Fixture("video_rot90.mp4"));
+  // The sample entry of the picture stream: its width, then its height.
+  const size_t entry = video.find("avc1", video.find("stsd"));
+  ASSERT_NE(entry, std::string::npos);
+  for (size_t at : {entry + 28, entry + 30}) {
+    std::string patched = video;
+    patched[at] = patched[at + 1] = '\0';
+    WriteFile(dir.File("zero.mp4"), patched);
+    ASSERT_TRUE(Parse(dir.File("zero.mp4"))) << reason_;
+    EXPECT_EQ(media_.record.resolutionX, 320) << at - entry;
+    EXPECT_EQ(media_.record.resolutionY, 240) << at - entry;
   }
 }
 
@@ -434,15 +510,10 @@ TEST_F(MediaParserTest, UnreadableFileIsRefused) {
   WriteFile(path, ReadFile(Fixture("song_id3v24.mp3")));
   ASSERT_EQ(chmod(path.c_str(), 0), 0);
   ASSERT_EQ(chmod(dir.path().c_str(), 0755), 0);
-  int result = quvaidx::test::RunUnprivileged([&] {
-    MediaParser parser{ParserOptions()};
-    ParsedMedia media;
-    std::string reason;
-    return !parser.Parse(path, &media, &reason) && reason == "Permission denied"
-               ? 0
-               : 1;
-  });
-  EXPECT_EQ(result, 0);
+  EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
+              return !Parse(path) && reason_ == "Permission denied" ? 0 : 1;
+            }),
+            0);
 }
 
 // Sparse files of 4 GiB and more cost no disk: a real song followed by

@@ -12,8 +12,12 @@ namespace mediaparserd {
 namespace {
 
 using test::Fixture;
-using test::HostCodePage;
-using test::IsValidUTF8;
+
+Json::Value Parse(const std::string& text) {
+  Json::Value value;
+  Json::Reader().parse(text, value, false);
+  return value;
+}
 
 class RequestHandlerTest : public ::testing::Test {
  protected:
@@ -24,30 +28,18 @@ class RequestHandlerTest : public ::testing::Test {
     HandleRequest(&parser_, request, &reply);
     return reply;
   }
-
   Json::Value Ask(const char* command, const std::string& path) {
-    Json::Value request(Json::objectValue);
-    request["command"] = command;
-    request["path"] = path;
-    return Ask(request);
+    return Ask(Parse("{\"command\": \"" + std::string(command) +
+                     "\", \"path\": \"" + path + "\"}"));
   }
 
   MediaParser parser_{ParserOptions()};
 };
 
-Json::Value Parse(const char* text) {
-  Json::Value value;
-  Json::Reader().parse(text, value, false);
-  return value;
-}
-
 // A request without a known command and an absolute path is refused with
 // the reason, and the request itself is left as it came.
 TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
-  struct Case {
-    const char* request;
-    const char* reason;
-  } cases[] = {
+  const std::pair<const char*, const char*> cases[] = {
       {"[1, 2]", "unknown command"},
       {"\"GET_MEDIA_INFO\"", "unknown command"},
       {"{}", "unknown command"},
@@ -59,48 +51,54 @@ TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
        "missing \"path\""},
       {"{\"command\": \"GET_MEDIA_RESOLUTION\", \"path\": \"a.png\"}",
        "path is not absolute"},
-  };
-  for (const Case& c : cases) {
-    Json::Value request = Parse(c.request);
-    Json::Value copy = request;
-    Json::Value reply = Ask(request);
-    EXPECT_EQ(reply, MakeResponse(false, c.reason)) << c.request;
-    EXPECT_EQ(request, copy) << c.request;
+      {"{\"command\": \"GET_MEDIA_INFO\", \"path\": \"/nonexistent/a.mp4\"}",
+       "No such file or directory"}};
+  for (const auto& [text, reason] : cases) {
+    Json::Value request = Parse(text), copy = request;
+    EXPECT_EQ(Ask(request), MakeResponse(false, reason)) << text;
+    EXPECT_EQ(request, copy) << text;
   }
   EXPECT_EQ(Ask(Parse("{\"command\": \"HANDSHAKE\"}")),
             MakeResponse(true, nullptr));
 }
 
-// The whole record, all 47 fields, and its kind; with the code page at
-// UTF-8 the legacy tag bytes cannot be decoded, and still the packet a
-// client receives holds only valid UTF-8.
-TEST_F(RequestHandlerTest, MediaInfoCarriesTheWholeRecordAndItsKind) {
-  HostCodePage host("UTF-8");
-  std::string path = Fixture("song_id3v1_cp1251.mp3");
-  Json::Value reply = Ask("GET_MEDIA_INFO", path);
-  ASSERT_TRUE(reply["success"].asBool()) << reply;
-  EXPECT_EQ(reply["media_type"].asString(), "music");
-  EXPECT_EQ(reply["media"].size(), 47u);
-  EXPECT_EQ(reply["media"]["szPath"].asString(), path);
-  EXPECT_TRUE(IsValidUTF8(Json::FastWriter().write(reply)));
-}
-
-// The rotation and pixel aspect under their reply keys, for videos only.
-TEST_F(RequestHandlerTest, VideoMetadataIsAnsweredForVideosOnly) {
-  Json::Value reply = Ask("GET_VIDEO_METADATA", Fixture("video_rot90.mp4"));
-  EXPECT_EQ(
-      reply["metadata"],
-      Parse("{\"rotation\": 90, \"par\": {\"width\": 1, \"height\": 1}}"));
-  reply = Ask("GET_VIDEO_METADATA", Fixture("video.mkv"));
-  EXPECT_EQ(reply["metadata"],
-            Parse("{\"rotation\": 0, \"par\": {\"width\": 4, \"height\": 3}}"));
-  for (const char* file : {"song.ogg", "photo_exif.jpg"}) {
-    EXPECT_EQ(Ask("GET_VIDEO_METADATA", Fixture(file)),
-              MakeResponse(false, "not a video"))
-        << file;
+// Each command answers its part of the record under its reply keys: the
+// whole record (47 fields, valid UTF-8 even where legacy tags cannot be
+// decoded) and its kind, the picture size, or the rotation and pixel
+// aspect of a video, which only a video has.
+TEST_F(RequestHandlerTest, EachCommandAnswersItsPartOfTheRecord) {
+  test::HostCodePage host("UTF-8");
+  const struct {
+    const char *file, *kind;
+    int width, height;
+    const char* metadata;  // null: "not a video"
+  } cases[] = {{"song_id3v1_cp1251.mp3", "music", 0, 0, nullptr},
+               {"photo_exif.jpg", "photo", 640, 480, nullptr},
+               {"video_rot90.mp4", "video", 320, 240,
+                "{\"rotation\": 90, \"par\": {\"width\": 1, \"height\": 1}}"},
+               {"video.mkv", "video", 320, 240,
+                "{\"rotation\": 0, \"par\": {\"width\": 4, \"height\": 3}}"}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.file);
+    const std::string path = Fixture(c.file);
+    Json::Value reply = Ask("GET_MEDIA_INFO", path);
+    ASSERT_TRUE(reply["success"].asBool()) << reply;
+    EXPECT_EQ(reply["media_type"].asString(), c.kind);
+    EXPECT_EQ(reply["media"].size(), 47u);
+    EXPECT_EQ(reply["media"]["szPath"].asString(), path);
+    EXPECT_TRUE(test::IsValidUTF8(Json::FastWriter().write(reply)));
+    reply = Ask("GET_MEDIA_RESOLUTION", path);
+    EXPECT_EQ(reply, Parse("{\"success\": true, \"width\": " +
+                           std::to_string(c.width) +
+                           ", \"height\": " + std::to_string(c.height) + "}"));
+    reply = Ask("GET_VIDEO_METADATA", path);
+    if (c.metadata == nullptr) {
+      EXPECT_EQ(reply, MakeResponse(false, "not a video"));
+    } else {
+      EXPECT_TRUE(reply["success"].asBool());
+      EXPECT_EQ(reply["metadata"], Parse(c.metadata));
+    }
   }
-  EXPECT_EQ(Ask("GET_VIDEO_METADATA", "/nonexistent/clip.mp4"),
-            MakeResponse(false, "No such file or directory"));
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <string>
+#include <tuple>
 
 #include "file_line.h"
 #include "support/fake_host.h"
@@ -26,20 +27,17 @@ int FindLine(const TempDir& dir, const std::string& content,
 
 TEST(FileGetLineTest, ExactLineMatch) {
   TempDir dir;
-  const struct {
-    const char* content;
-    const char* key;
-    int result;
-  } cases[] = {{"/a/b\n/a/c", "/a/c", 1},  // last line without line end
-               {"/a/bc\n", "/a/b", 0},     // prefix of a line
-               {"x/a/b\n", "/a/b", 0},     // suffix of a line
-               {"/a/b\r\n", "/a/b", 0},    // '\r' is part of the line
-               {"a\n\nb\n", "", 1},        // an empty line
-               {"a\nb", "", 0}};
-  for (const auto& c : cases) {
+  const std::tuple<const char*, const char*, int> cases[] = {
+      {"/a/b\n/a/c", "/a/c", 1},  // last line without line end
+      {"/a/bc\n", "/a/b", 0},     // prefix of a line
+      {"x/a/b\n", "/a/b", 0},     // suffix of a line
+      {"/a/b\r\n", "/a/b", 0},    // '\r' is part of the line
+      {"a\n\nb\n", "", 1},        // an empty line
+      {"a\nb", "", 0}};
+  for (const auto& [content, key, result] : cases) {
     std::string line;
-    EXPECT_EQ(FindLine(dir, c.content, c.key, &line), c.result) << c.content;
-    EXPECT_EQ(line, c.result == 1 ? c.key : "untouched");
+    EXPECT_EQ(FindLine(dir, content, key, &line), result) << content;
+    EXPECT_EQ(line, result == 1 ? key : "untouched");
   }
   EXPECT_EQ(FindLine(dir, std::string("x\0y\n/a/b\n", 9), "/a/b"), 1);
   std::string long_key(4096, 'k');

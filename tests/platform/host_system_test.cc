@@ -5,6 +5,7 @@
 #include <signal.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -15,6 +16,7 @@
 #include "fs_type.h"
 #include "host_ops.h"
 #include "support/fake_host.h"
+#include "support/unprivileged.h"
 
 namespace quvahost::test {
 namespace {
@@ -22,15 +24,13 @@ namespace {
 TEST(BootStepTest, FileContents) {
   HostEtc etc;
   EXPECT_EQ(QUVASystemGetBootStep(), QUVA_BOOT_STEP_READY);  // no file
-  const struct {
-    const char* text;
-    int step;
-  } cases[] = {{" 3 \r\n", 3}, {"0", 0},    {"", -1},
-               {"four", -1},   {"4 4", -1}, {"2147483648", -1}};
-  for (const auto& c : cases) {
-    WriteFile(etc.File("boot_step"), c.text);
-    EXPECT_EQ(QUVASystemGetBootStep(), c.step) << c.text;
-    EXPECT_TRUE(c.step >= 0 || QLIBCErrGet() == EINVAL);
+  const std::pair<const char*, int> cases[] = {
+      {" 3 \r\n", 3}, {"0", 0},    {"", -1},
+      {"four", -1},   {"4 4", -1}, {"2147483648", -1}};
+  for (const auto& [text, step] : cases) {
+    WriteFile(etc.File("boot_step"), text);
+    EXPECT_EQ(QUVASystemGetBootStep(), step) << text;
+    EXPECT_TRUE(step >= 0 || QLIBCErrGet() == EINVAL);
   }
   HostEtc other;  // the directory is looked up on every call
   ASSERT_EQ(mkdir(other.File("boot_step").c_str(), 0755), 0);
@@ -87,12 +87,15 @@ TEST(FsTypeTest, MagicNumbersAndTheRemoteAndImageTable) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
 }
 
-TEST(FileStatTest, TypeSizeAndTimesAndNothingWrittenOnFailure) {
-  static_assert(sizeof(QLIBCFileStatRecord) == 128);
+// Type, size, owner, times, inode and device; the creation time is the
+// birth time where the filesystem records one (the flag says so), else the
+// status-change time; a kernel without statx gets the same from stat.
+// Failures leave the record untouched.
+TEST(FileStatTest, TypeSizeOwnerAndTimesAndNothingWrittenOnFailure) {
   TempDir dir;
-  time_t before = time(nullptr);
-  WriteFile(dir.File("f"), "12345");
-  ASSERT_EQ(symlink(dir.File("f").c_str(), dir.File("link").c_str()), 0);
+  const std::string file = dir.File("f");
+  WriteFile(file, "12345");
+  ASSERT_EQ(symlink(file.c_str(), dir.File("link").c_str()), 0);
   ASSERT_EQ(mkfifo(dir.File("fifo").c_str(), 0600), 0);
   QLIBCFileStatRecord record;
   for (auto [name, type] : {std::pair<const char*, mode_t>{"link", S_IFREG},
@@ -102,20 +105,48 @@ TEST(FileStatTest, TypeSizeAndTimesAndNothingWrittenOnFailure) {
               0);
     EXPECT_EQ(record.uMode & S_IFMT, type) << name;
   }
-  // Dating the file back must not move the creation time: the birth time,
-  // or else the status-change time, both "now".
-  struct timespec times[2] = {{1425719103, 0}, {1425719103, 0}};
-  ASSERT_EQ(utimensat(AT_FDCWD, dir.File("f").c_str(), times, 0), 0);
+  sleep(1);  // the status changes a second after the birth
+  struct timespec times[2] = {{1425719103, 0}, {1425719104, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
+  if (getuid() == 0) {
+    ASSERT_EQ(chown(file.c_str(), 65534, 65533), 0);  // no owner of 0
+  }
+  struct stat st;
+  struct statx stx;
+  ASSERT_EQ(stat(file.c_str(), &st), 0);
+  ASSERT_EQ(statx(AT_FDCWD, file.c_str(), 0, STATX_BTIME, &stx), 0);
+  const bool birth = (stx.stx_mask & STATX_BTIME) != 0;
   memset(&record, 0x5A, sizeof record);
-  ASSERT_EQ(QLIBCFileStat(dir.File("f").c_str(), QLIBC_STAT_TIMES, &record), 0);
+  ASSERT_EQ(QLIBCFileStat(file.c_str(), QLIBC_STAT_TIMES, &record), 0);
   EXPECT_EQ(record.llSize, 5);
-  EXPECT_EQ(record.llMTime, 1425719103);
   EXPECT_EQ(record.llATime, 1425719103);
-  EXPECT_GE(record.llCTime, before - 1);
-  EXPECT_LE(record.llCTime, time(nullptr) + 1);
-  EXPECT_GE(record.llChangeTime, before - 1);
+  EXPECT_EQ(record.llMTime, 1425719104);
+  EXPECT_EQ(record.llChangeTime, st.st_ctime);
+  EXPECT_EQ(record.llCTime, birth ? stx.stx_btime.tv_sec : st.st_ctime);
+  EXPECT_EQ(record.uFlags, birth ? QLIBC_STAT_FLAG_BIRTH_TIME : 0u);
+  EXPECT_EQ(record.uUid, st.st_uid);
+  EXPECT_EQ(record.uGid, st.st_gid);
+  EXPECT_EQ(record.ullInode, st.st_ino);
+  EXPECT_EQ(record.ullDevice, st.st_dev);
   for (unsigned char byte : record.reserved) EXPECT_EQ(byte, 0);
-  // Failures leave the record untouched.
+  QLIBCFileStatRecord from_stat = record;
+  from_stat.llCTime = st.st_ctime;
+  from_stat.uFlags = 0;
+  for (int error : {ENOSYS, EPERM}) {
+    EXPECT_EQ(quvaidx::test::RunWithSyscallsFailing(
+                  {{SYS_statx, error}},
+                  [&] {
+                    QLIBCFileStatRecord got;
+                    memset(&got, 0x5A, sizeof got);
+                    return QLIBCFileStat(file.c_str(), QLIBC_STAT_TIMES,
+                                         &got) == 0 &&
+                                   memcmp(&got, &from_stat, sizeof got) == 0
+                               ? 0
+                               : 1;
+                  }),
+              0)
+        << error;
+  }
   memset(&record, 0x5A, sizeof record);
   EXPECT_EQ(QLIBCFileStat("/nonexistent/f", QLIBC_STAT_TIMES, &record), -1);
   EXPECT_EQ(QLIBCErrGet(), ENOENT);
@@ -125,37 +156,33 @@ TEST(FileStatTest, TypeSizeAndTimesAndNothingWrittenOnFailure) {
   for (size_t i = 0; i < sizeof record; ++i) EXPECT_EQ(bytes[i], 0x5A);
 }
 
-TEST(ReadPidFileTest, Contents) {
+// A pid file holds one positive decimal number. It names a live writer
+// only if its process is running (not a zombie) and did not start after the
+// file was written (a recycled pid).
+TEST(PidFileTest, ContentsAndLiveZombieDeadOrRecycled) {
   TempDir dir;
-  const struct {
-    std::string text;
-    int pid;
-  } cases[] = {{"123\n", 123},
-               {" 42 \r\n", 42},
-               {"2147483647", 2147483647},
-               {"0", -1},
-               {"-5", -1},
-               {"1 2", -1},
-               {"2147483648", -1},
-               {"1" + std::string(100, ' '), -1}};
-  for (const auto& c : cases) {
-    WriteFile(dir.File("pid"), c.text);
-    EXPECT_EQ(QLIBCReadPidFile(dir.File("pid").c_str()), c.pid) << c.text;
+  const std::string pid_file = dir.File("pid");
+  const std::pair<std::string, int> cases[] = {
+      {"123\n", 123},
+      {" 42 \r\n", 42},
+      {"2147483647", 2147483647},
+      {"0", -1},
+      {"-5", -1},
+      {"1 2", -1},
+      {"2147483648", -1},
+      {"1" + std::string(100, ' '), -1}};
+  for (const auto& [text, pid] : cases) {
+    WriteFile(pid_file, text);
+    EXPECT_EQ(QLIBCReadPidFile(pid_file.c_str()), pid) << text;
   }
   EXPECT_EQ(QLIBCReadPidFile("/nonexistent/x.pid"), -1);
   EXPECT_EQ(QLIBCErrGet(), ENOENT);
-}
-
-// A pid file names a live writer only if its process is running (not a
-// zombie) and did not start after the file was written (a recycled pid).
-TEST(ProcAliveTest, LiveZombieDeadOrRecycled) {
-  TempDir dir;
   auto alive = [&](pid_t pid, time_t age) {
-    WriteFile(dir.File("pid"), std::to_string(pid));
+    WriteFile(pid_file, std::to_string(pid));
     struct timespec times[2] = {{time(nullptr) - age, 0},
                                 {time(nullptr) - age, 0}};
-    utimensat(AT_FDCWD, dir.File("pid").c_str(), times, 0);
-    return QLIBCProcAliveByPidFile(dir.File("pid").c_str());
+    utimensat(AT_FDCWD, pid_file.c_str(), times, 0);
+    return QLIBCProcAliveByPidFile(pid_file.c_str());
   };
   pid_t child = fork();
   ASSERT_GE(child, 0);
@@ -173,9 +200,9 @@ TEST(ProcAliveTest, LiveZombieDeadOrRecycled) {
   EXPECT_EQ(alive(child, 0), 0) << "zombie";
   ASSERT_EQ(waitpid(child, nullptr, 0), child);
   EXPECT_EQ(alive(child, 0), 0) << "dead";
+  WriteFile(pid_file, "abc");
+  EXPECT_EQ(QLIBCProcAliveByPidFile(pid_file.c_str()), 0);
   EXPECT_EQ(QLIBCProcAliveByPidFile(dir.File("none").c_str()), 0);
-  WriteFile(dir.File("bad"), "abc");
-  EXPECT_EQ(QLIBCProcAliveByPidFile(dir.File("bad").c_str()), 0);
   EXPECT_EQ(QLIBCProcAliveByPidFile(nullptr), 0);
 }
 

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <string>
+#include <tuple>
 
 #include "support/fake_host.h"
 
@@ -13,7 +14,8 @@ namespace quvahost::test {
 namespace {
 
 const char kDatabase[] =
-    "# shares of this machine\n[video]\npath = /vol1/video\nstatus = 0x20\n\n"
+    "# shares of this machine\npath = /before/any/section\n"
+    "[video]\npath = /vol1/video\nstatus = 0x20\npath = /2nd\nstatus = 2\n\n"
     "[movies]\npath = /vol1/video/movies/\n; no status: not indexed\n"
     "[music]\n  path=/vol1//music  \nstatus = 1\n"
     "[video]\npath = /elsewhere\n"  // a repeated section does not override
@@ -22,6 +24,8 @@ const char kDatabase[] =
     "[broken-status]\npath = /vol1/status\nstatus = twenty\n"
     "[no-path]\nstatus = 0x20\n"
     "[hex]\npath = /h\nstatus = 0X2a\n[max]\npath = /m\nstatus = 4294967295\n"
+    "[hexA]\npath = /h\nstatus = 0xAf\n[hexF]\npath = /h\nstatus = 0XFa\n"
+    "[hexG]\npath = /h\nstatus = 0xG\n[long]\npath = /l\nstatus = 00000000001\n"
     "[over]\npath = /o\nstatus = 4294967296\n[neg]\npath = /n\nstatus = -1\n"
     "[two]\npath = /t\nstatus = 1 2\n[empty]\npath = /e\nstatus =\n";
 
@@ -56,29 +60,32 @@ Found Get(const char* key, bool by_path = false) {
 // Only the first section of a name counts; a share with a bad path or
 // status is not found.
 TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
-  const struct {
-    const char *name, *path;  // path null: not found
-    unsigned status;
-  } cases[] = {{"video", "/vol1/video", 0x20},
-               {"movies", "/vol1/video/movies", 0},
-               {"music", "/vol1/music", 1},
-               {"hex", "/h", 0x2A},
-               {"max", "/m", 0xFFFFFFFF},
-               {"Video", nullptr, 0},
-               {"broken-relative", nullptr, 0},
-               {"broken-dotdot", nullptr, 0},
-               {"broken-status", nullptr, 0},
-               {"no-path", nullptr, 0},
-               {"over", nullptr, 0},
-               {"neg", nullptr, 0},
-               {"two", nullptr, 0},
-               {"empty", nullptr, 0}};
-  for (const auto& c : cases) {
-    Found found = Get(c.name);
-    EXPECT_EQ(found.result, c.path ? 0 : -1) << c.name;
-    EXPECT_EQ(found.path, c.path ? c.path : "") << c.name;
-    EXPECT_EQ(found.status, c.status) << c.name;
-    EXPECT_TRUE(c.path || QLIBCErrGet() == ENOENT) << c.name;
+  // name, path (null: not found), status
+  const std::tuple<const char*, const char*, unsigned> cases[] = {
+      {"video", "/vol1/video", 0x20},
+      {"movies", "/vol1/video/movies", 0},
+      {"music", "/vol1/music", 1},
+      {"hex", "/h", 0x2A},
+      {"max", "/m", 0xFFFFFFFF},
+      {"hexA", "/h", 0xAF},
+      {"hexF", "/h", 0xFA},
+      {"hexG", nullptr, 0},
+      {"long", nullptr, 0},
+      {"Video", nullptr, 0},
+      {"broken-relative", nullptr, 0},
+      {"broken-dotdot", nullptr, 0},
+      {"broken-status", nullptr, 0},
+      {"no-path", nullptr, 0},
+      {"over", nullptr, 0},
+      {"neg", nullptr, 0},
+      {"two", nullptr, 0},
+      {"empty", nullptr, 0}};
+  for (const auto& [name, path, status] : cases) {
+    Found found = Get(name);
+    EXPECT_EQ(found.result, path ? 0 : -1) << name;
+    EXPECT_EQ(found.path, path ? path : "") << name;
+    EXPECT_EQ(found.status, status) << name;
+    EXPECT_TRUE(path || QLIBCErrGet() == ENOENT) << name;
   }
   unlink(Db().c_str());
   EXPECT_EQ(Get("video").result, -1);
@@ -86,16 +93,15 @@ TEST_F(ShareDbTest, GetReadsTheFirstValidSectionNormalized) {
 }
 
 TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
-  const struct {
-    const char* path;
-    const char* share;  // "": no share holds it
-  } cases[] = {{"/vol1/video//a.mkv", "video"},
-               {"/vol1/videos/a.mkv", ""},
-               {"/vol1/video/./movies/x", "movies"},
-               {"/vol1/video/../music", ""},
-               {"vol1/video", ""}};
-  for (const auto& c : cases)
-    EXPECT_EQ(Get(c.path, true).name, c.share) << c.path;
+  const std::pair<const char*, const char*> cases[] = {
+      // "": no share
+      {"/vol1/video//a.mkv", "video"},
+      {"/vol1/videos/a.mkv", ""},
+      {"/vol1/video/./movies/x", "movies"},
+      {"/vol1/video/../music", ""},
+      {"vol1/video", ""}};
+  for (const auto& [path, share] : cases)
+    EXPECT_EQ(Get(path, true).name, share) << path;
   WriteFile(Db(), "[root]\npath = /\n[a]\npath = /a\n");
   EXPECT_EQ(Get("/b/c", true).name, "root");
   EXPECT_EQ(Get("/a/c", true).name, "a");
@@ -106,19 +112,17 @@ TEST_F(ShareDbTest, LookupByPathMatchesWholeComponentsLongestFirst) {
 TEST_F(ShareDbTest, NamesAndPathsFitTheRecord) {
   const std::string name(QUVA_SHARE_NAME_SIZE - 1, 'n');
   const std::string path = "/" + std::string(QUVA_SHARE_PATH_SIZE - 2, 'p');
-  const struct {
-    std::string name, path;
-    int result;
-  } cases[] = {{name, "/a", 0},
-               {name + "n", "/a", -1},
-               {"p", path, 0},
-               {"p", path + "p", -1}};
-  for (const auto& c : cases) {
-    WriteFile(Db(), "[" + c.name + "]\npath = " + c.path + "\n");
-    Found found = Get(c.name.c_str());
-    EXPECT_EQ(found.result, c.result) << c.name.size() << " " << c.path.size();
-    EXPECT_EQ(found.path, c.result == 0 ? c.path : "");
-    EXPECT_TRUE(c.result == 0 || QLIBCErrGet() == ENOENT);
+  const std::tuple<std::string, std::string, int> cases[] = {
+      {name, "/a", 0},
+      {name + "n", "/a", -1},
+      {"p", path, 0},
+      {"p", path + "p", -1}};
+  for (const auto& [share, share_path, result] : cases) {
+    WriteFile(Db(), "[" + share + "]\npath = " + share_path + "\n");
+    Found found = Get(share.c_str());
+    EXPECT_EQ(found.result, result) << share.size() << " " << share_path.size();
+    EXPECT_EQ(found.path, result == 0 ? share_path : "");
+    EXPECT_TRUE(result == 0 || QLIBCErrGet() == ENOENT);
   }
 }
 
@@ -165,6 +169,7 @@ TEST_F(ShareDbTest, RefusedCallsChangeNothing) {
 }
 
 TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
+  quvaidx::test::FdLeakCheck leaks;
   std::string target = etc_.File("real.conf");
   rename(Db().c_str(), target.c_str());
   ASSERT_EQ(symlink(target.c_str(), Db().c_str()), 0);
@@ -176,6 +181,7 @@ TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
   ASSERT_EQ(stat(target.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0640u);
   EXPECT_EQ(Get("music").status, 0x21u);
+  EXPECT_TRUE(leaks.NoLeak());
   std::filesystem::directory_iterator entries(etc_.path()), end;
   EXPECT_LE(std::distance(entries, end), 3) << "link, target and lock only";
 }

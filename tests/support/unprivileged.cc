@@ -1,7 +1,11 @@
 #include "support/unprivileged.h"
 
 #include <grp.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
 #include <signal.h>
+#include <stddef.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -56,6 +60,27 @@ int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
         alarm(seconds);
         return signal(SIGXFSZ, SIG_IGN) != SIG_ERR &&
                setrlimit(RLIMIT_FSIZE, &limit) == 0;
+      },
+      check);
+}
+
+int RunWithSyscallsFailing(const std::vector<std::pair<long, int>>& failures,
+                           const std::function<int()>& check) {
+  return RunInChild(
+      [&] {
+        std::vector<sock_filter> program = {BPF_STMT(
+            BPF_LD | BPF_W | BPF_ABS, offsetof(struct seccomp_data, nr))};
+        for (const auto& [number, error] : failures) {
+          program.push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K,
+                                     static_cast<__u32>(number), 0, 1));
+          program.push_back(
+              BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | (error & 0xffff)));
+        }
+        program.push_back(BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW));
+        sock_fprog filter = {static_cast<unsigned short>(program.size()),
+                             program.data()};
+        return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
+               prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter) == 0;
       },
       check);
 }

@@ -1,11 +1,13 @@
 // Runs a check in a child process with less than this process may do: as
 // an unprivileged user, so that permission failures happen even when the
-// tests run as root, or with a file-size limit, so that writes fail as on a
-// full disk.
+// tests run as root; with a file-size limit, so that writes fail as on a
+// full disk; or with chosen system calls failing, as on kernels and
+// filesystems without them.
 #ifndef QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 #define QUVAIDX_TESTS_SUPPORT_UNPRIVILEGED_H_
 
 #include <functional>
+#include <utility>
 #include <vector>
 
 namespace quvaidx::test {
@@ -32,6 +34,13 @@ int RunAsUser(unsigned uid, unsigned gid, const std::vector<unsigned>& groups,
 // Returns the value `check` returned, or -1 when the child did not finish.
 int RunWithFileSizeLimit(long bytes, const std::function<int()>& check,
                          unsigned seconds = 5);
+
+// Runs `check` in a child process in which every call of each system call
+// number of `failures` fails at once with its errno value (a seccomp filter),
+// as on a filesystem or kernel without that call. Returns the value `check`
+// returned, or -1 when the child could not run it.
+int RunWithSyscallsFailing(const std::vector<std::pair<long, int>>& failures,
+                           const std::function<int()>& check);
 
 }  // namespace quvaidx::test
 

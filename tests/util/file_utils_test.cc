@@ -1,10 +1,13 @@
-// Non-replacing renames and head trimming on real files.
+// Canonical paths, non-replacing renames and head trimming on real files.
 #include <dirent.h>
-#include <fcntl.h>
+#include <limits.h>
+#include <stdlib.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -16,14 +19,11 @@
 
 namespace {
 
-using quvaidx::test::FakeSleep;
-using quvaidx::test::kNobody;
 using quvaidx::test::LogCapture;
+using quvaidx::test::ReadFile;
 using quvaidx::test::RunUnprivileged;
 using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::TempDir;
-
-using quvaidx::test::ReadFile;
+using quvaidx::test::RunWithSyscallsFailing;
 using quvaidx::test::WriteFile;
 
 int EntriesIn(const std::string& dir) {
@@ -36,14 +36,41 @@ int EntriesIn(const std::string& dir) {
 
 class FileTest : public ::testing::Test {
  protected:
-  TempDir dir_;
+  quvaidx::test::TempDir dir_;
   std::string source_ = dir_.File("source");
   std::string destination_ = dir_.File("destination");
 };
 
+// Links and dots are resolved; a path that does not resolve is handed back
+// as it came; only null fails, with a line. The caller frees the result.
+TEST_F(FileTest, RealPathResolvesOrKeepsThePath) {
+  char real_dir[PATH_MAX];
+  ASSERT_NE(realpath(dir_.path().c_str(), real_dir), nullptr);
+  ASSERT_EQ(symlink(".", dir_.File("here").c_str()), 0);
+  const std::pair<std::string, std::string> cases[] = {
+      {dir_.File("here/./here/"), real_dir},
+      {dir_.File("missing/../x"), dir_.File("missing/../x")}};
+  for (const auto& [path, expected] : cases) {
+    char* got = GetRealPath(path.c_str());
+    ASSERT_NE(got, nullptr) << path;
+    EXPECT_EQ(got, expected);
+    free(got);
+  }
+  LogCapture log;
+  EXPECT_EQ(GetRealPath(nullptr), nullptr);
+  EXPECT_EQ(log.Count("quvaidx_system:N [Error] GetRealPath: (null)"), 1);
+}
+
 // The source moves unless the destination exists, also when the existence
-// test cannot see it (a dangling link, like one created just after it).
+// test cannot see it (a dangling link, like one created just after it). A
+// missing source fails quietly, a missing folder at once, a persistent
+// failure (a folder into itself: EINVAL) after sixteen tries, each followed
+// by a yield through the sleep seam.
 TEST_F(FileTest, RenameNeverReplacesTheDestination) {
+  LogCapture log;
+  quvaidx::test::FakeSleep sleep;
+  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
+  EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
   EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
   EXPECT_EQ(ReadFile(destination_), "s");
@@ -59,20 +86,9 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
   char target[64] = "";
   ASSERT_GT(readlink(destination_.c_str(), target, sizeof(target) - 1), 0);
   EXPECT_STREQ(target, "nowhere");
-}
-
-// A missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries, each followed
-// by a yield through the sleep seam.
-TEST_F(FileTest, RenameFailures) {
-  LogCapture log;
-  FakeSleep sleep;
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
-  EXPECT_TRUE(log.lines().empty());
-  WriteFile(source_, "s");
   std::string nowhere = dir_.File("no/such/dir");
   EXPECT_EQ(RenameFile(source_.c_str(), nowhere.c_str()), -1);
-  EXPECT_EQ(ReadFile(source_), "s");
+  EXPECT_EQ(ReadFile(source_), "t");
   EXPECT_EQ(sleep.yields(), 0);
   ASSERT_EQ(mkdir(dir_.File("d").c_str(), 0755), 0);
   std::string inside = dir_.File("d/sub");
@@ -87,34 +103,60 @@ TEST_F(FileTest, RenameFailures) {
               " -> " + inside}));
 }
 
+// Where the filesystem cannot rename without replacing, a hard link stands
+// in, failing instead of replacing; where it has no hard links either, the
+// plain rename after the existence test is all there is.
+TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
+  const std::vector<std::pair<long, int>> kinds[] = {
+      {{SYS_renameat2, EINVAL}},
+      {{SYS_renameat2, ENOSYS}, {SYS_link, EPERM}, {SYS_linkat, EPERM}}};
+  for (const auto& failures : kinds) {
+    WriteFile(source_, "s");
+    unlink(destination_.c_str());
+    EXPECT_EQ(
+        RunWithSyscallsFailing(
+            failures,
+            [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
+        0);
+    EXPECT_EQ(ReadFile(destination_), "s");
+    EXPECT_NE(access(source_.c_str(), F_OK), 0);
+  }
+  WriteFile(source_, "t");
+  ASSERT_EQ(unlink(destination_.c_str()), 0);
+  ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
+  EXPECT_EQ(
+      RunWithSyscallsFailing(
+          kinds[0],
+          [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
+      0);
+  EXPECT_EQ(ReadFile(source_), "t");
+}
+
 // The first n lines go (none for n <= 0), across copy blocks too; the file
 // keeps its owner and mode, and no temporary file stays. What is no regular
 // file is refused at once: a trimmer must not wait on a FIFO planted at a
 // queue path for a writer that never comes.
 TEST_F(FileTest, TrimDropsTheFirstLines) {
-  const struct {
-    std::string text;
-    int n;
-    std::string left;
-  } kCases[] = {{"a\nb\nc\n", 1, "b\nc\n"},
-                {"a\nb\n", 0, "a\nb\n"},
-                {"a\nb\n", -4, "a\nb\n"},
-                {"a\nb\n", 99, ""},
-                {"a\nb\nlast", 2, "last"},
-                {"\n\nx\n", 2, "x\n"},
-                {std::string(200000, 'f') + "\n" + std::string(70000, 's'), 1,
-                 std::string(70000, 's')}};  // across copy blocks
+  const std::tuple<std::string, int, std::string> kCases[] = {
+      {"a\nb\nc\n", 1, "b\nc\n"},
+      {"a\nb\n", 0, "a\nb\n"},
+      {"a\nb\n", -4, "a\nb\n"},
+      {"a\nb\n", 99, ""},
+      {"a\nb\nlast", 2, "last"},
+      {"\n\nx\n", 2, "x\n"},
+      {std::string(200000, 'f') + "\n" + std::string(70000, 's'), 1,
+       std::string(70000, 's')}};  // across copy blocks
   WriteFile(source_, "");
   ASSERT_EQ(chmod(source_.c_str(), 02640), 0);
-  if (getuid() == 0) {
-    ASSERT_EQ(chown(source_.c_str(), kNobody, kNobody), 0);
-  }
+  ASSERT_EQ(
+      chown(source_.c_str(), quvaidx::test::kNobody, quvaidx::test::kNobody),
+      0);
   struct stat before, after;
   ASSERT_EQ(stat(source_.c_str(), &before), 0);
-  for (const auto& c : kCases) {
-    WriteFile(source_, c.text);
-    ASSERT_EQ(FileRemoveHeadingLine(source_.c_str(), c.n), 0);
-    EXPECT_EQ(ReadFile(source_), c.left) << c.text.substr(0, 9) << " " << c.n;
+  for (const auto& [text, n, left] : kCases) {
+    WriteFile(source_, text);
+    ASSERT_EQ(FileRemoveHeadingLine(source_.c_str(), n), 0);
+    EXPECT_EQ(ReadFile(source_), left) << text.substr(0, 9) << " " << n;
   }
   ASSERT_EQ(stat(source_.c_str(), &after), 0);
   EXPECT_EQ(after.st_mode & 07777, before.st_mode & 07777);
@@ -123,18 +165,26 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
   EXPECT_EQ(EntriesIn(dir_.path()), 1);
   const std::string fifo = dir_.File("fifo");
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  ASSERT_EQ(symlink(source_.c_str(), dir_.File("link").c_str()), 0);
+  LogCapture log;
   alarm(5);  // a trim that waits on the FIFO ends the test here
-  for (const std::string& odd : {destination_, dir_.path(), fifo}) {
+  for (const std::string& odd :
+       {destination_, dir_.path(), fifo, dir_.File("link")}) {
     EXPECT_EQ(FileRemoveHeadingLine(odd.c_str(), 1), -1) << odd;
   }
   alarm(0);
   EXPECT_EQ(FileRemoveHeadingLine(nullptr, 1), -1);
-  EXPECT_EQ(EntriesIn(dir_.path()), 2);  // the source and the FIFO
+  EXPECT_EQ(EntriesIn(dir_.path()), 3);  // the source, the FIFO, the link
+  EXPECT_EQ(
+      log.Normalized(),
+      std::vector<std::string>{"quvaidx_system:N [Error] " + dir_.File("link") +
+                               " is a symbolic link; not trimmed"});
 }
 
-// A disk that fills while the copy is written must fail the trim and keep
-// every line: reporting success would replace the queue by a cut copy.
-// The failed write must not be retried for ever either.
+// A disk that fills while the copy is written, or a file of another user,
+// must fail the trim and keep every line: reporting success would replace
+// the queue by a cut copy. The failed write must not be retried for ever
+// either, and the temporary file goes.
 TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
   std::string text;
   for (int i = 0; i < 300; ++i)
@@ -144,21 +194,12 @@ TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
     return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
   };
   EXPECT_EQ(RunWithFileSizeLimit(1000, trim_fails), 0);
-  EXPECT_EQ(ReadFile(source_), text);
-  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
-}
-
-TEST_F(FileTest, TrimLeavesAnotherUsersFileUnchanged) {
-  if (getuid() != 0) GTEST_SKIP() << "needs root to own a file as another user";
-  WriteFile(source_, "a\nb\n");
-  chmod(source_.c_str(), 0644);
   chmod(dir_.path().c_str(), 0777);  // the trimmer may create its copy
-  EXPECT_EQ(RunUnprivileged([&] {
-              return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
-            }),
-            0);
-  EXPECT_EQ(ReadFile(source_), "a\nb\n");
-  EXPECT_EQ(EntriesIn(dir_.path()), 1);  // its temporary file removed
+  if (getuid() == 0) {
+    EXPECT_EQ(RunUnprivileged(trim_fails), 0);
+  }
+  EXPECT_EQ(ReadFile(source_), text);
+  EXPECT_EQ(EntriesIn(dir_.path()), 1);
 }
 
 }  // namespace

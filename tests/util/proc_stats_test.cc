@@ -20,10 +20,15 @@ namespace {
 TEST(ProcStatsTest, OwnAndMissingProcess) {
   EXPECT_EQ(GetFileDescriptorNum(getpid()),
             quvaidx::test::OpenDescriptorCount() + 2);
+  long rss = 0, vmsize = 0, total = 0;
+  ASSERT_EQ(GetMemoryUsagekb(getpid(), rss, vmsize), 0);
+  EXPECT_GT(rss, 0);
+  EXPECT_GE(vmsize, rss);
+  ASSERT_EQ(GetTotalMemory(total), 0);
+  EXPECT_GT(total, rss);
   pid_t dead = fork();
   if (dead == 0) _exit(0);
   waitpid(dead, nullptr, 0);
-  long rss = 0, vmsize = 0;
   EXPECT_EQ(GetFileDescriptorNum(dead), 0);
   EXPECT_EQ(GetMemoryUsagekb(dead, rss, vmsize), -1);
   EXPECT_EQ(rss, -1);
@@ -31,8 +36,8 @@ TEST(ProcStatsTest, OwnAndMissingProcess) {
 }
 
 // A label is found anywhere in a line, and counts without a number; only
-// the first 4 KiB are read.
-TEST(ProcParseTest, StatusLines) {
+// the first 4 KiB are read; the first MemTotal counts.
+TEST(ProcParseTest, StatusAndMemInfoLines) {
   const struct {
     std::string text;
     bool found;
@@ -42,6 +47,7 @@ TEST(ProcParseTest, StatusLines) {
       {"Name:\tkthreadd\nState:\tS\n", false, -1, -1},  // a kernel thread
       {"VmRSS:\nVmSize:\t9 kB\n", true, -1, 9},         // label, no number
       {"xVmRSS: 1 kB\nVmSize:x 2 kB\n", true, 1, 2},    // found anywhere
+      {"VmRSS: 1 kB\n", false, 1, -1},
       {std::string(4090, 'x') + "\nVmRSS: 1 kB\n", false, -1, -1}};  // > 4 KiB
   for (const auto& c : kCases) {
     long rss = 0, vmsize = 0;
@@ -52,9 +58,6 @@ TEST(ProcParseTest, StatusLines) {
     EXPECT_EQ(rss, c.rss) << c.text.substr(0, 40);
     EXPECT_EQ(vmsize, c.vmsize) << c.text.substr(0, 40);
   }
-}
-
-TEST(ProcParseTest, MemTotal) {
   std::string text = "MemFree: 1 kB\nMemTotal:  24000000 kB\nMemTotal: 3\n";
   long total = 0;
   EXPECT_TRUE(quvaidx::ParseMemInfo(text.data(), text.size(), &total));
