@@ -164,7 +164,7 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
 // entry is still queued. Started again, the daemon completes it without
 // being woken, over the killed one's pid file, and leaves no temporary
 // file, not even one that a kill while writing left beside thumbnails that
-// are up to date.
+// are up to date, nor a copy of the queue that a killed rewrite left.
 TEST_F(ThumbDaemonTest, StoppedOrKilledMidEntryCompletesItWhenRestarted) {
   for (const char* name : {"1.jpg", "2.jpg", "3.jpg"}) Photo(name);
   ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
@@ -187,9 +187,11 @@ TEST_F(ThumbDaemonTest, StoppedOrKilledMidEntryCompletesItWhenRestarted) {
     EXPECT_FALSE(TemporaryFilesLeft());
   }
   WriteFile(ThumbItem(share_ + "/1.jpg", "B") + ".part-k1lled", "half a JPEG");
+  WriteFile(queue_ + ".k1lled", share_ + "\n");  // a rewrite's copy
   DaemonProcess again;
   ASSERT_TRUE(Start(again)) << again.Errors();
   ASSERT_TRUE(Served()) << again.Errors();
+  EXPECT_FALSE(Exists(queue_ + ".k1lled"));
   for (const char* name : {"1.jpg", "2.jpg", "3.jpg"}) {
     EXPECT_TRUE(AllThumbs(name)) << name;
   }
