@@ -3,7 +3,7 @@
 //
 // Map: the fixture; requests, replies and handlers; the socket file;
 // running out of descriptors; peers that vanish, stall, half-close or hoard
-// their replies.
+// their replies; deferred replies.
 #include "quvaidx/daemon.h"
 
 #include <errno.h>
@@ -40,8 +40,12 @@ using quvaidx::test::ListenUnix;
 using quvaidx::test::LogCapture;
 using quvaidx::test::TempDir;
 using Clock = std::chrono::steady_clock;
+using Handler = std::function<int(Json::Value&, Json::Value&)>;
 
 const std::string kSuccess = "{\"success\":true}\n";
+const std::string kTooLarge =
+    "{\"reason\":\"reply too large\",\"success\":false}\n";
+const std::string kError = "quvaidx_daemon:N [Error] ";
 
 std::string Packet(const std::string& body) {
   const size_t n = body.size();
@@ -49,8 +53,13 @@ std::string Packet(const std::string& body) {
          static_cast<char>(n & 0xff) + body;
 }
 
-std::string Request(const std::string& command) {
-  return Packet("{\"command\":\"" + command + "\"}\n");
+// `n` copies of the request for `command`, to be sent at once.
+std::string Requests(const std::string& command, int n = 1) {
+  std::string requests;
+  for (int i = 0; i < n; ++i) {
+    requests += Packet("{\"command\":\"" + command + "\"}\n");
+  }
+  return requests;
 }
 
 long long MsSince(Clock::time_point start) {
@@ -59,16 +68,23 @@ long long MsSince(Clock::time_point start) {
       .count();
 }
 
-// `n` copies of the request for `command`, to be sent at once.
-std::string Requests(const std::string& command, int n) {
-  std::string requests;
-  for (int i = 0; i < n; ++i) requests += Request(command);
-  return requests;
-}
-
 int Succeed(Json::Value&, Json::Value& reply) {
   reply = MakeResponse(true, nullptr);
   return 0;
+}
+
+// Replies {"blob":"bbb..."} of `size` bytes of b; refuses `refused`.
+Handler Blob(size_t size, const std::string& refused = "") {
+  return [size, refused](Json::Value& request, Json::Value& reply) {
+    reply["blob"] = std::string(size, 'b');
+    return request["command"] == refused ? -1 : 0;
+  };
+}
+
+// Replies {"echo":command}; refuses QUIT.
+int Echo(Json::Value& request, Json::Value& reply) {
+  reply["echo"] = request["command"];
+  return request["command"] == "QUIT" ? -1 : 0;
 }
 
 // The server on a fresh event base; every request is recorded in requests_
@@ -112,6 +128,12 @@ class EventServerTest : public ::testing::Test {
     int fd = RawConnect();
     RunFor(2);  // accept
     return fd;
+  }
+
+  // Closes a client before the test ends.
+  void Drop(int fd) {
+    close(fd);
+    clients_.erase(std::find(clients_.begin(), clients_.end(), fd));
   }
 
   void Send(int fd, const std::string& bytes) {
@@ -168,6 +190,12 @@ class EventServerTest : public ::testing::Test {
                            static_cast<unsigned char>(header[3]));
   }
 
+  // Sends the request for `command` and returns the reply's body.
+  std::string Ask(int fd, const std::string& command) {
+    Send(fd, Requests(command));
+    return ReceiveBody(fd);
+  }
+
   // Sends bytes[*sent, end) on fd, running the loop, for as long as the
   // server takes them within `ms`; advances *sent.
   void SendAsTaken(int fd, const std::string& bytes, size_t* sent, int ms) {
@@ -202,7 +230,7 @@ class EventServerTest : public ::testing::Test {
   std::string path_ = dir_.File("testd.sock");
   struct event_base* base_ = nullptr;
   EventArgs args_{};
-  std::function<int(Json::Value&, Json::Value&)> handler_;
+  Handler handler_;
   std::vector<Json::Value> requests_;
   std::vector<int> clients_;
   std::map<int, std::string> pending_;
@@ -214,7 +242,7 @@ TEST_F(EventServerTest, SuccessReplyIsExactly21Bytes) {
   handler_ = Succeed;
   Start();
   int fd = Connect();
-  const std::string packet = Request("HANDSHAKE");
+  const std::string packet = Requests("HANDSHAKE");
   for (size_t i = 0; i + 1 < packet.size(); ++i) {
     Send(fd, packet.substr(i, 1));
     RunFor(1);
@@ -225,19 +253,16 @@ TEST_F(EventServerTest, SuccessReplyIsExactly21Bytes) {
   ASSERT_EQ(requests_.size(), 1u);
   EXPECT_EQ(requests_[0]["command"].asString(), "HANDSHAKE");
   handler_ = nullptr;
-  Send(fd, Request("UNTOUCHED"));
-  EXPECT_EQ(ReceiveBody(fd), "{}\n");
+  EXPECT_EQ(Ask(fd, "UNTOUCHED"), "{}\n");
 }
 
 // The handler learns who is asking (nobody, outside its calls): the
-// process, its user and group, and all the groups it holds, however many
-// (more than a first guess of the count), which need not be those the
-// group database gives its user (here it gives none).
+// process, its user and group, and all the groups it holds, however many,
+// which need not be those the group database gives its user (here none).
 TEST_F(EventServerTest, HandlerLearnsThePeerAndTheGroupsItHolds) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to make a peer of groups";
-  std::vector<gid_t> groups;
-  for (gid_t gid = 48400; gid > 48300; --gid) groups.push_back(gid);
-  std::vector<gid_t> seen;
+  std::vector<gid_t> groups, seen;
+  for (gid_t gid = 48301; gid <= 48400; ++gid) groups.push_back(gid);
   PeerCredentials peer = {};
   handler_ = [&](Json::Value& request, Json::Value& reply) {
     EXPECT_EQ(GetPeerGroups(&seen), 0);
@@ -251,7 +276,8 @@ TEST_F(EventServerTest, HandlerLearnsThePeerAndTheGroupsItHolds) {
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {  // no gtest here: the exit status says how it went
-    if (setgroups(groups.size(), groups.data()) != 0 || setresgid(48211, 48211, 48211) != 0 ||
+    if (setgroups(groups.size(), groups.data()) != 0 ||
+        setresgid(48211, 48211, 48211) != 0 ||
         setresuid(48211, 48211, 48211) != 0) {
       _exit(2);
     }
@@ -266,7 +292,6 @@ TEST_F(EventServerTest, HandlerLearnsThePeerAndTheGroupsItHolds) {
   waitpid(child, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
   std::sort(seen.begin(), seen.end());
-  std::sort(groups.begin(), groups.end());
   EXPECT_EQ(seen, groups);
   EXPECT_TRUE(peer.uid == 48211 && peer.gid == 48211 && peer.pid == child);
   std::vector<gid_t> outside = {1};
@@ -277,25 +302,22 @@ TEST_F(EventServerTest, HandlerLearnsThePeerAndTheGroupsItHolds) {
   EXPECT_EQ(untouched.pid, -7);
 }
 
-// Pipelined requests are all answered at once, in order, without waiting
-// for another byte. A non-zero handler result closes the connection without
-// a reply, after the earlier replies; other connections go on.
+// Pipelined requests are all answered at once, in order. A non-zero handler
+// result closes the connection without a reply, after the earlier replies;
+// other connections go on.
 TEST_F(EventServerTest, PipelinedRequestsAndRefusal) {
-  handler_ = [](Json::Value& request, Json::Value& reply) {
-    reply["echo"] = request["command"];
-    return request["command"] == "QUIT" ? -1 : 0;
-  };
+  handler_ = Echo;
   Start();
   int fd = Connect();
   int other = Connect();
-  Send(fd, Request("ONE") + Request("TWO") + Request("QUIT") + Request("NO"));
+  Send(fd,
+       Requests("ONE") + Requests("TWO") + Requests("QUIT") + Requests("NO"));
   EXPECT_EQ(ReceiveBody(fd), "{\"echo\":\"ONE\"}\n");
   EXPECT_EQ(ReceiveBody(fd), "{\"echo\":\"TWO\"}\n");
   EXPECT_TRUE(ClosedSilently(fd));
   EXPECT_EQ(requests_.size(), 3u);
   EXPECT_EQ(GetCurrentConnCount(), 1);
-  Send(other, Request("STILL_HERE"));
-  EXPECT_EQ(ReceiveBody(other), "{\"echo\":\"STILL_HERE\"}\n");
+  EXPECT_EQ(Ask(other, "STILL_HERE"), "{\"echo\":\"STILL_HERE\"}\n");
 }
 
 // A body the JSON reader rejects must not run with half-read arguments: the
@@ -334,19 +356,12 @@ TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
   };
   Start();
   int boom = Connect();
-  Send(boom, Request("BOOM"));
+  Send(boom, Requests("BOOM"));
   EXPECT_TRUE(ClosedSilently(boom));
-  EXPECT_EQ(log.Normalized(),
-            std::vector<std::string>{
-                "quvaidx_daemon:N [Error] [testd] handler threw: bad day"});
-  handler_ = [](Json::Value&, Json::Value& reply) {
-    reply["blob"] = std::string(20000, 'b');
-    return 0;
-  };
-  int big = Connect();
-  Send(big, Request("BIG"));
-  EXPECT_EQ(ReceiveBody(big),
-            "{\"reason\":\"reply too large\",\"success\":false}\n");
+  EXPECT_EQ(log.Normalized(), std::vector<std::string>{
+                                  kError + "[testd] handler threw: bad day"});
+  handler_ = Blob(20000);
+  EXPECT_EQ(Ask(Connect(), "BIG"), kTooLarge);
   int fd = Connect();
   Send(fd, std::string("\x15\xbe\x40\x00{}", 6));  // announces 16384 bytes
   EXPECT_TRUE(ClosedSilently(fd));
@@ -356,8 +371,8 @@ TEST_F(EventServerTest, ThrowingHandlerAndOversizedPackets) {
 }
 
 // Only a stale socket is replaced. Anything else at the path stays as it
-// was: a regular file, a directory, a link, and above all a socket a daemon
-// still listens on, whose clients would otherwise be taken over.
+// was, above all a socket a daemon still listens on, whose clients would
+// otherwise be taken over.
 TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   int live = ListenUnix(dir_.File("live.sock"), 4);
   ASSERT_GE(live, 0);
@@ -370,7 +385,7 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   struct Case {
     const char* name;
     int result;
-    std::string line;  // after "quvaidx_daemon:N [Error] " and the path
+    std::string line;  // after kError and the path
     int error;         // errno after a refusal
     mode_t type;       // what is at the path afterwards
   } cases[] = {
@@ -384,13 +399,12 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
     const std::string path = dir_.File(c.name);
-    struct stat before = {};
+    struct stat before = {}, after = {};
     lstat(path.c_str(), &before);
     LogCapture log;
     errno = 0;
     EXPECT_EQ(BuildServer(base_, path.c_str(), &args_), c.result);
     EXPECT_EQ(g_listener != nullptr, c.result == 0);
-    struct stat after = {};
     ASSERT_EQ(lstat(path.c_str(), &after), 0);
     EXPECT_EQ(after.st_mode & S_IFMT, c.type);
     if (c.result == 0) {
@@ -400,9 +414,8 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
     }
     EXPECT_EQ(errno, c.error);
     EXPECT_EQ(after.st_ino, before.st_ino);
-    EXPECT_EQ(
-        log.Normalized(),
-        std::vector<std::string>{"quvaidx_daemon:N [Error] " + path + c.line});
+    EXPECT_EQ(log.Normalized(),
+              std::vector<std::string>{kError + path + c.line});
   }
   close(live);
 }
@@ -416,7 +429,7 @@ TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
   int elsewhere = ListenUnix(dir_.File("elsewhere.sock"), 4);
   int pipe_ends[2];
   ASSERT_EQ(pipe(pipe_ends), 0);
-  struct Case {
+  const struct {
     const char* name;
     int fd;
     int error;
@@ -424,7 +437,7 @@ TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
                  {"datagram", datagram, EINVAL},
                  {"not listening", unbound, EINVAL},
                  {"other path", elsewhere, EADDRNOTAVAIL}};
-  for (const Case& c : refused) {
+  for (const auto& c : refused) {
     SCOPED_TRACE(c.name);
     LogCapture log;
     errno = 0;
@@ -439,9 +452,7 @@ TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
   int handed = ListenUnix(path_, 4);
   ASSERT_EQ(BuildServerOnSocket(base_, handed, path_.c_str(), &args_), 0);
   EXPECT_NE(fcntl(handed, F_GETFL) & O_NONBLOCK, 0);
-  int fd = Connect();
-  Send(fd, Request("HANDSHAKE"));
-  EXPECT_EQ(ReceiveBody(fd), "{}\n");
+  EXPECT_EQ(Ask(Connect(), "HANDSHAKE"), "{}\n");
   StopServer(path_.c_str());
   struct stat st;
   EXPECT_EQ(lstat(path_.c_str(), &st), 0) << "the manager's socket was removed";
@@ -454,8 +465,10 @@ TEST_F(EventServerTest, HandedOverSocketIsCheckedAndItsFileKept) {
 }
 
 // An overlong path is refused, not cut: the file at the cut path stays. A
-// second server is refused.
-TEST_F(EventServerTest, OverlongPathAndSecondServer) {
+// second server is refused. An accept error other than running out of
+// descriptors is logged with its errno and ends the loop; the listener
+// stays.
+TEST_F(EventServerTest, OverlongPathSecondServerAndAcceptError) {
   LogCapture log;
   std::string too_long = dir_.File(std::string(120, 'l'));
   std::string cut = too_long.substr(0, kMaxSocketPath);
@@ -470,6 +483,14 @@ TEST_F(EventServerTest, OverlongPathAndSecondServer) {
   std::string other = dir_.File("other.sock");
   EXPECT_EQ(BuildServer(base_, other.c_str(), &args_), -1);
   EXPECT_NE(access(other.c_str(), F_OK), 0);
+  log.Clear();
+  errno = EINVAL;
+  OnAcceptError(g_listener, &args_);
+  EXPECT_EQ(event_base_dispatch(base_), 0);  // returns at once
+  EXPECT_EQ(
+      log.Normalized(),
+      std::vector<std::string>{kError + "OnAcceptError: 22, Invalid argument"});
+  EXPECT_NE(g_listener, nullptr);
 }
 
 // Without an access record the socket file follows the umask; with one it
@@ -503,26 +524,10 @@ TEST_F(EventServerTest, SocketModeAndGroup) {
             0);
 }
 
-// An accept error other than running out of descriptors is logged with its
-// errno and ends the loop; the listener itself is kept.
-TEST_F(EventServerTest, AcceptErrorEndsTheLoop) {
-  LogCapture log;
-  Start();
-  errno = EINVAL;
-  OnAcceptError(g_listener, &args_);
-  EXPECT_EQ(event_base_dispatch(base_), 0);  // returns at once
-  EXPECT_EQ(log.Normalized(),
-            (std::vector<std::string>{
-                "quvaidx_daemon:N [Error] OnAcceptError: 22, Invalid "
-                "argument"}));
-  EXPECT_NE(g_listener, nullptr);
-}
-
 // Out of descriptors, the daemon's loop goes on. With no connection to
-// give up, accepting pauses and resumes. When a flood of connections stalled
-// in a request holds the descriptors, the longest waiting are given up, so
-// a client that then asks is answered long before the deadlines would have
-// freed anything.
+// give up, accepting pauses and resumes. When connections stalled in a
+// request hold the descriptors, the longest waiting are given up, so a
+// client that then asks is answered long before any deadline.
 TEST_F(EventServerTest, RunningOutOfDescriptorsLocksNoClientOut) {
   LogCapture log;
   handler_ = Succeed;
@@ -543,40 +548,34 @@ TEST_F(EventServerTest, RunningOutOfDescriptorsLocksNoClientOut) {
     setrlimit(RLIMIT_NOFILE, &saved);
   };
   const std::string accept_failed =
-      "quvaidx_daemon:N [Error] accept: 24, Too many open files; ";
+      kError + "accept: 24, Too many open files; ";
   int fd = RawConnect();
   exhaust(0);
   RunFor(20);
   EXPECT_EQ(GetCurrentConnCount(), 0);
   EXPECT_EQ(log.Count(accept_failed + "pausing for 100 ms"), 1);
   restore();
-  Send(fd, Request("HANDSHAKE"));
+  Send(fd, Requests("HANDSHAKE"));
   EXPECT_EQ(ReceiveBody(fd, 3000), kSuccess);
   for (int i = 0; i < 40; ++i) Send(Connect(), std::string("\x15\xbe", 2));
   RunFor(150);  // all accepted, and stalled for longer than a pause
   ASSERT_EQ(GetCurrentConnCount(), 41);
   exhaust(1);  // room for one more client
-  int asking = RawConnect();
-  Send(asking, Request("HELLO"));
-  EXPECT_EQ(ReceiveBody(asking), kSuccess);
+  EXPECT_EQ(Ask(RawConnect(), "HELLO"), kSuccess);
   restore();
   EXPECT_EQ(log.Count(accept_failed + "closed 16 stalled connections"), 1);
   EXPECT_EQ(GetCurrentConnCount(), 41 + 1 - 16);
 }
 
 // Replies to a client that does not read are bounded, and all sent once it
-// reads, big ones (4 MB) and many small ones still queued when the end of
-// the stream arrives: a client that shut down its sending side after its
-// requests still gets every reply, in order, before the server closes.
+// reads, big ones (4 MB) and many small ones still queued when a client
+// that shut down its sending side after its requests ends its stream: in
+// order, before the server closes.
 TEST_F(EventServerTest, RepliesToASlowHalfClosedClientAreBoundedAndAllSent) {
   Start();
-  for (const auto& [blob_size, count] : 
-                                     {std::pair(10000, 400), std::pair(0, 20000)}) {
-    const std::string blob(static_cast<size_t>(blob_size), 'r');
-    handler_ = [&](Json::Value&, Json::Value& reply) {
-      reply["blob"] = blob;
-      return 0;
-    };
+  for (const auto& [blob_size, count] :
+       {std::pair(10000, 400), std::pair(0, 20000)}) {
+    handler_ = Blob(blob_size);
     requests_.clear();
     const std::string requests = Requests("R", count);
     int fd = Connect();
@@ -587,10 +586,12 @@ TEST_F(EventServerTest, RepliesToASlowHalfClosedClientAreBoundedAndAllSent) {
     // Served: what fits the pending-output bound plus the socket buffers.
     if (blob_size > 0) {
       EXPECT_LT(requests_.size(), static_cast<size_t>(count));
-      EXPECT_LT(requests_.size() * blob.size(),
+      EXPECT_LT(requests_.size() * blob_size,
                 kMaxPendingOutput + 2 * 1024 * 1024);
     }
-    const std::string reply = Packet("{\"blob\":\"" + blob + "\"}\n");
+    const std::string reply =
+        Packet("{\"blob\":\"" +
+               std::string(static_cast<size_t>(blob_size), 'b') + "\"}\n");
     bool closed = false;
     const std::string received =
         Receive(fd, reply.size() * count + 1, &closed, 10000);
@@ -608,23 +609,18 @@ TEST_F(EventServerTest, RepliesToASlowHalfClosedClientAreBoundedAndAllSent) {
 TEST_F(EventServerTest, StalledPeersAreClosedAtTheirDeadlines) {
   const ServerLimits limits = {150, 400, kMaxTotalPendingOutput};
   handler_ = [](Json::Value& request, Json::Value& reply) {
-    reply["blob"] = std::string(request["command"] == "BIG" ? 10000 : 1, 'b');
-    return 0;
+    return Blob(request["command"] == "BIG" ? 10000 : 1)(request, reply);
   };
   Start(&limits);
   LogCapture log(6);
-  int trickle = Connect();
-  int silent = Connect();
-  int good = Connect();
+  int trickle = Connect(), silent = Connect(), good = Connect();
   int slow = Connect();
   Send(slow, Requests("BIG", 400));  // 4 MB of replies, read 1 MB a second
   char sink[32 * 1024];
   const auto start = Clock::now();
   Send(trickle, std::string("\x15\xbe\x00\x64{", 5));  // 100 bytes announced
-  long long trickle_closed = -1;
-  long long silent_closed = -1;
-  int answered = 0;
-  int asked = 0;
+  long long trickle_closed = -1, silent_closed = -1;
+  int answered = 0, asked = 0;
   for (int round = 0; MsSince(start) < 1000; ++round) {
     RunFor(25);
     EXPECT_GT(recv(slow, sink, sizeof(sink), MSG_DONTWAIT), 0);
@@ -636,9 +632,8 @@ TEST_F(EventServerTest, StalledPeersAreClosedAtTheirDeadlines) {
       silent_closed = MsSince(start);
     }
     if (round % 4 == 0) {
-      Send(good, Request("PING"));
       ++asked;
-      answered += ReceiveBody(good) == "{\"blob\":\"b\"}\n";
+      answered += Ask(good, "PING") == "{\"blob\":\"b\"}\n";
     }
   }
   EXPECT_GE(trickle_closed, 140);
@@ -658,23 +653,18 @@ TEST_F(EventServerTest, StalledPeersAreClosedAtTheirDeadlines) {
             1);
 }
 
-// A connection finishing (a refused request after replies that did not all
-// fit the socket) whose client goes away is closed on the write error, not
-// left to the idle deadline; writing to the vanished client raises no
-// SIGPIPE, which would end the daemon.
+// A finishing connection (a refusal after replies that did not all fit the
+// socket) whose client goes away is closed on the write error, not left to
+// the idle deadline, and raises no SIGPIPE, which would end the daemon.
 TEST_F(EventServerTest, ErrorOnAFinishingConnectionClosesIt) {
   signal(SIGPIPE, SIG_DFL);
-  handler_ = [](Json::Value& request, Json::Value& reply) {
-    reply["blob"] = std::string(8000, 'b');
-    return request["command"] == "QUIT" ? -1 : 0;
-  };
+  handler_ = Blob(8000, "QUIT");
   Start();
   int fd = Connect();
-  Send(fd, Requests("BIG", 60) + Request("QUIT"));
+  Send(fd, Requests("BIG", 60) + Requests("QUIT"));
   ASSERT_TRUE(RunUntil([&] { return requests_.size() == 61; }, 2000));
   ASSERT_EQ(GetCurrentConnCount(), 1);  // still writing its replies
-  close(fd);
-  clients_.clear();
+  Drop(fd);
   EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 2000));
   struct sigaction action;
   sigaction(SIGPIPE, nullptr, &action);
@@ -695,14 +685,10 @@ TEST_F(EventServerTest, ErrorOnAFinishingConnectionClosesIt) {
 TEST_F(EventServerTest, UnsentRepliesOfAllConnectionsAreBounded) {
   const size_t kBound = 1 << 20;
   const ServerLimits limits = {kPacketDeadlineMs, kIdleDeadlineMs, kBound};
-  handler_ = [](Json::Value&, Json::Value& reply) {
-    reply["blob"] = std::string(4000, 'b');
-    return 0;
-  };
+  handler_ = Blob(4000);
   Start(&limits);
   LogCapture log;
-  // About 400 KB of replies each, more than a socket holds.
-  const std::string burst = Requests("R", 100);
+  const std::string burst = Requests("R", 100);  // more than a socket holds
   const int kClients = 300;
   size_t peak = 0;
   for (int i = 0; i < kClients; ++i) {
@@ -718,37 +704,32 @@ TEST_F(EventServerTest, UnsentRepliesOfAllConnectionsAreBounded) {
   EXPECT_GT(peak, kBound / 2);
   int closed = 0;
   for (const std::string& line : log.Normalized()) {
-    closed += line.rfind(
-                  "quvaidx_daemon:N [Error] [testd] unsent replies "
-                  "over 1048576 bytes in all: closed fd = ",
-                  0) == 0;
+    closed += line.rfind(kError +
+                             "[testd] unsent replies over 1048576 bytes in "
+                             "all: closed fd = ",
+                         0) == 0;
   }
   EXPECT_EQ(static_cast<size_t>(closed), log.lines().size());
   EXPECT_GT(closed, kClients / 2);
   EXPECT_EQ(GetCurrentConnCount(), kClients - closed);
   handler_ = Succeed;
-  int fresh = Connect();
-  Send(fresh, Request("STILL_THERE"));
-  EXPECT_EQ(ReceiveBody(fresh), kSuccess);
+  EXPECT_EQ(Ask(Connect(), "STILL_THERE"), kSuccess);
   for (int fd : clients_) close(fd);
   clients_.clear();
   EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 5000));
   EXPECT_EQ(quvaidx::PendingOutputTotal(), 0u);
 }
 
-// A handler that takes every "SLOW" request's reply away, kept in deferred_.
+// A handler that takes every "SLOW" request's reply away, kept in
+// deferred_, and echoes the others.
 class DeferredReplyTest : public EventServerTest {
  protected:
   void SetUp() override {
     EventServerTest::SetUp();
     handler_ = [this](Json::Value& request, Json::Value& reply) {
-      if (request["command"] == "SLOW") {
-        DeferredReply* deferred = DeferReply();
-        EXPECT_NE(deferred, nullptr);
-        deferred_.push_back(deferred);
-        return 0;
-      }
-      reply["echo"] = request["command"];
+      if (request["command"] != "SLOW") return Echo(request, reply);
+      deferred_.push_back(DeferReply());
+      EXPECT_NE(deferred_.back(), nullptr);
       return 0;
     };
   }
@@ -767,19 +748,17 @@ class DeferredReplyTest : public EventServerTest {
 
 // While a reply is deferred, other connections are answered; the
 // connection's own later requests wait, unseen by the handler, and are
-// answered in order after the late reply, however many arrive meanwhile
-// (more than the server reads while it waits).
+// answered in order after the late reply, however many arrive meanwhile.
 TEST_F(DeferredReplyTest, RepliesKeepTheirOrderPerConnection) {
   Start();
   int slow = Connect();
   int other = Connect();
   const int kLater = 30000;  // about 750 KB of requests
-  std::string requests = Request("SLOW") + Requests("LATER", kLater);
+  std::string requests = Requests("SLOW") + Requests("LATER", kLater);
   size_t sent = 0;
   SendAsTaken(slow, requests, &sent, 300);
   EXPECT_LT(sent, requests.size());  // the server stopped reading
-  Send(other, Request("OTHER"));
-  EXPECT_EQ(ReceiveBody(other), "{\"echo\":\"OTHER\"}\n");
+  EXPECT_EQ(Ask(other, "OTHER"), "{\"echo\":\"OTHER\"}\n");
   ASSERT_EQ(deferred_.size(), 1u);
   EXPECT_EQ(requests_.size(), 2u);  // nothing of `slow` after its SLOW
   EXPECT_EQ(Receive(slow, 1, nullptr, 50), "");
@@ -808,7 +787,7 @@ TEST_F(DeferredReplyTest, LateRepliesReachHalfClosedPeersAndNobodyElse) {
   const ServerLimits limits = {kPacketDeadlineMs, 300, kMaxTotalPendingOutput};
   Start(&limits);
   int half = Connect();
-  Send(half, Request("SLOW") + Request("AFTER") + Request("SLOW"));
+  Send(half, Requests("SLOW") + Requests("AFTER") + Requests("SLOW"));
   ASSERT_EQ(shutdown(half, SHUT_WR), 0);
   RunFor(20);
   ASSERT_EQ(deferred_.size(), 1u);
@@ -818,17 +797,14 @@ TEST_F(DeferredReplyTest, LateRepliesReachHalfClosedPeersAndNobodyElse) {
   ASSERT_EQ(deferred_.size(), 1u);
   EXPECT_EQ(Answer(2), 0);
   EXPECT_EQ(ReceiveBody(half), "{\"late\":2}\n");
-  bool closed = false;
-  EXPECT_EQ(Receive(half, 1, &closed), "");
-  EXPECT_TRUE(closed);
+  EXPECT_TRUE(ClosedSilently(half));
 
   int leaving = Connect();
   int idle = Connect();
-  Send(leaving, Request("SLOW"));
-  Send(idle, Request("SLOW"));
+  Send(leaving, Requests("SLOW"));
+  Send(idle, Requests("SLOW"));
   RunFor(20);
-  close(leaving);
-  clients_.erase(std::find(clients_.begin(), clients_.end(), leaving));
+  Drop(leaving);
   EXPECT_TRUE(RunUntil([] { return GetCurrentConnCount() == 0; }, 1500));
   EXPECT_TRUE(ClosedSilently(idle));  // the idle deadline holds meanwhile
   EXPECT_EQ(Answer(3), -1);
@@ -839,7 +815,7 @@ TEST_F(DeferredReplyTest, LateRepliesReachHalfClosedPeersAndNobodyElse) {
     deferred_.push_back(DeferReply());
     return -1;
   };
-  Send(ended, Request("SLOW"));
+  Send(ended, Requests("SLOW"));
   EXPECT_TRUE(ClosedSilently(ended));
   ASSERT_EQ(deferred_.size(), 1u);
   EXPECT_EQ(Answer(5), -1);
@@ -863,16 +839,15 @@ TEST_F(DeferredReplyTest, MisusesAreRefusedAndNullOrHugeRepliesHandled) {
     return 0;
   };
   int fd = Connect();
-  Send(fd, Request("SLOW"));
+  Send(fd, Requests("SLOW"));
   RunFor(10);
   ASSERT_EQ(deferred_.size(), 1u);
   EXPECT_EQ(Receive(fd, 1, nullptr, 20), "");
   Json::Value huge(Json::objectValue);
   huge["blob"] = std::string(20000, 'b');
   EXPECT_EQ(SendDeferredReply(deferred_.back(), &huge), 0);
-  EXPECT_EQ(ReceiveBody(fd),
-            "{\"reason\":\"reply too large\",\"success\":false}\n");
-  Send(fd, Request("SLOW"));
+  EXPECT_EQ(ReceiveBody(fd), kTooLarge);
+  Send(fd, Requests("SLOW"));
   RunFor(10);
   ASSERT_EQ(deferred_.size(), 2u);
   EXPECT_EQ(SendDeferredReply(deferred_.back(), nullptr), 0);
