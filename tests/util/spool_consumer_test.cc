@@ -19,6 +19,7 @@
 #include <map>
 #include <random>
 #include <regex>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -38,15 +39,16 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
+using Strings = std::vector<std::string>;
 
-Json::Value Strings(std::initializer_list<std::string> items) {
+Json::Value ToJson(const Strings& items) {
   Json::Value array(Json::arrayValue);
   for (const std::string& item : items) array.append(item);
   return array;
 }
 
-std::vector<std::string> AsVector(const Json::Value& array) {
-  std::vector<std::string> out;
+Strings AsVector(const Json::Value& array) {
+  Strings out;
   for (const Json::Value& item : array) out.push_back(item.asString());
   return out;
 }
@@ -55,12 +57,9 @@ std::vector<std::string> AsVector(const Json::Value& array) {
 // consumer sees, whatever blank lines the bookkeeping left.
 std::string Live(const std::string& text) {
   std::string live;
-  size_t at = 0;
-  while (at < text.size()) {
-    size_t end = text.find('\n', at);
-    if (end == std::string::npos) end = text.size();
-    if (end > at) live += text.substr(at, end - at) + "\n";
-    at = end + 1;
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) {
+    if (!line.empty()) live += line + "\n";
   }
   return live;
 }
@@ -81,9 +80,9 @@ struct stat StatOf(const std::string& path) {
   return st;
 }
 
-// Names in `dir` that have the form of a temporary copy of `base`.
-int CopiesOf(const std::string& dir, const std::string& base) {
-  const std::regex copy(base + "\\.[A-Za-z0-9]{6}");
+// Names in `dir` that have the form of a temporary copy of thumb.queue.
+int Copies(const std::string& dir) {
+  const std::regex copy("thumb\\.queue\\.[A-Za-z0-9]{6}");
   int count = 0;
   if (DIR* d = opendir(dir.c_str())) {
     while (struct dirent* entry = readdir(d)) {
@@ -97,8 +96,8 @@ int CopiesOf(const std::string& dir, const std::string& base) {
 // `lines` entries "/share/Photos/album-NNNNNN/...", 46 bytes each.
 std::string PhotoQueue(int lines, int first = 0) {
   std::string text;
+  char line[96];
   for (int i = first; i < first + lines; ++i) {
-    char line[96];
     snprintf(line, sizeof(line), "/share/Photos/album-%06d/2015-summer-%06d\n",
              i, i);
     text += line;
@@ -108,26 +107,30 @@ std::string PhotoQueue(int lines, int first = 0) {
 
 class SpoolConsumerTest : public ::testing::Test {
  protected:
-  std::vector<std::string> All() {
+  Strings All() {
     Json::Value entries;
-    EXPECT_GE(ReadQueueHead(queue_.c_str(), 1 << 20, entries), 0);
+    EXPECT_GE(ReadQueueHead(q_, 1 << 20, entries), 0);
     return AsVector(entries);
+  }
+
+  int Remove(const Strings& done, const Strings& requeue = {}) {
+    return RemoveDoneQueueEntries(q_, ToJson(done), ToJson(requeue));
   }
 
   TempDir dir_;
   std::string queue_ = dir_.File("thumb.queue");
+  const char* q_ = queue_.c_str();
 };
 
-// Lines no writer of the library produces must come back as "" (so the
-// consumer skips them and can still remove them), never cut, glued or
-// split; empty lines (finished entries) are no entries; a last line
-// without its line feed still counts.
+// Lines no writer of the library produces come back as "" (skipped, still
+// removable), never cut, glued or split; empty lines are no entries; a last
+// line without its line feed counts; reading changes nothing.
 TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
   const std::string longest(kMaxQueueEntry, 'x');
-  struct Case {
+  const struct {
     std::string content;
     int max;
-    std::vector<std::string> expected;
+    Strings expected;
   } cases[] = {
       {"/a\n/b\n/c\n", 2, {"/a", "/b"}},
       {"/a\n/b\n", 8, {"/a", "/b"}},
@@ -139,13 +142,13 @@ TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
       {std::string("\0\0\0\n\0\n\n/b\n", 10), 8, {"", "", "/b"}},
       {"", 8, {}},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     WriteFile(queue_, c.content);
-    Json::Value entries = Strings({"stale"});
-    EXPECT_EQ(ReadQueueHead(queue_.c_str(), c.max, entries),
+    Json::Value entries = ToJson({"stale"});
+    EXPECT_EQ(ReadQueueHead(q_, c.max, entries),
               static_cast<int>(c.expected.size()));
     EXPECT_EQ(AsVector(entries), c.expected) << c.content.substr(0, 40);
-    EXPECT_EQ(ReadFile(queue_), c.content);  // reading changes nothing
+    EXPECT_EQ(ReadFile(queue_), c.content);
   }
 }
 
@@ -154,123 +157,106 @@ TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
 TEST_F(SpoolConsumerTest, MissingQueueIsEmptyAndOddFilesAreRefused) {
   LogCapture log;
   FdLeakCheck fds;
-  Json::Value entries = Strings({"kept"});
-  EXPECT_EQ(ReadQueueHead(queue_.c_str(), 4, entries), 0);
+  Json::Value entries = ToJson({"kept"});
+  EXPECT_EQ(ReadQueueHead(q_, 4, entries), 0);
   EXPECT_EQ(entries, Json::Value(Json::arrayValue));
-  entries = Strings({"kept"});
+  entries = ToJson({"kept"});
   std::string fifo = dir_.File("fifo.queue");
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
   for (const std::string& odd : {fifo, dir_.path()}) {
-    EXPECT_EQ(ReadQueueHead(odd.c_str(), 4, entries), -1);
-    EXPECT_EQ(RemoveDoneQueueEntries(odd.c_str(), Strings({"/a"}), Strings({})),
-              -1);
-    EXPECT_EQ(TrimQueueHead(odd.c_str(), 1), -1);
-    EXPECT_EQ(CountQueueAttempt(odd.c_str(), "/a"), -1);
-    EXPECT_EQ(RemoveStaleQueueCopies(odd.c_str()), -1);
+    const char* path = odd.c_str();
+    EXPECT_EQ(ReadQueueHead(path, 4, entries), -1);
+    EXPECT_EQ(RemoveDoneQueueEntries(path, ToJson({"/a"}), ToJson({})), -1);
+    EXPECT_EQ(TrimQueueHead(path, 1), -1);
+    EXPECT_EQ(CountQueueAttempt(path, "/a"), -1);
+    EXPECT_EQ(RemoveStaleQueueCopies(path), -1);
   }
-  EXPECT_EQ(ReadQueueHead(queue_.c_str(), 0, entries), -1);
+  EXPECT_EQ(ReadQueueHead(q_, 0, entries), -1);
   EXPECT_EQ(ReadQueueHead(nullptr, 4, entries), -1);
-  EXPECT_EQ(entries, Strings({"kept"}));
-  EXPECT_EQ(
-      RemoveDoneQueueEntries(queue_.c_str(), Json::Value("/a"), Strings({})),
-      -1);
-  EXPECT_EQ(RemoveDoneQueueEntries(queue_.c_str(), Strings({}),
-                                   Json::Value(Json::objectValue)),
-            -1);
-  EXPECT_EQ(TrimQueueHead(queue_.c_str(), 1), -1);  // missing
-  EXPECT_EQ(CountQueueAttempt(queue_.c_str(), "/a"), -1);
-  EXPECT_EQ(CountQueueAttempt(queue_.c_str(), nullptr), -1);
-  EXPECT_EQ(RemoveStaleQueueCopies(queue_.c_str()), 0);
+  EXPECT_EQ(entries, ToJson({"kept"}));
+  EXPECT_EQ(RemoveDoneQueueEntries(q_, Json::Value("/a"), ToJson({})), -1);
+  EXPECT_EQ(RemoveDoneQueueEntries(q_, ToJson({}), Json::objectValue), -1);
+  EXPECT_EQ(TrimQueueHead(q_, 1), -1);  // missing
+  EXPECT_EQ(CountQueueAttempt(q_, "/a"), -1);
+  EXPECT_EQ(CountQueueAttempt(q_, nullptr), -1);
+  EXPECT_EQ(RemoveStaleQueueCopies(q_), 0);
   EXPECT_TRUE(fds.NoLeak());
 }
 
 // Removal takes only the head entries the caller names, in order: an entry
-// trimmed by someone else, an entry re-queued meanwhile or a line the
-// consumer never read must survive. What is left is text without a zero
-// byte, and a queue left without entries is empty.
+// trimmed by someone else, re-queued meanwhile or never read survives. What
+// is left has no zero byte; a queue left without entries is empty, and one
+// a requeue makes is never executable.
 TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
   const std::string overlong(kMaxQueueEntry + 1, 'y');
-  struct Case {
-    const char* fault;
+  const struct {
     std::string content;
-    Json::Value done;
-    Json::Value requeue;
+    Strings done, requeue;
     int removed;
     std::string after;
   } cases[] = {
-      {"removes the done prefix only", "/a\n/b\n/c\n", Strings({"/a", "/b"}),
-       Strings({}), 2, "/c\n"},
-      {"head trimmed by another process", "/b\n/c\n", Strings({"/a", "/b"}),
-       Strings({}), 0, "/b\n/c\n"},
-      {"stops at the first differing line", "/a\n/x\n/b\n",
-       Strings({"/a", "/b"}), Strings({}), 1, "/x\n/b\n"},
-      {"an entry appended meanwhile stays", "/a\n/new\n", Strings({"/a"}),
-       Strings({}), 1, "/new\n"},
-      {"foreign lines are removed as read",
-       "\n" + overlong + std::string("\n\n/nul\0\n/a\n", 11), Strings({"", ""}),
-       Strings({}), 2, "/a\n"},
-      {"blank lines are not entries", "\n\n/a\n\n/b\n", Strings({"/a", "/b"}),
-       Strings({}), 2, ""},
-      {"requeue goes to the tail, even as a duplicate", "/a\n/b\n",
-       Strings({"/a"}), Strings({"/a"}), 1, "/b\n/a\n"},
-      {"requeue refuses what would corrupt the queue", "/a\n", Strings({"/a"}),
-       Strings({"", "two\nlines", overlong, "/ok"}), 1, "/ok\n"},
-      {"nothing named, nothing removed", "/a\n", Strings({}), Strings({}), 0,
-       "/a\n"},
+      {"/a\n/b\n/c\n", {"/a", "/b"}, {}, 2, "/c\n"},  // the done prefix only
+      {"/b\n/c\n", {"/a", "/b"}, {}, 0, "/b\n/c\n"},  // head trimmed elsewhere
+      {"/a\n/x\n/b\n", {"/a", "/b"}, {}, 1, "/x\n/b\n"},  // stops at a change
+      {"/a\n/new\n", {"/a"}, {}, 1, "/new\n"},  // appended meanwhile: stays
+      {"\n" + overlong + std::string("\n\n/nul\0\n/a\n", 11),
+       {"", ""},
+       {},
+       2,
+       "/a\n"},  // foreign lines are removed as read
+      {"\n\n/a\n\n/b\n", {"/a", "/b"}, {}, 2, ""},  // blank lines: no entries
+      {"/a\n/b\n", {"/a"}, {"/a"}, 1, "/b\n/a\n"},  // requeue to the tail
+      {"/a\n", {"/a"}, {"", "two\nlines", overlong, "/ok"}, 1, "/ok\n"},
+      {"/a\n", {}, {}, 0, "/a\n"},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.content.substr(0, 20));
     WriteFile(queue_, c.content);
-    EXPECT_EQ(RemoveDoneQueueEntries(queue_.c_str(), c.done, c.requeue),
-              c.removed)
-        << c.fault;
+    EXPECT_EQ(Remove(c.done, c.requeue), c.removed);
     const std::string after = ReadFile(queue_);
-    EXPECT_EQ(Live(after), c.after) << c.fault;
-    EXPECT_EQ(c.after.empty(), after.empty()) << c.fault;
-    EXPECT_EQ(std::string::npos, after.find('\0')) << c.fault;
+    EXPECT_EQ(Live(after), c.after);
+    EXPECT_EQ(c.after.empty(), after.empty());
+    EXPECT_EQ(std::string::npos, after.find('\0'));
   }
-  unlink(queue_.c_str());
-  EXPECT_EQ(
-      RemoveDoneQueueEntries(queue_.c_str(), Strings({"/a"}), Strings({})), 0);
-  EXPECT_EQ(
-      RemoveDoneQueueEntries(queue_.c_str(), Strings({}), Strings({"/back"})),
-      0);
+  unlink(q_);
+  EXPECT_EQ(Remove({"/a"}), 0);
+  const mode_t old_umask = umask(0);
+  EXPECT_EQ(Remove({}, {"/back"}), 0);
+  umask(old_umask);
   EXPECT_EQ(ReadFile(queue_), "/back\n");
+  EXPECT_EQ(StatOf(queue_).st_mode & 07777, 0666u);
 }
 
 // A consumer that waited for the lock while the queue was replaced must
 // read and trim the new file, not the unlinked old one.
 TEST_F(SpoolConsumerTest, WaiterFollowsAQueueReplacedWhileItWaited) {
   WriteFile(queue_, "/old\n");
-  int holder = open(queue_.c_str(), O_RDONLY | O_CLOEXEC);
+  int holder = open(q_, O_RDONLY | O_CLOEXEC);
   ASSERT_GE(holder, 0);
   ASSERT_EQ(flock(holder, LOCK_EX), 0);
   Json::Value entries;
   int read = -2;
-  std::thread reader([&] { read = ReadQueueHead(queue_.c_str(), 4, entries); });
+  std::thread reader([&] { read = ReadQueueHead(q_, 4, entries); });
   std::this_thread::sleep_for(std::chrono::milliseconds(50));
-  std::string fresh = dir_.File("fresh");
-  WriteFile(fresh, "/new1\n/new2\n");
-  ASSERT_EQ(rename(fresh.c_str(), queue_.c_str()), 0);
+  WriteFile(dir_.File("fresh"), "/new1\n/new2\n");
+  ASSERT_EQ(rename(dir_.File("fresh").c_str(), q_), 0);
   close(holder);  // lets the reader have the old file's lock
   reader.join();
   EXPECT_EQ(read, 2);
-  EXPECT_EQ(AsVector(entries), (std::vector<std::string>{"/new1", "/new2"}));
+  EXPECT_EQ(AsVector(entries), (Strings{"/new1", "/new2"}));
 }
 
 // Writers append while a consumer reads, works and removes: every entry is
-// done exactly once and none is left or lost. WriteIndexQueue skips an
-// entry still queued, so the writers' entries are all distinct.
+// done exactly once and none is left or lost.
 TEST_F(SpoolConsumerTest, ConcurrentWritersLoseNothingAndNothingRunsTwice) {
-  constexpr int kWriters = 3;
-  constexpr int kPerWriter = 60;
+  constexpr int kWriters = 3, kPerWriter = 60;
   std::atomic<int> writers_left{kWriters};
   std::vector<std::thread> writers;
   for (int w = 0; w < kWriters; ++w) {
     writers.emplace_back([&, w] {
       for (int i = 0; i < kPerWriter; ++i) {
-        std::string entry =
-            "/share/w" + std::to_string(w) + "/" + std::to_string(i);
-        ASSERT_EQ(WriteIndexQueue(entry.c_str(), queue_.c_str()), 0);
+        std::string entry = "/w" + std::to_string(w) + "/" + std::to_string(i);
+        ASSERT_EQ(WriteIndexQueue(entry.c_str(), q_), 0);
       }
       --writers_left;
     });
@@ -281,60 +267,47 @@ TEST_F(SpoolConsumerTest, ConcurrentWritersLoseNothingAndNothingRunsTwice) {
   for (;;) {
     bool writers_finished = writers_left.load() == 0;
     Json::Value entries;
-    int n = ReadQueueHead(queue_.c_str(), 7, entries);
+    int n = ReadQueueHead(q_, 7, entries);
     ASSERT_GE(n, 0);
     if (n == 0 && writers_finished) break;
-    for (const Json::Value& entry : entries) {
-      ++done_count[entry.asString()];  // the work
-      Json::Value done(Json::arrayValue);
-      done.append(entry);
-      ASSERT_EQ(RemoveDoneQueueEntries(queue_.c_str(), done,
-                                       Json::Value(Json::arrayValue)),
-                1);
+    for (const std::string& entry : AsVector(entries)) {
+      ++done_count[entry];  // the work
+      ASSERT_EQ(Remove({entry}), 1);
     }
     ASSERT_LT(std::chrono::steady_clock::now(), deadline);
   }
   for (std::thread& t : writers) t.join();
   EXPECT_EQ(done_count.size(), static_cast<size_t>(kWriters * kPerWriter));
-  for (const auto& [entry, count] : done_count) {
-    EXPECT_EQ(count, 1) << entry;
-  }
+  for (const auto& [entry, count] : done_count) EXPECT_EQ(count, 1) << entry;
   EXPECT_EQ(ReadFile(queue_), "");
 }
 
 // A finished entry must leave the queue's text, or a writer's duplicate
-// test would still find it and silently drop the same folder queued again;
-// and finishing one must not rewrite the queue.
+// test would drop the same folder queued again; finishing one must not
+// rewrite the queue.
 TEST_F(SpoolConsumerTest, FinishedEntryIsBlankedInPlaceAndCanBeQueuedAgain) {
   WriteFile(queue_, "/a\n/b\n");
   const struct stat before = StatOf(queue_);
-  ASSERT_EQ(
-      RemoveDoneQueueEntries(queue_.c_str(), Strings({"/a"}), Strings({})), 1);
+  ASSERT_EQ(Remove({"/a"}), 1);
   EXPECT_EQ(ReadFile(queue_), "\n\n\n/b\n");
   EXPECT_EQ(StatOf(queue_).st_ino, before.st_ino) << "rewritten";
-  ASSERT_EQ(WriteIndexQueue("/a", queue_.c_str()), 0);
-  EXPECT_EQ(All(), (std::vector<std::string>{"/b", "/a"}));
-  for (const char* entry : {"/b", "/a"}) {
-    ASSERT_EQ(
-        RemoveDoneQueueEntries(queue_.c_str(), Strings({entry}), Strings({})),
-        1);
-  }
+  ASSERT_EQ(WriteIndexQueue("/a", q_), 0);
+  EXPECT_EQ(All(), (Strings{"/b", "/a"}));
+  for (const char* entry : {"/b", "/a"}) ASSERT_EQ(Remove({entry}), 1);
   EXPECT_EQ(ReadFile(queue_), "") << "a drained queue is cut to nothing";
   EXPECT_EQ(StatOf(queue_).st_ino, before.st_ino);
 }
 
-// The side file is a hint that anyone may damage, and a queue may be cut or
-// made anew in place: whatever it says, no entry is skipped. A head found
-// far into the queue is remembered for the next call.
+// The side file is a hint that anyone may damage, and a queue may be cut
+// and refilled in place: whatever it says, no entry is skipped. A head far
+// into the queue is remembered for the next call.
 TEST_F(SpoolConsumerTest, SideFileNeverMakesEntriesSkipped) {
   const std::string blank(70000, '\n');
   WriteFile(queue_, blank + "/a\n/b\n");
-  ASSERT_EQ(All(), (std::vector<std::string>{"/a", "/b"}));
+  ASSERT_EQ(All(), (Strings{"/a", "/b"}));
   quvaidx::QueueState remembered;
-  ASSERT_TRUE(quvaidx::LoadQueueState(queue_.c_str(), &remembered));
+  ASSERT_TRUE(quvaidx::LoadQueueState(q_, &remembered));
   EXPECT_EQ(remembered.head, static_cast<int64_t>(blank.size()));
-
-  const std::string side = quvaidx::QueueStatePath(queue_.c_str());
   const std::string real = PhotoQueue(40);  // 2,600 bytes of entries
   auto record = [&](int64_t head) {
     quvaidx::QueueState state = remembered;
@@ -343,46 +316,38 @@ TEST_F(SpoolConsumerTest, SideFileNeverMakesEntriesSkipped) {
   };
   std::string torn = record(1500);
   torn[40] ^= 1;
-  const struct {
-    const char* what;
-    std::string side;
-  } cases[] = {
-      {"garbage", "head=99999\n"},
-      {"torn record", torn},
-      {"head beyond the end", record(1 << 30)},
-      {"head within the entries of a queue cut and refilled", record(1500)},
-      {"head after blank lines below entries", record(2800)},
+  const std::string sides[] = {
+      "head=99999\n", torn, record(1 << 30),
+      record(1500),  // within the entries of a queue cut and refilled
+      record(2800),  // after blank lines below entries
   };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.what);
+  for (const auto& side : sides) {
+    SCOPED_TRACE(side);
     // The same file (inode and birth time) as the record: cut, then filled.
-    ASSERT_EQ(truncate(queue_.c_str(), 0), 0);
+    ASSERT_EQ(truncate(q_, 0), 0);
     std::ofstream(queue_, std::ios::app) << real << std::string(300, '\n');
-    WriteFile(side, c.side);
+    WriteFile(quvaidx::QueueStatePath(q_), side);
     EXPECT_EQ(Live(ReadFile(queue_)).size(), real.size());
-    const std::vector<std::string> all = All();
+    const Strings all = All();
     ASSERT_EQ(all.size(), 40u);
     EXPECT_EQ(all.front(), "/share/Photos/album-000000/2015-summer-000000");
-    Json::Value done;
-    done.append(all.front());
-    EXPECT_EQ(RemoveDoneQueueEntries(queue_.c_str(), done, Strings({})), 1);
+    EXPECT_EQ(Remove({all.front()}), 1);
   }
 }
 
 // A mostly blank queue is compacted into a new file: the entries left, in
-// order, with the queue's owner and group and its read and write bits
-// (never an execute bit), and no copy left beside it.
+// order, its owner and group, its read and write bits only, no copy left.
 TEST_F(SpoolConsumerTest, CompactionKeepsEntriesOwnerAndModeLeavesNoCopy) {
   WriteFile(queue_, PhotoQueue(36000));  // 1.66 MB
-  ASSERT_EQ(chown(queue_.c_str(), 65534, 65534), 0);
-  ASSERT_EQ(chmod(queue_.c_str(), 0775), 0);
+  ASSERT_EQ(chown(q_, 65534, 65534), 0);
+  ASSERT_EQ(chmod(q_, 0775), 0);
   const struct stat before = StatOf(queue_);
-  ASSERT_EQ(TrimQueueHead(queue_.c_str(), 12000), 0);  // a third: kept
+  ASSERT_EQ(TrimQueueHead(q_, 12000), 0);  // a third: kept
   EXPECT_EQ(StatOf(queue_).st_ino, before.st_ino);
   EXPECT_TRUE(SameText(Live(ReadFile(queue_)), PhotoQueue(24000, 12000)));
   Json::Value head;
-  ASSERT_EQ(ReadQueueHead(queue_.c_str(), 12000, head), 12000);
-  ASSERT_EQ(RemoveDoneQueueEntries(queue_.c_str(), head, Strings({"/back"})),
+  ASSERT_EQ(ReadQueueHead(q_, 12000, head), 12000);
+  ASSERT_EQ(RemoveDoneQueueEntries(q_, head, ToJson({"/back"})),
             12000);  // now two thirds, over 1 MiB, blank: compacted
   const struct stat after = StatOf(queue_);
   EXPECT_NE(after.st_ino, before.st_ino);
@@ -390,14 +355,13 @@ TEST_F(SpoolConsumerTest, CompactionKeepsEntriesOwnerAndModeLeavesNoCopy) {
   EXPECT_EQ(after.st_uid, 65534u);
   EXPECT_EQ(after.st_gid, 65534u);
   EXPECT_EQ(after.st_mode & 07777, 0664u);
-  EXPECT_EQ(CopiesOf(dir_.path(), "thumb.queue"), 0);
+  EXPECT_EQ(Copies(dir_.path()), 0);
   EXPECT_EQ(All().front(), "/share/Photos/album-024000/2015-summer-024000");
 }
 
-// A consumer killed at any moment of blanking and compacting loses no entry
-// it did not finish and corrupts none; what it leaves beside the queue is
-// at most a copy in the instant before its rename, which
-// RemoveStaleQueueCopies removes at the next start.
+// A consumer killed at any moment of blanking and compacting loses and
+// corrupts no unfinished entry; it leaves at most a copy in the instant
+// before its rename, which RemoveStaleQueueCopies removes.
 TEST_F(SpoolConsumerTest, KilledConsumerLosesNothingAndCopiesAreRemoved) {
   const std::string original = PhotoQueue(36000);  // 1.66 MB
   std::mt19937 random(12345);
@@ -406,26 +370,25 @@ TEST_F(SpoolConsumerTest, KilledConsumerLosesNothingAndCopiesAreRemoved) {
       std::chrono::steady_clock::now() + std::chrono::seconds(15);
   for (int run = 0; run < 24 && std::chrono::steady_clock::now() < deadline;
        ++run) {
+    SCOPED_TRACE(run);
     WriteFile(queue_, original);
     const pid_t child = fork();
     ASSERT_GE(child, 0);
-    if (child == 0) _exit(TrimQueueHead(queue_.c_str(), 24000) == 0 ? 0 : 1);
+    if (child == 0) _exit(TrimQueueHead(q_, 24000) == 0 ? 0 : 1);
     usleep(std::uniform_int_distribution<useconds_t>(0, 12000)(random));
     kill(child, SIGKILL);
-    int status;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    runs_with_copy += CopiesOf(dir_.path(), "thumb.queue") > 0;
-    ASSERT_GE(RemoveStaleQueueCopies(queue_.c_str()), 0);
-    EXPECT_EQ(CopiesOf(dir_.path(), "thumb.queue"), 0);
-    // Entries half blanked read as ""; the others are the untrimmed tail
-    // at least, each whole.
-    std::vector<std::string> left = All();
+    ASSERT_EQ(waitpid(child, nullptr, 0), child);
+    runs_with_copy += Copies(dir_.path()) > 0;
+    ASSERT_GE(RemoveStaleQueueCopies(q_), 0);
+    EXPECT_EQ(Copies(dir_.path()), 0);
+    // Half-blanked entries read as ""; the rest is a whole tail of at
+    // least the untrimmed entries.
+    Strings left = All();
     left.erase(std::remove(left.begin(), left.end(), ""), left.end());
-    ASSERT_GE(left.size(), 12000u) << "run " << run;
+    ASSERT_GE(left.size(), 12000u);
     std::string text;
     for (const std::string& entry : left) text += entry + "\n";
-    EXPECT_TRUE(SameText(text, original.substr(original.size() - text.size())))
-        << "run " << run;
+    EXPECT_TRUE(SameText(text, original.substr(original.size() - text.size())));
   }
   EXPECT_LE(runs_with_copy, 3) << "copies are left for longer than a rename";
 }
@@ -434,62 +397,47 @@ TEST_F(SpoolConsumerTest, KilledConsumerLosesNothingAndCopiesAreRemoved) {
 TEST_F(SpoolConsumerTest, StaleCopiesAreRemovedByTheirExactNameOnly) {
   LogCapture log;
   WriteFile(queue_, "/a\n");
-  for (const char* copy : {"thumb.queue.abc123", "thumb.queue.Z9z9Z9"}) {
-    WriteFile(dir_.File(copy), "/old\n");
-  }
+  WriteFile(dir_.File("thumb.queue.abc123"), "/old\n");
+  WriteFile(dir_.File("thumb.queue.Z9z9Z9"), "/old\n");
   const char* kept[] = {"thumb.queue.abc12",  "thumb.queue.abc1234",
                         "thumb.queue.ab-123", "thumb.queue.consumer",
                         "other.queue.abc123", "thumb.queueXabc123"};
   for (const char* name : kept) WriteFile(dir_.File(name), "keep");
   ASSERT_EQ(mkdir(dir_.File("thumb.queue.dir123").c_str(), 0755), 0);
-  ASSERT_EQ(symlink(queue_.c_str(), dir_.File("thumb.queue.lnk123").c_str()),
-            0);
-  EXPECT_EQ(RemoveStaleQueueCopies(queue_.c_str()), 2);
+  ASSERT_EQ(symlink(q_, dir_.File("thumb.queue.lnk123").c_str()), 0);
+  EXPECT_EQ(RemoveStaleQueueCopies(q_), 2);
   EXPECT_EQ(log.lines().size(), 2u);
   for (const auto& line : log.lines()) EXPECT_EQ(line.priority, LOG_WARNING);
   for (const char* name : kept) EXPECT_EQ(ReadFile(dir_.File(name)), "keep");
-  EXPECT_EQ(CopiesOf(dir_.path(), "thumb.queue"), 2);  // dir123, lnk123
+  EXPECT_EQ(Copies(dir_.path()), 2);  // dir123, lnk123
   EXPECT_EQ(ReadFile(queue_), "/a\n");
 }
 
 // An entry that kills its consumer is seen again with a higher number
 // after each restart; the count starts again for another entry, and once
-// the counted entry is removed.
+// the counted entry is removed or the side file damaged.
 TEST_F(SpoolConsumerTest, AttemptsSurviveTheConsumerAndResetWithTheHead) {
   WriteFile(queue_, "/poison\n/next\n");
-  const char* q = queue_.c_str();
-  EXPECT_EQ(CountQueueAttempt(q, "/poison"), 1);
+  EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 1);
   for (int attempt : {2, 3}) {
     const pid_t child = fork();
     ASSERT_GE(child, 0);
-    if (child == 0) {
-      // Dies in the middle of the entry's work, without any clean-up.
-      _exit(CountQueueAttempt(q, "/poison"));
-    }
+    // Dies in the middle of the entry's work, without any clean-up.
+    if (child == 0) _exit(CountQueueAttempt(q_, "/poison"));
     int status;
     ASSERT_EQ(waitpid(child, &status, 0), child);
     EXPECT_EQ(WEXITSTATUS(status), attempt);
   }
-  EXPECT_EQ(CountQueueAttempt(q, "/poison"), 4);
-  ASSERT_EQ(RemoveDoneQueueEntries(q, Strings({"/poison"}), Strings({})), 1);
-  EXPECT_EQ(CountQueueAttempt(q, "/next"), 1);
-  EXPECT_EQ(CountQueueAttempt(q, "/next"), 2);
-  ASSERT_EQ(WriteIndexQueue("/poison", q), 0);
-  ASSERT_EQ(RemoveDoneQueueEntries(q, Strings({"/next"}), Strings({})), 1);
-  EXPECT_EQ(CountQueueAttempt(q, "/poison"), 1) << "removed entry counted on";
-  WriteFile(quvaidx::QueueStatePath(q), "damaged");
-  EXPECT_EQ(CountQueueAttempt(q, "/poison"), 1);
-  EXPECT_EQ(CountQueueAttempt(q, "/poison"), 2);
-}
-
-// Queue files made by the consumer hold text: never an execute bit.
-TEST_F(SpoolConsumerTest, QueueMadeByARequeueIsNotExecutable) {
-  const mode_t old_umask = umask(0);
-  const int made =
-      RemoveDoneQueueEntries(queue_.c_str(), Strings({}), Strings({"/a"}));
-  umask(old_umask);
-  ASSERT_EQ(made, 0);
-  EXPECT_EQ(StatOf(queue_).st_mode & 07777, 0666u);
+  EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 4);
+  ASSERT_EQ(Remove({"/poison"}), 1);
+  EXPECT_EQ(CountQueueAttempt(q_, "/next"), 1);
+  EXPECT_EQ(CountQueueAttempt(q_, "/next"), 2);
+  ASSERT_EQ(WriteIndexQueue("/poison", q_), 0);
+  ASSERT_EQ(Remove({"/next"}), 1);
+  EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 1) << "removed entry counted on";
+  WriteFile(quvaidx::QueueStatePath(q_), "damaged");
+  EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 1);
+  EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 2);
 }
 
 }  // namespace
