@@ -9,7 +9,6 @@
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -32,6 +31,8 @@ using quvaidx::test::LogCapture;
 using quvaidx::test::ReadFile;
 using quvaidx::test::WriteFile;
 
+const std::string kAlive = "Daemon alive. No need to start\n";
+
 // Whether nobody holds the lock of the file at `path`.
 bool Unlocked(const std::string& path) {
   int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
@@ -40,6 +41,18 @@ bool Unlocked(const std::string& path) {
   return free;
 }
 
+// The exit status of child `pid`, -1 unless it exited.
+int ExitStatus(pid_t pid) {
+  int status = 0;
+  return waitpid(pid, &status, 0) == pid && WIFEXITED(status)
+             ? WEXITSTATUS(status)
+             : -1;
+}
+
+// Sends what the calling process writes to its standard output to nowhere
+// (the refusal line).
+void Quiet() { dup2(open("/dev/null", O_WRONLY), 1); }
+
 class LifecycleTest : public ::testing::Test {
  protected:
   quvaidx::test::TempDir dir_;
@@ -47,9 +60,8 @@ class LifecycleTest : public ::testing::Test {
 };
 
 // The pid goes in without a line end, replacing a dead instance's, with
-// mode 0644 whatever the umask or the old file's mode; a live instance is
-// refused, its pid file kept, and BecomeDaemon does not detach. A pid file
-// that cannot be made is an error; a missing one is deleted.
+// mode 0644 whatever the umask or the old mode; a live instance is refused,
+// its pid file kept, and BecomeDaemon does not detach.
 TEST_F(LifecycleTest, OneInstanceAtATime) {
   pid_t dead = fork();
   if (dead == 0) _exit(0);
@@ -70,9 +82,7 @@ TEST_F(LifecycleTest, OneInstanceAtATime) {
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
   EXPECT_EQ(BecomeDaemon(pid_file_.c_str()), -1);
-  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
-            "Daemon alive. No need to start\n"
-            "Daemon alive. No need to start\n");
+  EXPECT_EQ(::testing::internal::GetCapturedStdout(), kAlive + kAlive);
   EXPECT_EQ(ReadFile(pid_file_), std::to_string(getpid()));
   LogCapture log;
   std::string bad = dir_.File("missing/d.pid");
@@ -84,9 +94,8 @@ TEST_F(LifecycleTest, OneInstanceAtATime) {
 }
 
 // Whatever is planted at the pid path other than a regular file of its own
-// is refused at once, logged, and left as it was: a root daemon must not
-// write its pid through a link or into another name of a file, nor hang on
-// a FIFO.
+// is refused at once, logged and left alone: a root daemon must not write
+// its pid through a link or into another name of a file, nor hang on a FIFO.
 TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   const std::string victim = dir_.File("victim");
   WriteFile(victim, "precious");
@@ -97,20 +106,20 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   ASSERT_EQ(link(victim.c_str(), dir_.File("hardlink").c_str()), 0);
   alarm(10);  // an open waiting on the FIFO would end the test here
   for (const char* name : {"link", "dangling", "fifo", "dir", "hardlink"}) {
+    SCOPED_TRACE(name);
     const std::string path = dir_.File(name);
     struct stat before, after;
     ASSERT_EQ(lstat(path.c_str(), &before), 0);
     LogCapture log;
-    EXPECT_EQ(BecomeProcess(path.c_str()), -1) << name;
+    EXPECT_EQ(BecomeProcess(path.c_str()), -1);
     EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] " + path +
                         (name[0] == 'h' ? " has 2 names"
                                         : " is not a regular "
                                           "file") +
                         "; not used as a pid file"),
-              1)
-        << name;
+              1);
     ASSERT_EQ(lstat(path.c_str(), &after), 0);
-    EXPECT_EQ(after.st_mode, before.st_mode) << name;
+    EXPECT_EQ(after.st_mode, before.st_mode);
   }
   alarm(0);
   EXPECT_EQ(ReadFile(victim), "precious");
@@ -143,17 +152,14 @@ std::string StartTogether(const std::string& pid_file, int count,
     char byte = 0;
     close(go[1]);
     close(held[1]);
-    (void)!read(go[0], &byte, 1);          // all start when go closes
-    dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
+    (void)!read(go[0], &byte, 1);  // all start when go closes
+    Quiet();
     byte = BecomeProcess(pid_file.c_str()) == 0 ? 'R' : '-';
     (void)!write(report[1], &byte, 1);
     (void)!read(held[0], &byte, 1);  // a runner lives until *hold closes
     _exit(0);
   }
-  close(go[0]);
-  close(report[1]);
-  close(held[0]);
-  close(go[1]);
+  for (int end : {go[0], report[1], held[0], go[1]}) close(end);
   std::string outcome;
   char byte;
   while (outcome.size() < pids->size() && read(report[0], &byte, 1) == 1) {
@@ -185,9 +191,8 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
 }
 
 // DeletePidFile removes a stale pid file and this process's own, never that
-// of another live instance. A pid that cannot be written (here the disk is
-// full) fails the start and leaves the file unlocked, so the next start is
-// not turned away.
+// of another live instance. A pid that cannot be written (a full disk)
+// fails the start and leaves the file unlocked for the next start.
 TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   ASSERT_EQ(BecomeProcess(dir_.File("own.pid").c_str()), 0);  // held too
   std::vector<pid_t> other;
@@ -220,11 +225,10 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   EXPECT_TRUE(leaks.NoLeak());  // and its lock released
 }
 
-// A stale pid file removed, and a new one made, while a start holds the old
-// file open unlocked: the start must see that the path names another file
-// now and start over with it, refused while another instance holds it,
-// running in it otherwise. The start is stopped at its flock by ptrace, to
-// make the race happen every time.
+// A stale pid file replaced while a start holds the old one open unlocked:
+// the start must follow the path to the new file, refused while another
+// instance holds it, running in it otherwise. ptrace stops the start at
+// its flock, to make the race happen every time.
 TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
   for (bool held : {true, false}) {
     WriteFile(pid_file_, "");
@@ -233,7 +237,7 @@ TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
     if (child == 0) {
       ptrace(PTRACE_TRACEME, 0, nullptr, nullptr);
       raise(SIGSTOP);
-      dup2(open("/dev/null", O_WRONLY), 1);  // the refusal line
+      Quiet();
       _exit(BecomeProcess(pid_file_.c_str()) == 0 ? 1 : 0);
     }
     int status = 0, successor = -1;
@@ -265,7 +269,8 @@ TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
   }
 }
 
-// The detached process also keeps the lock taken before detaching: a second
+// The detached process (a session leader in /, input from /dev/null)
+// records its own pid and keeps the lock taken before detaching: a second
 // instance is refused even when the pid in the file misleads the check.
 TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   std::string report = dir_.File("report"), stop = dir_.File("stop");
@@ -289,9 +294,7 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
     }
     _exit(0);
   }
-  int status = 0;
-  waitpid(child, &status, 0);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  EXPECT_EQ(ExitStatus(child), 0);
   for (int i = 0; i < 2500 && access(report.c_str(), F_OK) != 0; ++i) {
     usleep(2000);
   }
@@ -304,21 +307,13 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   WriteFile(pid_file_, "4000000");  // same file, a pid that is not alive
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
-  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
-            "Daemon alive. No need to start\n");
-  int result[2];  // a second daemon reports whether it was refused
-  ASSERT_EQ(pipe(result), 0);
-  if (fork() == 0) {
-    dup2(open("/dev/null", O_WRONLY), 1);
-    (void)!write(result[1], BecomeDaemon(pid_file_.c_str()) == -1 ? "R" : "D",
-                 1);
-    _exit(0);
+  EXPECT_EQ(::testing::internal::GetCapturedStdout(), kAlive);
+  pid_t second = fork();  // exits 7 when refused; detaching would exit 0
+  if (second == 0) {
+    Quiet();
+    _exit(BecomeDaemon(pid_file_.c_str()) == -1 ? 7 : 1);
   }
-  close(result[1]);
-  char refused = 0;
-  EXPECT_EQ(read(result[0], &refused, 1), 1);
-  EXPECT_EQ(refused, 'R');
-  close(result[0]);
+  EXPECT_EQ(ExitStatus(second), 7);
   WriteFile(stop, "");
   // Once it ends, its lock goes with it.
   for (int i = 0; i < 2500 && !Unlocked(pid_file_); ++i) usleep(2000);
@@ -374,13 +369,10 @@ TEST(ForkExecvTest, ChildOnDevNullMissingProgramAbortsNoChildWaitKept) {
       out;
   char* argv[] = {const_cast<char*>("sh"), const_cast<char*>("-c"),
                   const_cast<char*>(script.c_str()), nullptr};
-  int status = 0, pid = ForkExecv("/bin/sh", argv);
-  ASSERT_GT(pid, 0);
-  ASSERT_EQ(waitpid(pid, &status, 0), pid);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  EXPECT_EQ(ExitStatus(ForkExecv("/bin/sh", argv)), 0);
   EXPECT_EQ(ReadFile(out), "/dev/null /dev/null /dev/null ");
   argv[1] = nullptr;
-  pid = ForkExecv("/nonexistent/program", argv);
+  int status = 0, pid = ForkExecv("/nonexistent/program", argv);
   ASSERT_GT(pid, 0);
   ASSERT_EQ(waitpid(pid, &status, 0), pid);
   EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT);
