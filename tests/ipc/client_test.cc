@@ -3,7 +3,6 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -24,12 +23,12 @@
 namespace {
 
 using quvaidx::test::FakeSleep;
-using quvaidx::test::FdLeakCheck;
 using quvaidx::test::ListenUnix;
-using quvaidx::test::ListenUnixAs;
 using quvaidx::test::LogCapture;
 using quvaidx::test::ScriptedPeer;
-using quvaidx::test::TempDir;
+using Lines = std::vector<std::string>;
+
+const std::string kFailed = "quvaidx_ipc_core:N [Error] connect server: ";
 
 Json::Value Command(const char* name) {
   Json::Value object(Json::objectValue);
@@ -48,41 +47,6 @@ void AnswerAll(int& fd, int index) {
   }
 }
 
-// Closes at once without reading: the client sees a broken pipe or a reset.
-void Hangup(int&, int) {}
-
-class ClientTest : public ::testing::Test {
- protected:
-  void TearDown() override { EXPECT_TRUE(leaks_.NoLeak()); }
-
-  FdLeakCheck leaks_;
-  TempDir dir_;
-  std::string path_ = dir_.File("daemon.sock");
-  FakeSleep sleep_;
-};
-
-// One debug line and one sleep per failed attempt, then one error line;
-// at the default level only the error line.
-TEST_F(ClientTest, NoDaemonCostsOneSleepPerAttempt) {
-  LogCapture log(7);
-  const std::string line = "quvaidx_ipc_core:N [Error] connect server: ";
-  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 0), -1);
-  EXPECT_EQ(ConnectPeer(path_.c_str(), true, -5), -1);
-  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 3), -1);
-  EXPECT_EQ(sleep_.calls(), 3);
-  EXPECT_EQ(sleep_.total_seconds(), 3u);
-  std::vector<std::string> expected = {line + path_, line + path_};
-  for (const char* i : {"0, ", "1, ", "2, "})
-    expected.push_back(line + i + path_);
-  expected.push_back(line + path_);
-  EXPECT_EQ(log.Normalized(), expected);
-  LogCapture quiet;  // threshold 3
-  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
-  EXPECT_EQ(quiet.Normalized(), std::vector<std::string>{line + path_});
-}
-
-// A daemon whose backlog stays full does not hold the client: each attempt
-// gives up after the connect limit and counts as failed, with its line.
 // Connects to `path` until its listen backlog is full; returns the
 // connections, which the caller closes.
 std::vector<int> FillBacklog(const std::string& path) {
@@ -100,12 +64,40 @@ std::vector<int> FillBacklog(const std::string& path) {
   return queued;
 }
 
-TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
+class ClientTest : public ::testing::Test {
+ protected:
+  void TearDown() override { EXPECT_TRUE(leaks_.NoLeak()); }
+
+  quvaidx::test::FdLeakCheck leaks_;
+  quvaidx::test::TempDir dir_;
+  std::string path_ = dir_.File("daemon.sock");
+  FakeSleep sleep_;
+};
+
+// One debug line and one sleep per failed attempt, then one error line;
+// at the default level only the error line. A daemon whose backlog stays
+// full costs each attempt the connect limit, and a line, not more.
+TEST_F(ClientTest, EachFailedAttemptCostsOneSleepOrOneBoundedWait) {
+  LogCapture log(7);
+  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 0), -1);
+  EXPECT_EQ(ConnectPeer(path_.c_str(), true, -5), -1);
+  EXPECT_EQ(ConnectPeer(path_.c_str(), false, 3), -1);
+  EXPECT_EQ(sleep_.calls(), 3);
+  EXPECT_EQ(sleep_.total_seconds(), 3u);
+  EXPECT_EQ(log.Normalized(),
+            (Lines{kFailed + path_, kFailed + path_, kFailed + "0, " + path_,
+                   kFailed + "1, " + path_, kFailed + "2, " + path_,
+                   kFailed + path_}));
+  {
+    LogCapture quiet;  // threshold 3
+    EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
+    EXPECT_EQ(quiet.Normalized(), Lines{kFailed + path_});
+  }
+  log.Clear();
   int daemon = ListenUnix(path_, 0);
   ASSERT_GE(daemon, 0);
   std::vector<int> queued = FillBacklog(path_);
   int previous = quvaidx::SetConnectTimeoutMs(50);
-  LogCapture log(7);
   auto start = std::chrono::steady_clock::now();
   alarm(10);  // a connect that waits for ever would end the test here
   EXPECT_EQ(ConnectPeer(path_.c_str(), false, 2), -1);
@@ -114,14 +106,12 @@ TEST_F(ClientTest, FullBacklogCostsOneBoundedWaitPerAttempt) {
   quvaidx::SetConnectTimeoutMs(previous);
   EXPECT_GE(waited, std::chrono::milliseconds(90));
   EXPECT_LT(waited, std::chrono::seconds(2));
-  EXPECT_EQ(sleep_.calls(), 2);
-  const std::string line = "quvaidx_ipc_core:N [Error] connect server: ";
+  EXPECT_EQ(sleep_.calls(), 5 + 2);
   EXPECT_EQ(log.Normalized(),
-            (std::vector<std::string>{line + "0, " + path_,
-                                      line + "1, " + path_, line + path_}));
+            (Lines{kFailed + "0, " + path_, kFailed + "1, " + path_,
+                   kFailed + path_}));
   for (int fd : queued) close(fd);
   close(daemon);
-  unlink(path_.c_str());
 }
 
 // ConnectDaemon says why it failed, and connects only to root or this
@@ -131,15 +121,14 @@ TEST_F(ClientTest, ConnectDaemonSaysWhyAndRefusesStrangers) {
   close(ListenUnix(stale, 1));
   quvaidx::test::WriteFile(dir_.File("file"), "");
   int mine = ListenUnix(dir_.File("mine.sock"), 4);
-  int stranger = ListenUnixAs(dir_.File("stranger.sock"), 4, 65534);
+  int stranger =
+      quvaidx::test::ListenUnixAs(dir_.File("stranger.sock"), 4, 65534);
   int full = ListenUnix(dir_.File("full.sock"), 0);
   ASSERT_GE(mine, 0);
   ASSERT_GE(stranger, 0);
   std::vector<int> queued = FillBacklog(dir_.File("full.sock"));
-  const struct {
-    std::string path;
-    int error;  // 0: connected
-  } kCases[] = {
+  const std::pair<std::string, int> cases[] = {
+      // path, errno (0: connected)
       {dir_.File("missing.sock"), ENOENT},
       {dir_.File("file"), ENOTSOCK},
       {stale, ECONNREFUSED},
@@ -149,19 +138,17 @@ TEST_F(ClientTest, ConnectDaemonSaysWhyAndRefusesStrangers) {
       {dir_.File("mine.sock"), 0},
   };
   LogCapture log;
-  for (const auto& c : kCases) {
+  for (const auto& [path, error] : cases) {
     errno = 0;
-    int fd = ConnectDaemon(c.path.c_str(), 50);
-    const int error = fd >= 0 ? 0 : errno;
+    int fd = ConnectDaemon(path.c_str(), 50);
+    EXPECT_EQ(fd >= 0 ? 0 : errno, error) << path;
     if (fd >= 0) close(fd);
-    EXPECT_EQ(error, c.error) << c.path;
   }
-  EXPECT_EQ(log.Count("quvaidx_ipc_core:N [Error] refused " +
-                      dir_.File("stranger.sock") +
-                      ": served by uid 65534 (pid " + std::to_string(getpid()) +
-                      "), neither root nor uid " + std::to_string(geteuid())),
-            1);
-  EXPECT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(
+      log.Normalized(),
+      Lines{"quvaidx_ipc_core:N [Error] refused " + dir_.File("stranger.sock") +
+            ": served by uid 65534 (pid " + std::to_string(getpid()) +
+            "), neither root nor uid " + std::to_string(geteuid())});
   // A socket in a folder the caller cannot search: permission denied.
   ASSERT_EQ(chmod(dir_.path().c_str(), 0700), 0);
   EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
@@ -189,10 +176,9 @@ TEST_F(ClientTest, OverlongPathIsRefusedNotCut) {
     EXPECT_GE(fd, 0);
     DisconnectPeer(fd);
   }
-  EXPECT_EQ(
-      log.Normalized(),
-      std::vector<std::string>{
-          "quvaidx_ipc_core:N [Error] socket path too long: " + longest + "q"});
+  EXPECT_EQ(log.Normalized(),
+            Lines{"quvaidx_ipc_core:N [Error] socket path too long: " +
+                  longest + "q"});
 }
 
 // A reset restarts the exchange (answered on the second connection), at
@@ -209,7 +195,7 @@ TEST_F(ClientTest, ResetRestartsTheExchangeAFewTimes) {
     EXPECT_EQ(value["n"].asInt(), 1);
     EXPECT_EQ(value["echo"], Command("PING"));
   }
-  ScriptedPeer peer(path_, Hangup);
+  ScriptedPeer peer(path_, [](int&, int) {});  // hangs up at once
   Json::Value value = Command("PING");
   EXPECT_EQ(AutoSendRecvPacketBySocketPath(path_.c_str(), value, 1), -1);
   EXPECT_TRUE(value.empty());
@@ -254,8 +240,9 @@ TEST_F(ClientTest, ExchangesLeaveTheValueEmptyOrNull) {
 }
 
 // The caller's descriptor is used (the path not looked at) and left open; a
-// reset on it is reported as -2.
-TEST_F(ClientTest, ExchangeOnCallersDescriptor) {
+// reset on it is reported as -2. A daemon started with its standard input
+// closed gets connections on descriptor 0: disconnecting closes it too.
+TEST_F(ClientTest, ExchangeOnCallersDescriptorAndDisconnectingIt) {
   ScriptedPeer peer(path_, AnswerAll);
   int fd = ConnectPeer(path_.c_str(), false, 1);
   ASSERT_GE(fd, 0);
@@ -272,23 +259,14 @@ TEST_F(ClientTest, ExchangeOnCallersDescriptor) {
   Json::Value value = Command("X");
   EXPECT_EQ(AutoSendRecvPacketByFd(fds[0], value, 0), -2);
   EXPECT_TRUE(value.empty());
-  close(fds[0]);
-}
-
-// A daemon started with its standard input closed gets connections on
-// descriptor 0: disconnecting must close that one too, and only it.
-TEST_F(ClientTest, DisconnectClosesDescriptorZero) {
   int saved = dup(0);
   ASSERT_GE(saved, 0);
-  int fds[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
   ASSERT_EQ(dup2(fds[0], 0), 0);
   close(fds[0]);
   EXPECT_EQ(DisconnectPeer(0), 0);
   EXPECT_EQ(fcntl(0, F_GETFD), -1);
   EXPECT_EQ(DisconnectPeer(-1), 0);
-  EXPECT_NE(fcntl(fds[1], F_GETFD), -1);
-  close(fds[1]);
+  EXPECT_NE(fcntl(saved, F_GETFD), -1);
   dup2(saved, 0);
   close(saved);
 }
