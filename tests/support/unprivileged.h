@@ -20,6 +20,10 @@ constexpr unsigned kNobody = 65534;
 // when the child could not run it.
 int RunUnprivileged(const std::function<int()>& check);
 
+// Runs `check` in a child process as this process is. Returns the value
+// `check` returned (0 to 254), or -1 when the child did not finish.
+int RunInChildProcess(const std::function<int()>& check);
+
 // Runs `check` in a child process that first becomes user `uid` with
 // primary group `gid` and supplementary groups `groups` (real, effective and
 // saved ids alike), which needs root. Returns the value `check` returned, or
