@@ -12,8 +12,9 @@
 
 #include <filesystem>
 #include <functional>
-#include <set>
+#include <map>
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -39,14 +40,13 @@ mode_t KindAt(const std::string& path) {
   return lstat(path.c_str(), &st) == 0 ? st.st_mode & S_IFMT : 0;
 }
 
-// Names in directory `dir`.
-std::set<std::string> Entries(const std::string& dir) {
-  std::set<std::string> names;
-  std::error_code ignored;
-  for (const auto& entry : std::filesystem::directory_iterator(dir, ignored)) {
-    names.insert(entry.path().filename());
+// Everything under `dir`: each file's bytes, "/" for a directory.
+std::map<std::string, std::string> Snapshot(const std::string& dir) {
+  std::map<std::string, std::string> found;
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(dir)) {
+    found[entry.path()] = entry.is_directory() ? "/" : ReadFile(entry.path());
   }
-  return names;
+  return found;
 }
 
 // errno after OpenEADir with create failed (returned -1), else 0.
@@ -138,18 +138,17 @@ TEST_F(RealTree, ItemsArePreferredInOrderAndNeedTwoBytesToCount) {
   EXPECT_STREQ("two", IsEAFileExist(ea_.c_str(), &size, "dir_item", "two"));
   EXPECT_STREQ("one", IsEAFileExist(ea_.c_str(), &size, "one", "big"));
   EXPECT_EQ(1, size);
-  const struct {
-    const char *n1, *n2, *path;          // path null: not present
-  } cases[] = {{"one", "big", nullptr},  // a 1-byte item hides the big one
-               {"none", "two", "two"},
-               {"dir_item", "none", nullptr}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.n1);
+  const std::tuple<const char*, const char*, const char*> cases[] = {
+      {"one", "big", nullptr},  // a 1-byte item hides the big one
+      {"none", "two", "two"},   // and the path found, null for none
+      {"dir_item", "none", nullptr}};
+  for (const auto& [n1, n2, path] : cases) {
+    SCOPED_TRACE(n1);
     char out[4096] = "untouched";
-    EXPECT_EQ(c.path != nullptr, IsEAFileExist2(media_.c_str(), c.n1, c.n2));
-    EXPECT_EQ(c.path ? 0 : -1,
-              GetEAFilePath(media_.c_str(), c.n1, c.n2, out, sizeof(out)));
-    EXPECT_EQ(c.path ? ea_ + "/" + c.path : "untouched", out);
+    EXPECT_EQ(path != nullptr, IsEAFileExist2(media_.c_str(), n1, n2));
+    EXPECT_EQ(path ? 0 : -1,
+              GetEAFilePath(media_.c_str(), n1, n2, out, sizeof(out)));
+    EXPECT_EQ(path ? ea_ + "/" + path : "untouched", out);
   }
   char cut[8];
   EXPECT_EQ(0, GetEAFilePath(media_.c_str(), "big", nullptr, cut, sizeof(cut)));
@@ -190,31 +189,30 @@ enum Plant { kNone, kDir, kFile, kToDir, kToFile, kDangling, kFifo };
 
 // A photo folder with its metadata directory, EA directory and items x and
 // y planted, and beside it `outside`, where a followed link would lead: the
-// file "victim" and the directory "d" with items x, y, a.jpg/x, a.jpg/y,
-// none of which may be seen, changed or removed.
+// file "victim" and the directory "d" with items x, y, a.jpg/x, a.jpg/y.
 class PlantedTree {
  public:
   PlantedTree(Plant hidden, Plant ea, Plant x = kNone, Plant y = kNone) {
     mkdir(outside_.File("d").c_str(), 0755);
     mkdir(outside_.File("d/a.jpg").c_str(), 0755);
-    for (const char* name : kOutsideFiles) WriteFile(outside_.File(name), "-");
+    for (const char* name : {"victim", "d/x", "d/y", "d/a.jpg/x", "d/a.jpg/y"})
+      WriteFile(outside_.File(name), name);
+    outside_before_ = Snapshot(outside_.path());
     PlantAt(hidden_, hidden);
     PlantAt(ea_, ea);
     PlantAt(ea_ + "/x", x);
     PlantAt(ea_ + "/y", y);
+    hidden_kind_ = KindAt(hidden_);
+    ea_kind_ = KindAt(ea_);
   }
 
-  bool OutsideUntouched() const {
-    std::set<std::string> found, expected = {"d", "d/a.jpg"};
-    for (const auto& entry :
-         std::filesystem::recursive_directory_iterator(outside_.path())) {
-      found.insert(entry.path().lexically_relative(outside_.path()));
-    }
-    for (const char* name : kOutsideFiles) {
-      expected.insert(name);
-      if (ReadFile(outside_.File(name)) != "-") return false;
-    }
-    return found == expected;
+  // Nothing outside seen, changed or removed; with `refused`, the planted
+  // entries are still there as they were.
+  void ExpectUntouched(bool refused) const {
+    EXPECT_EQ(outside_before_, Snapshot(outside_.path()));
+    if (!refused) return;
+    EXPECT_EQ(hidden_kind_, KindAt(hidden_)) << "removed";
+    EXPECT_EQ(ea_kind_, KindAt(ea_)) << "removed";
   }
 
   TempDir dir_, outside_;  // first: the paths below are made from them
@@ -222,9 +220,6 @@ class PlantedTree {
               ea_ = hidden_ + "/a.jpg";
 
  private:
-  static constexpr const char* kOutsideFiles[] = {"victim", "d/x", "d/y",
-                                                  "d/a.jpg/x", "d/a.jpg/y"};
-
   void PlantAt(const std::string& path, Plant kind) const {
     if (kind == kDir) mkdir(path.c_str(), 0755);
     if (kind == kFile) WriteFile(path, "12345");
@@ -234,19 +229,15 @@ class PlantedTree {
       symlink(outside_.File(to).c_str(), path.c_str());
     }
   }
+
+  std::map<std::string, std::string> outside_before_;
+  mode_t hidden_kind_, ea_kind_;
 };
 
 // The metadata directory (.quvameta) and the EA directory (.quvameta/a.jpg)
-// as a user may plant them.
-struct DirCase {
-  const char* what;
-  Plant hidden, ea;
-  int error_open;    // errno of OpenEADir without create, 0: opened
-  int error_create;  // and with create
-  bool refused;      // a refusal is logged
-};
-
-const DirCase kDirCases[] = {
+// as a user may plant them; errno of OpenEADir without and with create (0:
+// opened), and whether a refusal is logged.
+const std::tuple<const char*, Plant, Plant, int, int, bool> kDirCases[] = {
     {"nothing", kNone, kNone, ENOENT, 0, false},
     {"both directories", kDir, kDir, 0, 0, false},
     {"metadata dir links elsewhere", kToDir, kNone, ELOOP, ELOOP, true},
@@ -260,48 +251,73 @@ const DirCase kDirCases[] = {
     {"file at the EA dir", kDir, kFile, ENOTDIR, 0, false},
 };
 
-// Every planted entry, without and with create, from the folder's path and
-// from a descriptor of the folder: a link or special file is refused,
-// logged and left in place, a regular file is replaced only when creating.
-TEST(OpenEADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
-  for (const DirCase& c : kDirCases) {
-    for (int create : {0, 1}) {
-      for (bool by_fd : {false, true}) {
-        SCOPED_TRACE(std::string(c.what) + (create ? ", create" : "") +
-                     (by_fd ? ", folder fd" : ""));
-        PlantedTree tree(c.hidden, c.ea);
-        const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
-        const int folder =
-            by_fd ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
-        quvaidx::test::FdLeakCheck leaks;
-        LogCapture log;
-        errno = 0;
-        const int fd = OpenEADir(tree.media_.c_str(), folder, create);
-        EXPECT_EQ(create ? c.error_create : c.error_open, fd < 0 ? errno : 0);
-        EXPECT_EQ(c.refused ? 1u : 0u, log.lines().size());
-        if (fd >= 0) {
-          struct stat opened, named;
-          ASSERT_EQ(0, fstat(fd, &opened));
-          ASSERT_EQ(0, lstat(tree.ea_.c_str(), &named));
-          EXPECT_TRUE(S_ISDIR(named.st_mode));
-          EXPECT_EQ(named.st_ino, opened.st_ino);
-          EXPECT_EQ(FD_CLOEXEC, fcntl(fd, F_GETFD) & FD_CLOEXEC);
-          close(fd);
-        } else if (c.refused) {
-          EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
-          EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
-        }
-        EXPECT_TRUE(leaks.NoLeak());
-        EXPECT_TRUE(tree.OutsideUntouched());
-        if (folder >= 0) close(folder);
-      }
+// Every planted entry, for OpenEADir without and with create, from the
+// folder's path and from a descriptor of it: a link or special file is
+// refused, logged and left in place, a regular file replaced only when
+// creating.
+TEST(EADirWalk, OpenEADirRefusesOrReplacesPlantedEntriesNeverFollows) {
+  for (const auto& [what, hidden, ea, error_open, error_create, refused] :
+       kDirCases) {
+    for (int variant = 0; variant < 4; ++variant) {
+      const bool create = variant & 1, by_fd = variant & 2;
+      SCOPED_TRACE(std::string(what) + (create ? ", create" : "") +
+                   (by_fd ? ", folder fd" : ""));
+      PlantedTree tree(hidden, ea);
+      const int folder = by_fd ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
+      quvaidx::test::FdLeakCheck leaks;
+      LogCapture log;
+      errno = 0;
+      const int fd = OpenEADir(tree.media_.c_str(), folder, create);
+      EXPECT_EQ(create ? error_create : error_open, fd < 0 ? errno : 0);
+      EXPECT_EQ(refused ? 1u : 0u, log.lines().size());
+      struct stat opened = {}, named = {};
+      EXPECT_TRUE(fd < 0 ||
+                  (fstat(fd, &opened) == 0 &&
+                   lstat(tree.ea_.c_str(), &named) == 0 &&
+                   S_ISDIR(named.st_mode) && named.st_ino == opened.st_ino &&
+                   (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0));
+      if (fd >= 0) close(fd);
+      tree.ExpectUntouched(refused);
+      EXPECT_TRUE(leaks.NoLeak());
+      if (folder >= 0) close(folder);
+    }
+  }
+}
+
+// MakeEADir makes what OpenEADir with create would; GetEADirPath hands the
+// host only what is missing, never a refused link or special file, and
+// both log the refusal and their failure.
+TEST(EADirWalk, MakersNeverFollowPlantedEntries) {
+  for (const auto& [what, hidden, ea, error_open, error_create, refused] :
+       kDirCases) {
+    for (bool by_host : {false, true}) {
+      SCOPED_TRACE(std::string(what) + (by_host ? ", GetEADirPath" : ""));
+      PlantedTree tree(hidden, ea);
+      LogCapture log;
+      FakeHost host;
+      char buf[4096];
+      const char* media = tree.media_.c_str();
+      const bool made =
+          by_host ? error_open == 0 || error_open == ENOENT : error_create == 0;
+      EXPECT_EQ(made ? 0 : -1, by_host ? GetEADirPath(media, buf, sizeof(buf))
+                                       : MakeEADir(media, buf, sizeof(buf)));
+      EXPECT_EQ(tree.ea_, buf);
+      EXPECT_TRUE(!made || KindAt(tree.ea_) == S_IFDIR);
+      tree.ExpectUntouched(refused);
+      if (!refused) continue;
+      EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
+      ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
+      EXPECT_NE(std::string::npos,
+                log.lines()[1].text.find(
+                    by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
+                            : ", error:" + std::to_string(error_create)));
     }
   }
 }
 
 // The walk starts at the descriptor: the folder's path in file_path is not
 // opened then. Made directories take 0777 less the umask.
-TEST(OpenEADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
+TEST(EADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
   TempDir dir;
   const int folder = open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
   ASSERT_GE(folder, 0);
@@ -327,7 +343,7 @@ int AnswerHostPath(int, const char*, char* buffer, int size) {
   return 0;
 }
 
-TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
+TEST(EADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
   TempDir dir, outside;
   LogCapture log;
   const std::string media = dir.File("a.jpg");
@@ -352,66 +368,29 @@ TEST(OpenEADirWalk, BadArgumentsAndHostPathsOutsideTheFolderAreEINVAL) {
     EXPECT_EQ(EINVAL, OpenErrno(media.c_str(), -1)) << answer;
   }
   quvahost::SetHostOps(&previous);
-  EXPECT_TRUE(Entries(dir.path()).empty());
-  EXPECT_TRUE(Entries(outside.path()).empty());
+  EXPECT_TRUE(Snapshot(dir.path()).empty());
+  EXPECT_TRUE(Snapshot(outside.path()).empty());
   EXPECT_EQ(5u, log.lines().size());  // the host failure and four answers
-}
-
-// MakeEADir makes what OpenEADir with create would; GetEADirPath hands the
-// host only what is missing, never a refused link or special file, and
-// logs the refusal and its failure.
-TEST(EADirMakingWalk, PlantedEntriesAreNeverFollowedByEitherMaker) {
-  for (const DirCase& c : kDirCases) {
-    for (bool by_host : {false, true}) {
-      SCOPED_TRACE(std::string(c.what) + (by_host ? ", GetEADirPath" : ""));
-      PlantedTree tree(c.hidden, c.ea);
-      const mode_t hidden = KindAt(tree.hidden_), ea = KindAt(tree.ea_);
-      LogCapture log;
-      FakeHost host;
-      char buf[4096];
-      const char* media = tree.media_.c_str();
-      const int result = by_host ? GetEADirPath(media, buf, sizeof(buf))
-                                 : MakeEADir(media, buf, sizeof(buf));
-      const bool made = by_host ? c.error_open == 0 || c.error_open == ENOENT
-                                : c.error_create == 0;
-      EXPECT_EQ(made ? 0 : -1, result);
-      EXPECT_EQ(tree.ea_, buf);
-      EXPECT_TRUE(!made || KindAt(tree.ea_) == S_IFDIR);
-      if (c.refused) {
-        EXPECT_EQ(hidden, KindAt(tree.hidden_)) << "removed";
-        EXPECT_EQ(ea, KindAt(tree.ea_)) << "removed";
-        EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
-        ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
-        const std::string failure =
-            by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
-                    : ", error:" + std::to_string(c.error_create);
-        EXPECT_NE(std::string::npos, log.lines()[1].text.find(failure));
-      }
-      EXPECT_TRUE(tree.OutsideUntouched());
-    }
-  }
 }
 
 // The item functions where the metadata or EA directory, or an item x or y,
 // is planted: a link is neither an item nor removed nor followed.
-TEST(EAItemsWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
-  const struct {
-    const char* what;
-    Plant hidden, ea, x, y;
-    int removed;        // by RemoveEAFile(ea, "x", "y")
-    const char* found;  // by IsEAFileExist(ea, "x", "y")
-  } cases[] = {
-      {"real items", kDir, kDir, kFile, kFile, 2, "x"},
-      {"metadata dir links elsewhere", kToDir, kNone, kNone, kNone, 0, nullptr},
-      {"EA dir links elsewhere", kDir, kToDir, kNone, kNone, 0, nullptr},
-      {"dangling link at the metadata dir", kDangling, kNone, kNone, kNone, 0,
-       nullptr},
-      {"FIFO at the EA dir", kDir, kFifo, kNone, kNone, 0, nullptr},
-      {"x links to a file elsewhere", kDir, kDir, kToFile, kFile, 1, "y"},
-      {"x dangles, y links to a directory", kDir, kDir, kDangling, kToDir, 0,
-       nullptr},
-  };
-  // Each returns what it removed, or 1 when it found an item.
+TEST(EADirWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
+  // what, planted hidden, ea, x, y; removed by RemoveEAFile(ea, "x", "y"),
+  // found by IsEAFileExist(ea, "x", "y")
+  const std::tuple<const char*, Plant, Plant, Plant, Plant, int, const char*>
+      cases[] = {
+          {"real items", kDir, kDir, kFile, kFile, 2, "x"},
+          {"metadata dir links", kToDir, kNone, kNone, kNone, 0, nullptr},
+          {"EA dir links", kDir, kToDir, kNone, kNone, 0, nullptr},
+          {"dangling metadata dir", kDangling, kNone, kNone, kNone, 0, nullptr},
+          {"FIFO at the EA dir", kDir, kFifo, kNone, kNone, 0, nullptr},
+          {"x links to a file", kDir, kDir, kToFile, kFile, 1, "y"},
+          {"x dangles, y links to a dir", kDir, kDir, kDangling, kToDir, 0,
+           nullptr},
+      };
+  // The first two return what they removed, the others 1 when they found
+  // an item.
   const std::function<int(const char* media, const char* ea)> calls[] = {
       [](auto, auto ea) { return RemoveEAFile(ea, "x", "y"); },
       [](auto m, auto) { return RemoveEAFile2(m, "x", "y"); },
@@ -422,26 +401,26 @@ TEST(EAItemsWalk, PlantedLinksAreNeitherItemsNorRemovedNorFollowed) {
         return GetEAFilePath(m, "x", "y", out, sizeof(out)) == 0 ? 1 : 0;
       },
   };
-  for (const auto& c : cases) {
+  for (const auto& [what, hidden, ea, x, y, removed, found] : cases) {
     for (size_t i = 0; i < std::size(calls); ++i) {
-      SCOPED_TRACE(std::string(c.what) + ", call " + std::to_string(i));
-      PlantedTree tree(c.hidden, c.ea, c.x, c.y);
-      const mode_t x = KindAt(tree.ea_ + "/x");
+      SCOPED_TRACE(std::string(what) + ", call " + std::to_string(i));
+      PlantedTree tree(hidden, ea, x, y);
+      const mode_t x_kind = KindAt(tree.ea_ + "/x");
       LogCapture log;
-      EXPECT_EQ(i < 2 ? c.removed : c.found != nullptr,
+      EXPECT_EQ(i < 2 ? removed : found != nullptr,
                 calls[i](tree.media_.c_str(), tree.ea_.c_str()));
-      EXPECT_EQ(c.removed < 2, !log.lines().empty());  // refusals logged
-      EXPECT_TRUE(tree.OutsideUntouched());
-      EXPECT_TRUE(!S_ISLNK(x) || x == KindAt(tree.ea_ + "/x"))
+      EXPECT_EQ(removed < 2, !log.lines().empty());  // refusals logged
+      tree.ExpectUntouched(false);
+      EXPECT_TRUE(!S_ISLNK(x_kind) || x_kind == KindAt(tree.ea_ + "/x"))
           << "link removed";
     }
-    PlantedTree tree(c.hidden, c.ea, c.x, c.y);
-    const char *x = "x", *y = "y";
-    EXPECT_EQ(!c.found          ? nullptr
-              : *c.found == 'x' ? x
-                                : y,
-              IsEAFileExist(tree.ea_.c_str(), nullptr, x, y))
-        << c.what;
+    PlantedTree tree(hidden, ea, x, y);
+    const char *x_name = "x", *y_name = "y";
+    EXPECT_EQ(!found          ? nullptr
+              : *found == 'x' ? x_name
+                              : y_name,
+              IsEAFileExist(tree.ea_.c_str(), nullptr, x_name, y_name))
+        << what;
   }
 }
 
