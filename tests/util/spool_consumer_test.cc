@@ -1,8 +1,5 @@
-// The consumer side of spool queues: what the head reads as, what removal
-// may and may not take, a replaced queue, writers racing a consumer, the
-// bookkeeping (blanked entries, the side file, cutting and compaction,
-// attempts) and what a killed consumer leaves.
-#include <dirent.h>
+// The consumer side of spool queues: reading the head, removal, a replaced
+// queue, racing writers, the bookkeeping and what a killed consumer leaves.
 #include <fcntl.h>
 #include <signal.h>
 #include <stdio.h>
@@ -15,6 +12,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <map>
 #include <random>
@@ -22,6 +20,7 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -30,6 +29,7 @@
 #include "quvaidx/system.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
+#include "support/unprivileged.h"
 #include "util/queue_state.h"
 
 namespace {
@@ -84,11 +84,8 @@ struct stat StatOf(const std::string& path) {
 int Copies(const std::string& dir) {
   const std::regex copy("thumb\\.queue\\.[A-Za-z0-9]{6}");
   int count = 0;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (struct dirent* entry = readdir(d)) {
-      count += std::regex_match(entry->d_name, copy);
-    }
-    closedir(d);
+  for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+    count += std::regex_match(entry.path().filename().string(), copy);
   }
   return count;
 }
@@ -127,11 +124,8 @@ class SpoolConsumerTest : public ::testing::Test {
 // line without its line feed counts; reading changes nothing.
 TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
   const std::string longest(kMaxQueueEntry, 'x');
-  const struct {
-    std::string content;
-    int max;
-    Strings expected;
-  } cases[] = {
+  const std::tuple<std::string, int, Strings> cases[] = {
+      // text, max, read
       {"/a\n/b\n/c\n", 2, {"/a", "/b"}},
       {"/a\n/b\n", 8, {"/a", "/b"}},
       {"/a\n/unfinished", 8, {"/a", "/unfinished"}},
@@ -142,13 +136,13 @@ TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
       {std::string("\0\0\0\n\0\n\n/b\n", 10), 8, {"", "", "/b"}},
       {"", 8, {}},
   };
-  for (const auto& c : cases) {
-    WriteFile(queue_, c.content);
+  for (const auto& [content, max, expected] : cases) {
+    WriteFile(queue_, content);
     Json::Value entries = ToJson({"stale"});
-    EXPECT_EQ(ReadQueueHead(q_, c.max, entries),
-              static_cast<int>(c.expected.size()));
-    EXPECT_EQ(AsVector(entries), c.expected) << c.content.substr(0, 40);
-    EXPECT_EQ(ReadFile(queue_), c.content);
+    EXPECT_EQ(ReadQueueHead(q_, max, entries),
+              static_cast<int>(expected.size()));
+    EXPECT_EQ(AsVector(entries), expected) << content.substr(0, 40);
+    EXPECT_EQ(ReadFile(queue_), content);
   }
 }
 
@@ -189,12 +183,8 @@ TEST_F(SpoolConsumerTest, MissingQueueIsEmptyAndOddFilesAreRefused) {
 // a requeue makes is never executable.
 TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
   const std::string overlong(kMaxQueueEntry + 1, 'y');
-  const struct {
-    std::string content;
-    Strings done, requeue;
-    int removed;
-    std::string after;
-  } cases[] = {
+  // text, done, requeued, removed, entries after
+  const std::tuple<std::string, Strings, Strings, int, std::string> cases[] = {
       {"/a\n/b\n/c\n", {"/a", "/b"}, {}, 2, "/c\n"},  // the done prefix only
       {"/b\n/c\n", {"/a", "/b"}, {}, 0, "/b\n/c\n"},  // head trimmed elsewhere
       {"/a\n/x\n/b\n", {"/a", "/b"}, {}, 1, "/x\n/b\n"},  // stops at a change
@@ -209,13 +199,13 @@ TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
       {"/a\n", {"/a"}, {"", "two\nlines", overlong, "/ok"}, 1, "/ok\n"},
       {"/a\n", {}, {}, 0, "/a\n"},
   };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.content.substr(0, 20));
-    WriteFile(queue_, c.content);
-    EXPECT_EQ(Remove(c.done, c.requeue), c.removed);
+  for (const auto& [content, done, requeue, removed, live] : cases) {
+    SCOPED_TRACE(content.substr(0, 20));
+    WriteFile(queue_, content);
+    EXPECT_EQ(Remove(done, requeue), removed);
     const std::string after = ReadFile(queue_);
-    EXPECT_EQ(Live(after), c.after);
-    EXPECT_EQ(c.after.empty(), after.empty());
+    EXPECT_EQ(Live(after), live);
+    EXPECT_EQ(live.empty(), after.empty());
     EXPECT_EQ(std::string::npos, after.find('\0'));
   }
   unlink(q_);
@@ -419,14 +409,10 @@ TEST_F(SpoolConsumerTest, StaleCopiesAreRemovedByTheirExactNameOnly) {
 TEST_F(SpoolConsumerTest, AttemptsSurviveTheConsumerAndResetWithTheHead) {
   WriteFile(queue_, "/poison\n/next\n");
   EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 1);
-  for (int attempt : {2, 3}) {
-    const pid_t child = fork();
-    ASSERT_GE(child, 0);
-    // Dies in the middle of the entry's work, without any clean-up.
-    if (child == 0) _exit(CountQueueAttempt(q_, "/poison"));
-    int status;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_EQ(WEXITSTATUS(status), attempt);
+  for (int attempt : {2, 3}) {  // dies in the entry's work, no clean-up
+    EXPECT_EQ(quvaidx::test::RunInChildProcess(
+                  [&] { return CountQueueAttempt(q_, "/poison"); }),
+              attempt);
   }
   EXPECT_EQ(CountQueueAttempt(q_, "/poison"), 4);
   ASSERT_EQ(Remove({"/poison"}), 1);
