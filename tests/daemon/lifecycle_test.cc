@@ -30,6 +30,7 @@ namespace {
 using quvaidx::test::LogCapture;
 using quvaidx::test::ReadFile;
 using quvaidx::test::WriteFile;
+using Lines = std::vector<std::string>;
 
 const std::string kAlive = "Daemon alive. No need to start\n";
 
@@ -49,8 +50,7 @@ int ExitStatus(pid_t pid) {
              : -1;
 }
 
-// Sends what the calling process writes to its standard output to nowhere
-// (the refusal line).
+// Silences the refusal line on standard output.
 void Quiet() { dup2(open("/dev/null", O_WRONLY), 1); }
 
 class LifecycleTest : public ::testing::Test {
@@ -59,9 +59,8 @@ class LifecycleTest : public ::testing::Test {
   std::string pid_file_ = dir_.File("d.pid");
 };
 
-// The pid goes in without a line end, replacing a dead instance's, with
-// mode 0644 whatever the umask or the old mode; a live instance is refused,
-// its pid file kept, and BecomeDaemon does not detach.
+// The pid goes in without a line end, replacing a dead instance's, mode
+// 0644 whatever the umask; a live instance is refused, BecomeDaemon too.
 TEST_F(LifecycleTest, OneInstanceAtATime) {
   pid_t dead = fork();
   if (dead == 0) _exit(0);
@@ -93,9 +92,8 @@ TEST_F(LifecycleTest, OneInstanceAtATime) {
   EXPECT_EQ(DeletePidFile(dir_.File("none").c_str()), 0);  // missing: still 0
 }
 
-// Whatever is planted at the pid path other than a regular file of its own
-// is refused at once, logged and left alone: a root daemon must not write
-// its pid through a link or into another name of a file, nor hang on a FIFO.
+// Anything but a regular file of its own at the pid path is refused at once,
+// logged and left alone: no write through links, no hanging on a FIFO.
 TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   const std::string victim = dir_.File("victim");
   WriteFile(victim, "precious");
@@ -128,20 +126,16 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   chmod(dir_.path().c_str(), 0755);  // a pid file its user may not write
   EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
               LogCapture log;
-              return BecomeProcess(victim.c_str()) == -1 &&
-                             log.Normalized() ==
-                                 std::vector<std::string>{
-                                     "quvaidx_daemon:N [Error] create " +
-                                     victim + " (Permission denied)"}
-                         ? 0
-                         : 1;
+              const std::string line = "quvaidx_daemon:N [Error] create " +
+                                       victim + " (Permission denied)";
+              const bool refused = BecomeProcess(victim.c_str()) == -1;
+              return refused && log.Normalized() == Lines{line} ? 0 : 1;
             }),
             0);
 }
 
-// Starts `count` instances in child processes that run BecomeProcess on the
-// pid file at the same moment; returns one letter per instance (R runs, -
-// refused) and fills *pids. The instances live until *hold is closed.
+// Runs BecomeProcess in `count` children at the same moment; returns a
+// letter each (R runs, - refused). They live until *hold is closed.
 std::string StartTogether(const std::string& pid_file, int count,
                           std::vector<pid_t>* pids, int* hold) {
   int go[2], report[2], held[2];
@@ -190,9 +184,8 @@ TEST_F(LifecycleTest, SimultaneousStartsRunExactlyOne) {
   }
 }
 
-// DeletePidFile removes a stale pid file and this process's own, never that
-// of another live instance. A pid that cannot be written (a full disk)
-// fails the start and leaves the file unlocked for the next start.
+// DeletePidFile removes a stale pid file and its own, never a live one's. A
+// pid that cannot be written fails the start and leaves the file unlocked.
 TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   ASSERT_EQ(BecomeProcess(dir_.File("own.pid").c_str()), 0);  // held too
   std::vector<pid_t> other;
@@ -208,15 +201,11 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   EndAll(&other, hold);
   EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);  // stale now
   EXPECT_NE(access(pid_file_.c_str(), F_OK), 0);
-  EXPECT_EQ(quvaidx::test::RunWithFileSizeLimit(
-                0,
-                [&] {
-                  return BecomeProcess(pid_file_.c_str()) == -1 &&
-                                 Unlocked(pid_file_)
-                             ? 0
-                             : 1;
-                }),
-            0);
+  auto refused_unlocked = [&] {  // 0 when refused, the file left unlocked
+    return BecomeProcess(pid_file_.c_str()) == -1 && Unlocked(pid_file_) ? 0
+                                                                         : 1;
+  };
+  EXPECT_EQ(quvaidx::test::RunWithFileSizeLimit(0, refused_unlocked), 0);
   quvaidx::test::FdLeakCheck leaks;
   ASSERT_EQ(BecomeProcess(pid_file_.c_str()), 0);
   EXPECT_FALSE(Unlocked(pid_file_));
@@ -225,10 +214,8 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   EXPECT_TRUE(leaks.NoLeak());  // and its lock released
 }
 
-// A stale pid file replaced while a start holds the old one open unlocked:
-// the start must follow the path to the new file, refused while another
-// instance holds it, running in it otherwise. ptrace stops the start at
-// its flock, to make the race happen every time.
+// A pid file replaced between a start's open and its flock (made certain by
+// ptrace): the start follows the path, refused while another holds it.
 TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
   for (bool held : {true, false}) {
     WriteFile(pid_file_, "");
@@ -269,16 +256,14 @@ TEST_F(LifecycleTest, PidFileReplacedBetweenOpenAndLockIsNotTaken) {
   }
 }
 
-// The detached process (a session leader in /, input from /dev/null)
-// records its own pid and keeps the lock taken before detaching: a second
-// instance is refused even when the pid in the file misleads the check.
+// The detached process (a session leader in /, input /dev/null) records its
+// pid and keeps the lock: a second is refused whatever the file says.
 TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   std::string report = dir_.File("report"), stop = dir_.File("stop");
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
-    // daemon(0, 0) ends this process; the detached one carries on. The
-    // pid file is named relative to the working directory of the caller.
+    // The detached process carries on; the pid file is relative to the cwd.
     if (chdir(dir_.path().c_str()) != 0 || BecomeDaemon("d.pid") != 0) {
       _exit(3);
     }
@@ -308,12 +293,11 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), -1);
   EXPECT_EQ(::testing::internal::GetCapturedStdout(), kAlive);
-  pid_t second = fork();  // exits 7 when refused; detaching would exit 0
-  if (second == 0) {
-    Quiet();
-    _exit(BecomeDaemon(pid_file_.c_str()) == -1 ? 7 : 1);
-  }
-  EXPECT_EQ(ExitStatus(second), 7);
+  EXPECT_EQ(quvaidx::test::RunInChildProcess([&] {
+              Quiet();  // 7 when refused; detaching would end it with 0
+              return BecomeDaemon(pid_file_.c_str()) == -1 ? 7 : 1;
+            }),
+            7);
   WriteFile(stop, "");
   // Once it ends, its lock goes with it.
   for (int i = 0; i < 2500 && !Unlocked(pid_file_); ++i) usleep(2000);
@@ -338,7 +322,7 @@ TEST_F(LifecycleTest, MarkerFilesAndTheirAge) {
 }
 
 // Ready at once, polled every ten seconds, or given up after fifteen
-// minutes with a notice that the log level does not hold back.
+// minutes with a notice the log level does not hold back.
 TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
   using quvahost::test::HostOp;
   auto wait = [](std::initializer_list<int> steps, int calls, unsigned secs) {
@@ -354,8 +338,8 @@ TEST(BootWaitTest, PollsUntilReadyOrFifteenMinutes) {
   EXPECT_TRUE(wait({4}, 1, 0).empty());
   EXPECT_TRUE(wait({1, 2, 3, 4}, 4, 30).empty());
   EXPECT_EQ(wait({2}, 91, 900),
-            std::vector<std::string>{"quvaidx_system:N [NOTICE] system is "
-                                     "not ready? start anyway."});
+            Lines{"quvaidx_system:N [NOTICE] system is not ready? start "
+                  "anyway."});
 }
 
 // A started program's standard streams are /dev/null; a program that cannot
