@@ -33,6 +33,7 @@ using quvaidx::test::WriteFile;
 using Lines = std::vector<std::string>;
 
 const std::string kAlive = "Daemon alive. No need to start\n";
+const std::string kError = "quvaidx_daemon:N [Error] ";
 
 // Whether nobody holds the lock of the file at `path`.
 bool Unlocked(const std::string& path) {
@@ -86,9 +87,8 @@ TEST_F(LifecycleTest, OneInstanceAtATime) {
   LogCapture log;
   std::string bad = dir_.File("missing/d.pid");
   EXPECT_EQ(BecomeProcess(bad.c_str()), -1);
-  EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] create " + bad +
-                      " (No such file or directory)"),
-            1);
+  EXPECT_EQ(
+      log.Count(kError + "create " + bad + " (No such file or directory)"), 1);
   EXPECT_EQ(DeletePidFile(dir_.File("none").c_str()), 0);  // missing: still 0
 }
 
@@ -110,12 +110,10 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
     ASSERT_EQ(lstat(path.c_str(), &before), 0);
     LogCapture log;
     EXPECT_EQ(BecomeProcess(path.c_str()), -1);
-    EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] " + path +
-                        (name[0] == 'h' ? " has 2 names"
-                                        : " is not a regular "
-                                          "file") +
-                        "; not used as a pid file"),
-              1);
+    const char* why =
+        name[0] == 'h' ? " has 2 names" : " is not a regular file";
+    EXPECT_EQ(log.Normalized(),
+              Lines{kError + path + why + "; not used as a pid file"});
     ASSERT_EQ(lstat(path.c_str(), &after), 0);
     EXPECT_EQ(after.st_mode, before.st_mode);
   }
@@ -126,8 +124,8 @@ TEST_F(LifecycleTest, PidPathThatIsNoPlainFileIsRefused) {
   chmod(dir_.path().c_str(), 0755);  // a pid file its user may not write
   EXPECT_EQ(quvaidx::test::RunUnprivileged([&] {
               LogCapture log;
-              const std::string line = "quvaidx_daemon:N [Error] create " +
-                                       victim + " (Permission denied)";
+              const std::string line =
+                  kError + "create " + victim + " (Permission denied)";
               const bool refused = BecomeProcess(victim.c_str()) == -1;
               return refused && log.Normalized() == Lines{line} ? 0 : 1;
             }),
@@ -194,8 +192,8 @@ TEST_F(LifecycleTest, DeletePidFileSparesALiveInstance) {
   const std::string pid = std::to_string(other[0]);
   LogCapture log;
   EXPECT_EQ(DeletePidFile(pid_file_.c_str()), 0);
-  EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] " + pid_file_ +
-                      " names live process " + pid + "; not removed"),
+  EXPECT_EQ(log.Count(kError + pid_file_ + " names live process " + pid +
+                      "; not removed"),
             1);
   EXPECT_EQ(ReadFile(pid_file_), pid);
   EndAll(&other, hold);
@@ -264,9 +262,7 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
   ASSERT_GE(child, 0);
   if (child == 0) {
     // The detached process carries on; the pid file is relative to the cwd.
-    if (chdir(dir_.path().c_str()) != 0 || BecomeDaemon("d.pid") != 0) {
-      _exit(3);
-    }
+    if (chdir(dir_.path().c_str()) != 0 || BecomeDaemon("d.pid")) _exit(3);
     char cwd[64] = "", in[64] = "";
     (void)!getcwd(cwd, sizeof(cwd));
     (void)!readlink("/proc/self/fd/0", in, sizeof(in) - 1);
@@ -274,15 +270,11 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
                                    std::to_string(getsid(0) == getpid()) + " " +
                                    cwd + " " + in);
     rename((report + ".tmp").c_str(), report.c_str());
-    for (int i = 0; i < 200 && access(stop.c_str(), F_OK) != 0; ++i) {
-      usleep(25 * 1000);
-    }
+    for (int i = 0; i < 200 && access(stop.c_str(), F_OK); ++i) usleep(25000);
     _exit(0);
   }
   EXPECT_EQ(ExitStatus(child), 0);
-  for (int i = 0; i < 2500 && access(report.c_str(), F_OK) != 0; ++i) {
-    usleep(2000);
-  }
+  for (int i = 0; i < 2500 && access(report.c_str(), F_OK); ++i) usleep(2000);
   std::istringstream fields(ReadFile(report));
   std::string pid, leader, cwd, stdin_target;
   fields >> pid >> leader >> cwd >> stdin_target;
@@ -298,8 +290,7 @@ TEST_F(LifecycleTest, DaemonDetachesAndRecordsItsOwnPid) {
               return BecomeDaemon(pid_file_.c_str()) == -1 ? 7 : 1;
             }),
             7);
-  WriteFile(stop, "");
-  // Once it ends, its lock goes with it.
+  WriteFile(stop, "");  // once it ends, its lock goes with it
   for (int i = 0; i < 2500 && !Unlocked(pid_file_); ++i) usleep(2000);
   EXPECT_EQ(BecomeProcess(pid_file_.c_str()), 0);
 }
