@@ -129,13 +129,12 @@ TEST_F(SpoolConsumerTest, HeadReadsWholeLinesSkipsEmptyOnesBlanksForeignOnes) {
       {"/a\n/b\n/c\n", 2, {"/a", "/b"}},
       {"/a\n/b\n", 8, {"/a", "/b"}},
       {"/a\n/unfinished", 8, {"/a", "/unfinished"}},
-      {"\n/a\n\n\n/b", 8, {"/a", "/b"}},
       {"\n\n\n", 8, {}},
+      {"\n/a\n\n\n/b", 8, {"/a", "/b"}},
+      {"", 8, {}},
       {longest + "\n" + longest + "y\n/after\n", 8, {longest, "", "/after"}},
       {std::string("/nul\0here\n/b\n", 12), 8, {"", "/b"}},
-      {std::string("\0\0\0\n\0\n\n/b\n", 10), 8, {"", "", "/b"}},
-      {"", 8, {}},
-  };
+      {std::string("\0\0\0\n\0\n\n/b\n", 10), 8, {"", "", "/b"}}};
   for (const auto& [content, max, expected] : cases) {
     WriteFile(queue_, content);
     Json::Value entries = ToJson({"stale"});
@@ -183,17 +182,15 @@ TEST_F(SpoolConsumerTest, MissingQueueIsEmptyAndOddFilesAreRefused) {
 // a requeue makes is never executable.
 TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
   const std::string overlong(kMaxQueueEntry + 1, 'y');
+  const std::string foreign =
+      "\n" + overlong + std::string("\n\n/nul\0\n/a\n", 11);
   // text, done, requeued, removed, entries after
   const std::tuple<std::string, Strings, Strings, int, std::string> cases[] = {
       {"/a\n/b\n/c\n", {"/a", "/b"}, {}, 2, "/c\n"},  // the done prefix only
       {"/b\n/c\n", {"/a", "/b"}, {}, 0, "/b\n/c\n"},  // head trimmed elsewhere
       {"/a\n/x\n/b\n", {"/a", "/b"}, {}, 1, "/x\n/b\n"},  // stops at a change
       {"/a\n/new\n", {"/a"}, {}, 1, "/new\n"},  // appended meanwhile: stays
-      {"\n" + overlong + std::string("\n\n/nul\0\n/a\n", 11),
-       {"", ""},
-       {},
-       2,
-       "/a\n"},  // foreign lines are removed as read
+      {foreign, {"", ""}, {}, 2, "/a\n"},       // foreign lines removed as read
       {"\n\n/a\n\n/b\n", {"/a", "/b"}, {}, 2, ""},  // blank lines: no entries
       {"/a\n/b\n", {"/a"}, {"/a"}, 1, "/b\n/a\n"},  // requeue to the tail
       {"/a\n", {"/a"}, {"", "two\nlines", overlong, "/ok"}, 1, "/ok\n"},
