@@ -252,65 +252,59 @@ const std::tuple<const char*, Plant, Plant, int, int, bool> kDirCases[] = {
 };
 
 // Every planted entry, for OpenEADir without and with create, from the
-// folder's path and from a descriptor of it: a link or special file is
-// refused, logged and left in place, a regular file replaced only when
-// creating.
-TEST(EADirWalk, OpenEADirRefusesOrReplacesPlantedEntriesNeverFollows) {
+// folder's path and from a descriptor of it, and for both makers: a link or
+// special file is refused, logged and left in place, never followed; a
+// regular file is replaced only when creating. A maker logs its failure
+// after the refusal; GetEADirPath hands the host only what is missing.
+TEST(EADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
+  const char* kCallers[] = {"OpenEADir",       "OpenEADir create",
+                            "OpenEADir by fd", "OpenEADir create by fd",
+                            "MakeEADir",       "GetEADirPath"};
   for (const auto& [what, hidden, ea, error_open, error_create, refused] :
        kDirCases) {
-    for (int variant = 0; variant < 4; ++variant) {
-      const bool create = variant & 1, by_fd = variant & 2;
-      SCOPED_TRACE(std::string(what) + (create ? ", create" : "") +
-                   (by_fd ? ", folder fd" : ""));
+    for (int caller = 0; caller < 6; ++caller) {
+      SCOPED_TRACE(std::string(what) + ", " + kCallers[caller]);
       PlantedTree tree(hidden, ea);
-      const int folder = by_fd ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
+      const char* media = tree.media_.c_str();
+      const bool create = caller & 1, by_host = caller == 5;
+      const int folder =
+          (caller & 6) == 2 ? open(tree.dir_.path().c_str(), O_RDONLY) : -1;
       quvaidx::test::FdLeakCheck leaks;
-      LogCapture log;
-      errno = 0;
-      const int fd = OpenEADir(tree.media_.c_str(), folder, create);
-      EXPECT_EQ(create ? error_create : error_open, fd < 0 ? errno : 0);
-      EXPECT_EQ(refused ? 1u : 0u, log.lines().size());
-      struct stat opened = {}, named = {};
-      EXPECT_TRUE(fd < 0 ||
-                  (fstat(fd, &opened) == 0 &&
-                   lstat(tree.ea_.c_str(), &named) == 0 &&
-                   S_ISDIR(named.st_mode) && named.st_ino == opened.st_ino &&
-                   (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0));
-      if (fd >= 0) close(fd);
-      tree.ExpectUntouched(refused);
-      EXPECT_TRUE(leaks.NoLeak());
-      if (folder >= 0) close(folder);
-    }
-  }
-}
-
-// MakeEADir makes what OpenEADir with create would; GetEADirPath hands the
-// host only what is missing, never a refused link or special file, and
-// both log the refusal and their failure.
-TEST(EADirWalk, MakersNeverFollowPlantedEntries) {
-  for (const auto& [what, hidden, ea, error_open, error_create, refused] :
-       kDirCases) {
-    for (bool by_host : {false, true}) {
-      SCOPED_TRACE(std::string(what) + (by_host ? ", GetEADirPath" : ""));
-      PlantedTree tree(hidden, ea);
       LogCapture log;
       FakeHost host;
       char buf[4096];
-      const char* media = tree.media_.c_str();
-      const bool made =
-          by_host ? error_open == 0 || error_open == ENOENT : error_create == 0;
-      EXPECT_EQ(made ? 0 : -1, by_host ? GetEADirPath(media, buf, sizeof(buf))
-                                       : MakeEADir(media, buf, sizeof(buf)));
-      EXPECT_EQ(tree.ea_, buf);
-      EXPECT_TRUE(!made || KindAt(tree.ea_) == S_IFDIR);
+      if (caller < 4) {
+        errno = 0;
+        const int fd = OpenEADir(media, folder, create);
+        EXPECT_EQ(create ? error_create : error_open, fd < 0 ? errno : 0);
+        EXPECT_EQ(refused ? 1u : 0u, log.lines().size());
+        struct stat opened = {}, named = {};
+        EXPECT_TRUE(fd < 0 ||
+                    (fstat(fd, &opened) == 0 &&
+                     lstat(tree.ea_.c_str(), &named) == 0 &&
+                     S_ISDIR(named.st_mode) && named.st_ino == opened.st_ino &&
+                     (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0));
+        if (fd >= 0) close(fd);
+      } else {
+        const bool made = by_host ? error_open == 0 || error_open == ENOENT
+                                  : error_create == 0;
+        EXPECT_EQ(made ? 0 : -1, by_host ? GetEADirPath(media, buf, 4096)
+                                         : MakeEADir(media, buf, 4096));
+        EXPECT_EQ(tree.ea_, buf);
+        EXPECT_TRUE(!made || KindAt(tree.ea_) == S_IFDIR);
+        EXPECT_TRUE(!refused || host.Calls(HostOp::kEAMKDir) == 0);
+        if (refused) {
+          ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
+          EXPECT_NE(
+              std::string::npos,
+              log.lines()[1].text.find(
+                  by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
+                          : ", error:" + std::to_string(error_create)));
+        }
+      }
       tree.ExpectUntouched(refused);
-      if (!refused) continue;
-      EXPECT_EQ(0, host.Calls(HostOp::kEAMKDir));
-      ASSERT_EQ(2u, log.lines().size());  // the refusal, then the failure
-      EXPECT_NE(std::string::npos,
-                log.lines()[1].text.find(
-                    by_host ? "Make ea dir path error. eaDir path: " + tree.ea_
-                            : ", error:" + std::to_string(error_create)));
+      EXPECT_TRUE(leaks.NoLeak());
+      if (folder >= 0) close(folder);
     }
   }
 }
