@@ -1,12 +1,6 @@
 // The plug-in daemon as a real process on a private socket: asked with the
-// library's typed requests (pointed at it through the library's socket
-// seam), and by processes of other users (forked, with ids no file here
-// belongs to) about root-only files, 0700 folders, links planted in the
-// metadata directory and other users' folders; its loop answering at once
-// while requests wait on a media parser that never answers.
-//
-// Map: helpers; typed requests; answers for other users; convert records;
-// a stuck media parser.
+// library's typed requests, by processes of other users (root-only files,
+// planted links), and while a media parser never answers.
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -35,11 +29,11 @@
 #include "support/scripted_peer.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::daemon_test {
 namespace {
 
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
-using quvaidx::daemon_test::DaemonProcess;
 using quvaidx::test::ListenUnix;
 using quvaidx::test::ReadFile;
 using quvaidx::test::RunAsUser;
@@ -51,11 +45,6 @@ using Clock = std::chrono::steady_clock;
 // Users no file here belongs to and the user database does not know.
 constexpr unsigned kAlice = 48221;
 constexpr unsigned kMallory = 48222;
-
-bool Exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
-}
 
 Json::Value Request(const std::string& command, const std::string& path = "") {
   Json::Value request(Json::objectValue);
@@ -75,8 +64,7 @@ Json::Value ConvertAdd(const std::string& video, const std::string& copy) {
   return request;
 }
 
-// A connection to the daemon on which requests are sent and replies read
-// one by one.
+// A connection on which requests are sent and replies read one by one.
 class Client {
  public:
   explicit Client(const std::string& socket)
@@ -95,9 +83,8 @@ class Client {
   int fd_;
 };
 
-// The daemon on a private socket open to everyone, in a directory tree
-// everyone may search, with a scripted media parser beside it when a test
-// asks for one.
+// The daemon on a socket open to everyone, in a tree everyone may search,
+// with a scripted media parser when a test asks for one.
 class PluginDaemonTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -135,21 +122,16 @@ class PluginDaemonTest : public ::testing::Test {
                  : 1;  // a pipe takes it whole: the reply is a packet
     });
     close(pipe_fds[1]);
-    std::string text;
-    char buffer[4096];
-    for (ssize_t n; (n = read(pipe_fds[0], buffer, sizeof(buffer))) > 0;) {
-      text.append(buffer, static_cast<size_t>(n));
-    }
+    std::string text = ReadFile("/proc/self/fd/" + std::to_string(pipe_fds[0]));
     close(pipe_fds[0]);
     Json::Value reply;
     if (status != 0 || !Json::Reader().parse(text, reply)) return Json::Value();
     return reply;
   }
 
-  // A media parser that, as the real one, reads a file only as the process
-  // that asks could (its credentials and groups from the connection), and
-  // reports the file's first line as the video codec, having first run
-  // `meanwhile` (as a swap of the path); it counts the questions.
+  // A media parser that, as the real one, reads a file as the asking process
+  // (credentials and groups of the connection) and reports its first line as
+  // the video codec, after running `meanwhile`; it counts the questions.
   void ScriptParser(std::function<void()> meanwhile = nullptr) {
     parser_ = std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd,
                                                                        int) {
@@ -180,18 +162,13 @@ class PluginDaemonTest : public ::testing::Test {
     chmod(media_.c_str(), 0666);  // as its socket unit leaves it
   }
 
-  // Makes `path` (and its folders) with `content`, owned by `uid`, mode
-  // `mode`.
-  void Make(const std::string& path, const std::string& content, unsigned uid,
+  // Makes `path` (and its folders) with `content`, or a folder when that is
+  // null, owned by `uid` with `mode`.
+  void Make(const std::string& path, const char* content, unsigned uid,
             mode_t mode) {
-    std::filesystem::create_directories(
-        std::filesystem::path(path).parent_path());
-    WriteFile(path, content);
-    ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
-    ASSERT_EQ(chmod(path.c_str(), mode), 0);
-  }
-  void MakeDir(const std::string& path, unsigned uid, mode_t mode) {
-    std::filesystem::create_directories(path);
+    const std::filesystem::path where(path);
+    std::filesystem::create_directories(content ? where.parent_path() : where);
+    if (content) WriteFile(path, content);
     ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
     ASSERT_EQ(chmod(path.c_str(), mode), 0);
   }
@@ -205,12 +182,8 @@ class PluginDaemonTest : public ::testing::Test {
   std::atomic<int> asked_{0};
 };
 
-// ---------------------------------------------------------------------------
-// Typed requests
-
-// The daemon answers what the library's typed requests send, and the
-// library reads its answers; SIGTERM ends it with its socket and pid file
-// gone.
+// The library's typed requests get the daemon's answers; SIGTERM ends it
+// with its socket and pid file gone.
 TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   const std::string photo = dir_.File("share/a.jpg");
   const std::string video = dir_.File("share/clip.mkv");
@@ -220,8 +193,7 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   Make(video, "hevc\n", 0, 0644);
   const quvaidx::IndexSockets previous =
       quvaidx::SetIndexSockets({media_.c_str(), socket_.c_str()});
-  // Plug-ins are named only while their pid file names a live process:
-  // not when it is missing (web_video) or names a dead one.
+  // Plug-ins are named only while their pid file names a live process.
   WriteFile(dir_.File("quvamkthumbd.pid"), std::to_string(getpid()));
   WriteFile(dir_.File("dead.pid"), "999999999");
   ASSERT_TRUE(
@@ -230,7 +202,7 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
              "other=" + dir_.File("dead.pid")}))
       << daemon_.Errors();
 
-  const std::string jpeg(64, 'j');
+  const char* jpeg = "a thumbnail of two bytes or more";
   Make(ea + "a.jpg/QUVAPHOTO_THUMB_XL.jpg", jpeg, 0, 0644);
   Make(ea + "a.jpg/QUVAPHOTO:THUMB_S.jpg", jpeg, 0, 0644);
   int map = -1;
@@ -272,20 +244,13 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   quvaidx::SetIndexSockets(previous);
 }
 
-// ---------------------------------------------------------------------------
-// Answers for other users
-
-// A user learns through the daemon only what it could read itself: not
-// whether files in a 0700 folder exist, not the names of the photos there,
-// not the thumbnails behind a link planted towards them, not the codecs of
-// a root-only video (the media parser is not even asked), nor those of one
-// swapped in by name while the media parser is asked (it is asked as the
-// user). What it may read is answered, by the groups its process holds;
-// root as before.
+// A user learns only what it could read itself (by its groups too): not
+// files in a 0700 folder nor behind a link planted towards them, not a
+// root-only video's codecs (the parser is not asked), nor a swapped one's.
 TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
-  const std::string jpeg(64, 'j');
+  const char* jpeg = "a thumbnail of two bytes or more";
   const std::string mine = dir_.File("share/mallory/clip.mkv");
-  MakeDir(dir_.File("share/private"), 0, 0700);
+  Make(dir_.File("share/private"), nullptr, 0, 0700);
   Make(dir_.File("share/private/secret.jpg"), "photo", 0, 0644);
   Make(dir_.File("share/private/.quvameta/secret.jpg/QUVAPHOTO_THUMB_XL.jpg"),
        jpeg, 0, 0644);
@@ -293,7 +258,7 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
   Make(dir_.File("share/root.mkv"), "root's codec\n", 0, 0600);
   Make(dir_.File("share/group.mkv"), "group's codec\n", 0, 0640);
   ASSERT_EQ(chown(dir_.File("share/group.mkv").c_str(), 0, 48300), 0);
-  MakeDir(dir_.File("share/mallory"), kMallory, 0755);
+  Make(dir_.File("share/mallory"), nullptr, kMallory, 0755);
   Make(dir_.File("share/mallory/secret.jpg"), "photo", kMallory, 0644);
   Make(mine, "mallory's codec\n", kMallory, 0644);
   ASSERT_EQ(symlink(dir_.File("share/private/.quvameta").c_str(),
@@ -337,22 +302,18 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
   EXPECT_EQ(reply["photo"], dir_.File("share/private/secret.jpg"));
 }
 
-// ---------------------------------------------------------------------------
-// Convert records
-
-// A record is written only by a peer that may write into the video's EA
-// directory, and belongs to it: never into another user's folder, whether
-// named outright or through an EA directory planted as a link to it.
+// A record is written only where the peer may write, and is the peer's:
+// never into another user's folder, named outright or through a link.
 TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
   const std::string alice = dir_.File("share/alice");
   const std::string mallory = dir_.File("share/mallory");
   const std::string copy = alice + "/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4";
   for (const char* dir : {"", "/.quvameta", "/.quvameta/a.mkv"}) {
-    MakeDir(alice + dir, kAlice, 0755);
+    Make(alice + dir, nullptr, kAlice, 0755);
   }
   Make(alice + "/a.mkv", "video", kAlice, 0644);
   Make(copy, "converted video", kAlice, 0644);
-  MakeDir(mallory + "/.quvameta", kMallory, 0755);
+  Make(mallory + "/.quvameta", nullptr, kMallory, 0755);
   Make(mallory + "/a.mkv", "video", kMallory, 0644);
   ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
                     (mallory + "/.quvameta/a.mkv").c_str()),
@@ -378,14 +339,9 @@ TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
             std::string::npos);
 }
 
-// ---------------------------------------------------------------------------
-// A stuck media parser
-
-// While requests wait on a media parser that accepts and never answers, a
-// HANDSHAKE is answered at once; a request beyond the bound is refused at
-// once; a connection's own later request waits for its earlier one; each
-// waiting request fails after the media parser's time; SIGTERM ends the
-// daemon at once however many wait.
+// With requests waiting on a silent media parser, HANDSHAKE is answered and
+// a request beyond the bound refused at once; a connection's requests keep
+// their order; waiting ones time out; SIGTERM ends the daemon at once.
 TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
   Make(dir_.File("share/clip.mkv"), "video", 0, 0644);
   int stuck = ListenUnix(media_, 64);
@@ -432,3 +388,4 @@ TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
 }
 
 }  // namespace
+}  // namespace quvaidx::daemon_test
