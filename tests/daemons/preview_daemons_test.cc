@@ -163,9 +163,8 @@ TEST_F(ThumbDaemonTest, StoppedOrKilledMidEntryCompletesItWhenRestarted) {
   ASSERT_TRUE(Start(again)) << again.Errors();
   ASSERT_TRUE(Served()) << again.Errors();
   EXPECT_FALSE(Exists(queue_ + ".k1lled"));
-  for (const char* name : {"1.jpg", "2.jpg", "3.jpg"}) {
+  for (const char* name : {"1.jpg", "2.jpg", "3.jpg"})
     EXPECT_TRUE(AllThumbs(name)) << name;
-  }
   EXPECT_FALSE(TemporaryFilesLeft());
 }
 
@@ -219,10 +218,11 @@ TEST_F(ThumbDaemonTest, EntryThatEndedTheDaemonThreeTimesIsDropped) {
   EXPECT_TRUE(AllThumbs("good/g.jpg"));
 }
 
-// Links planted by a folder's owner where the daemon writes, towards others'
-// or the owner's own folders, are neither followed nor removed, each refusal
-// logged and the other thumbnails made; a queued link is refused.
-TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
+// Folders are worked as their owners: links planted where the daemon writes
+// are neither followed nor removed (each refusal logged, the other
+// thumbnails made), a queued link is refused, a root-only photo is refused;
+// thumbnails get their photo's owner, group and read bits (+u+w).
+TEST_F(ThumbDaemonTest, OtherUsersFoldersAreWorkedAsTheirOwners) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
   const std::string vault = dir_.File("vault");
   ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
@@ -261,6 +261,18 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
   }
   ASSERT_EQ(symlink((share_ + "/m1").c_str(), (share_ + "/linked").c_str()), 0);
   entries.push_back(share_ + "/linked");
+  const std::string folder = UserFolder("u", kUserA);
+  const struct {
+    const char* name;
+    unsigned uid, mode, thumb_mode;  // 0: no thumbnail
+  } photos[] = {
+      {"own.jpg", kUserA, 0640, 0640},
+      {"private.jpg", kUserA, 0400, 0600},
+      {"others.jpg", kUserB, 0644, 0644},
+      {"root.jpg", 0, 0600, 0},
+  };
+  for (const auto& p : photos) UserPhoto(folder + "/" + p.name, p.uid, p.mode);
+  entries.push_back(folder);
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon)) << daemon.Errors();
   ASSERT_TRUE(Serve(daemon, entries)) << daemon.Errors();
@@ -282,42 +294,21 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
   EXPECT_EQ(ReadFile(bob + "/IMG.jpg"), "bob's");
   EXPECT_TRUE(NamesUnder(spare).empty());
   EXPECT_TRUE(Exists(ThumbItem(share_ + "/i1/IMG.jpg", "S")));
-}
-
-// Photos are read as the folder's owner (a root-only one is refused and
-// logged); thumbnails get their photo's owner, group and read bits (+u+w).
-TEST_F(ThumbDaemonTest, ThumbnailsAreNoMoreReadableThanTheirPhotos) {
-  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
-  const std::string folder = UserFolder("u", kUserA);
-  const struct {
-    const char* name;
-    unsigned uid, mode, thumb_mode;  // 0: no thumbnail
-  } cases[] = {
-      {"own.jpg", kUserA, 0640, 0640},
-      {"private.jpg", kUserA, 0400, 0600},
-      {"others.jpg", kUserB, 0644, 0644},
-      {"root.jpg", 0, 0600, 0},
-  };
-  for (const auto& c : cases) UserPhoto(folder + "/" + c.name, c.uid, c.mode);
-  DaemonProcess daemon;
-  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
-  ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.name);
+  for (const auto& p : photos) {
+    SCOPED_TRACE(p.name);
     struct stat st;
     const bool made =
-        lstat(ThumbItem(folder + "/" + c.name, "XL").c_str(), &st) == 0;
-    ASSERT_EQ(made, c.thumb_mode != 0);
+        lstat(ThumbItem(folder + "/" + p.name, "XL").c_str(), &st) == 0;
+    ASSERT_EQ(made, p.thumb_mode != 0);
     if (!made) continue;
-    EXPECT_EQ(st.st_uid, c.uid);
-    EXPECT_EQ(st.st_gid, c.uid);
-    EXPECT_EQ(st.st_mode & 07777, c.thumb_mode);
+    EXPECT_EQ(st.st_uid, p.uid);
+    EXPECT_EQ(st.st_gid, p.uid);
+    EXPECT_EQ(st.st_mode & 07777, p.thumb_mode);
   }
-  EXPECT_NE(
-      daemon.Errors().find("skipped " + folder +
-                           "/root.jpg: cannot open it: Permission denied"),
-      std::string::npos)
-      << daemon.Errors();
+  EXPECT_NE(log.find("skipped " + folder +
+                     "/root.jpg: cannot open it: Permission denied"),
+            std::string::npos)
+      << log;
 }
 
 // The owner swaps photos with a link to a root-only photo and with a bomb
