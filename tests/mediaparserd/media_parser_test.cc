@@ -198,11 +198,11 @@ TEST_P(OracleTest, TechnicalFieldsAndTagsAgreeWithFfprobe) {
   EXPECT_EQ(r.szTitle, tag("title"));
   EXPECT_EQ(r.szArtist, tag("artist"));
   EXPECT_EQ(r.szAlbum, tag("album"));
-  EXPECT_EQ(r.szAlbumArtist,
-            tag("album_artist") + tag("albumartist") + tag("album artist"));
   EXPECT_EQ(r.szGenre, tag("genre"));
   EXPECT_EQ(r.szComposer, tag("composer"));
   EXPECT_EQ(r.szComment, tag("comment"));
+  EXPECT_EQ(r.szAlbumArtist,
+            tag("album_artist") + tag("albumartist") + tag("album artist"));
   EXPECT_EQ(r.track, atoi(tag("track").c_str()));
   EXPECT_EQ(r.disc, atoi(tag("disc").c_str()));
   EXPECT_EQ(r.year, atoi(tag("date").c_str()));
@@ -341,24 +341,23 @@ TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
 // The content, not the name, decides the type and the tag reader.
 TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
   TempDir dir;
-  const struct {
-    const char *fixture, *name;
-    MediaKind kind;
-    const char *container, *title;
-  } cases[] = {
-      {"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3",
-       "Überschrift ✓"},
-      {"song.spx", "song.flac", MediaKind::kMusic, "ogg", "Song Title"},
-      {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm",
-       "Matroska Clip"},
-      {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2", ""}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.name);
-    WriteFile(dir.File(c.name), ReadFile(Fixture(c.fixture)));
-    ASSERT_TRUE(Parse(dir.File(c.name))) << reason_;
-    EXPECT_EQ(media_.kind, c.kind);
-    EXPECT_STREQ(media_.record.szContainerType, c.container);
-    EXPECT_STREQ(media_.record.szTitle, c.title);
+  // fixture, copied to, kind, container, title
+  const std::tuple<const char*, const char*, MediaKind, const char*,
+                   const char*>
+      cases[] = {
+          {"song_id3v24.mp3", "song.mp4", MediaKind::kMusic, "mp3",
+           "Überschrift ✓"},
+          {"song.spx", "song.flac", MediaKind::kMusic, "ogg", "Song Title"},
+          {"video.mkv", "clip.mp3", MediaKind::kVideo, "matroska,webm",
+           "Matroska Clip"},
+          {"photo_exif.jpg", "photo.mp4", MediaKind::kPhoto, "image2", ""}};
+  for (const auto& [fixture, name, kind, container, title] : cases) {
+    SCOPED_TRACE(name);
+    WriteFile(dir.File(name), ReadFile(Fixture(fixture)));
+    ASSERT_TRUE(Parse(dir.File(name))) << reason_;
+    EXPECT_EQ(media_.kind, kind);
+    EXPECT_STREQ(media_.record.szContainerType, container);
+    EXPECT_STREQ(media_.record.szTitle, title);
   }
   EXPECT_STREQ(media_.record.szMake, "Canon");
 }
@@ -422,9 +421,9 @@ TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   }
 }
 
-// A photo without a readable pixel size (no frame header) is still a photo
-// when any one camera field can be read; with none, a damaged image.
-TEST_F(MediaParserTest, PhotoWithoutPixelSizeIsKnownByAnyCameraField) {
+// A photo without a pixel size (no frame header) is still a photo when any
+// one camera field can be read; with none, a damaged image.
+TEST_F(MediaParserTest, PicturesWithoutASizeInTheirHeader) {
   TempDir dir;
   const std::string jpeg = dir.File("p.jpg");
   const std::tuple<const char*, const char*, const char*> cases[] = {
@@ -459,12 +458,8 @@ TEST_F(MediaParserTest, PhotoWithoutPixelSizeIsKnownByAnyCameraField) {
     EXPECT_EQ(Json::FastWriter().write(json[field]), std::string(value) + "\n");
     EXPECT_EQ(media_.record.resolutionX + media_.record.resolutionY, 0);
   }
-}
-
-// A header that gives no picture size is not trusted: the picture is
-// decoded for it.
-TEST_F(MediaParserTest, HeaderWithoutPictureSizeIsNotTrusted) {
-  TempDir dir;
+  // A video header without a picture size is not trusted: the picture is
+  // decoded for it.
   const std::string video = ReadFile(Fixture("video_rot90.mp4"));
   // The sample entry of the picture stream: its width, then its height.
   const size_t entry = video.find("avc1", video.find("stsd"));
