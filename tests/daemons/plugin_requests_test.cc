@@ -107,7 +107,7 @@ class PluginRequestsTest : public ::testing::Test {
 };
 
 // A size's bit is set exactly when its item (either name) holds 2 bytes or
-// more.
+// more; a folder has its first photo's map.
 TEST_F(PluginRequestsTest, SizeMapsMatchTheFilesPresent) {
   const std::string jpeg(100, 'j');
   const struct {
@@ -142,12 +142,8 @@ TEST_F(PluginRequestsTest, SizeMapsMatchTheFilesPresent) {
     EXPECT_TRUE(reply["success"].asBool()) << c.file << " " << reply;
     EXPECT_EQ(reply["size_map"], c.map) << c.file;
   }
-}
-
-// A folder's map is its first web photo's by bytewise name (no AppleDouble
-// file, link, folder or other kind); an empty folder has 0 and no photo.
-TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
-  const std::string jpeg(100, 'j');
+  // A folder's map is its first web photo's by bytewise name (no AppleDouble
+  // file, link, folder or other kind); an empty folder has 0 and no photo.
   File("f", "b.jpg", {{"QUVAPHOTO_THUMB_XL.jpg", jpeg}});
   std::string first = File("f", "B.png", {{"QUVAPHOTO_THUMB_S.jpg", jpeg}});
   File("f", "._A.jpg");
@@ -158,7 +154,6 @@ TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
   EXPECT_TRUE(reply["success"].asBool()) << reply;
   EXPECT_EQ(reply["size_map"], 0x1);
   EXPECT_EQ(reply["photo"], first);
-
   mkdir(dir_.File("empty").c_str(), 0755);
   reply = Ask(Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("empty")));
   EXPECT_TRUE(reply["success"].asBool());
