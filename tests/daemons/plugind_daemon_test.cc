@@ -243,8 +243,9 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
 
 // A user learns only what it could read itself (by its groups too): not
 // files in a 0700 folder nor behind a link planted towards them, not a
-// root-only video's codecs (the parser is not asked), nor a swapped one's.
-TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
+// root-only video's codecs (the parser is not asked), nor a swapped one's;
+// it writes convert records, its own, only where it may write itself.
+TEST_F(PluginDaemonTest, AnotherUserReadsAndWritesOnlyWhatItMayItself) {
   Make("private", nullptr, 0, 0700);
   Make("private/secret.jpg", "photo", 0, 0644);
   Make("private/.quvameta/secret.jpg/QUVAPHOTO_THUMB_XL.jpg", kJpeg, 0, 0644);
@@ -258,6 +259,18 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
       Make("mallory/clip.mkv", "mallory's", kMallory, 0644);
   ASSERT_EQ(symlink(Share("private/.quvameta").c_str(),
                     Share("mallory/.quvameta").c_str()),
+            0);
+  const std::string alice = Share("alice");
+  const std::string mallory = Share("m");
+  for (const char* dir : {"alice", "alice/.quvameta", "alice/.quvameta/a.mkv"})
+    Make(dir, nullptr, kAlice, 0755);
+  Make("alice/a.mkv", "video", kAlice, 0644);
+  const std::string copy = Make("alice/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4",
+                                "converted video", kAlice, 0644);
+  Make("m/.quvameta", nullptr, kMallory, 0755);
+  Make("m/a.mkv", "video", kMallory, 0644);
+  ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
+                    (mallory + "/.quvameta/a.mkv").c_str()),
             0);
   ScriptParser([&] {  // the name now leads to root's video
     unlink(mine.c_str());
@@ -291,26 +304,8 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
   reply = AskAs(0, Request("GET_DIR_THUMB_SIZE_MAP", Share("private")));
   EXPECT_EQ(reply["size_map"], 0x8);
   EXPECT_EQ(reply["photo"], Share("private/secret.jpg"));
-}
 
-// A record is written only where the peer may write, and is the peer's:
-// never into another user's folder, named outright or through a link.
-TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
-  const std::string alice = Share("alice");
-  const std::string mallory = Share("mallory");
-  for (const char* dir : {"alice", "alice/.quvameta", "alice/.quvameta/a.mkv"})
-    Make(dir, nullptr, kAlice, 0755);
-  Make("alice/a.mkv", "video", kAlice, 0644);
-  const std::string copy = Make("alice/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4",
-                                "converted video", kAlice, 0644);
-  Make("mallory/.quvameta", nullptr, kMallory, 0755);
-  Make("mallory/a.mkv", "video", kMallory, 0644);
-  ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
-                    (mallory + "/.quvameta/a.mkv").c_str()),
-            0);
-  ASSERT_TRUE(Start()) << daemon_.Errors();
-
-  Json::Value reply = AskAs(kMallory, ConvertAdd(alice + "/a.mkv", copy));
+  reply = AskAs(kMallory, ConvertAdd(alice + "/a.mkv", copy));
   EXPECT_EQ(reply["reason"], "cannot create the record: Permission denied");
   reply = AskAs(kMallory,
                 ConvertAdd(mallory + "/a.mkv",
