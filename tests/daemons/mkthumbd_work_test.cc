@@ -1,6 +1,5 @@
-// The thumbnail daemon's work without the daemon: libvips thumbnails of
-// photos made here, and the walk through the queue with a stand-in for the
-// thumbnail making (which photos, which entries, as whom, when requeued).
+// The thumbnail daemon's work without the daemon: thumbnails of photos made
+// here, and the queue walk with a stand-in for the thumbnail making.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -116,9 +115,8 @@ TEST_F(ThumbnailerTest, ExifRotatedPhotosComeOutUpright) {
   }
 }
 
-// Only missing, 1-byte or stale thumbnails are made again (the ':' name
-// counts); each look removes a killed daemon's temporary files, and only
-// those (not another file, not a link that looks like one).
+// Only missing, 1-byte or stale thumbnails are made again (':' names count);
+// each look removes killed writers' temporary files, and only those.
 TEST_F(ThumbnailerTest, OnlyStaleOrMissingThumbnailsAreMadeAgain) {
   const std::string photo = Photo("p.jpg");
   const std::string ea = dir_.File(".quvameta/p.jpg/");
@@ -225,9 +223,8 @@ TEST_F(ThumbnailerTest, OneUnwritableItemDoesNotStopTheOthers) {
   EXPECT_TRUE(std::filesystem::is_symlink(ThumbItem(photo, "M")));
 }
 
-// A decode's cost depends on the format: decoders that hold the whole image
-// are refused under a limit the streaming ones stay within (HEIF: see
-// bench/thumb_rss.sh).
+// Decoders that hold the whole image are refused under a limit the streaming
+// ones stay within (HEIF: bench/thumb_rss.sh).
 TEST_F(ThumbnailerTest, DecodesThatWouldExceedTheMemoryLimitAreRefused) {
   // name with libvips save options; width; made
   const std::tuple<std::string, int, bool> cases[] = {
@@ -294,9 +291,8 @@ class ThumbWorkerTest : public ::testing::Test {
   std::function<void(const std::string&)> also_;
 };
 
-// Only the folder's own web photos, in name order (no subfolder, link,
-// AppleDouble file or other media; a final '/' changes nothing); entries
-// that name no folder, a link, or lie outside the shares are dropped.
+// Only the folder's own web photos, in name order; entries that name no
+// folder, a link, or lie outside the shares are dropped.
 TEST_F(ThumbWorkerTest, MakesTheFoldersOwnPhotosAndRefusesOtherEntries) {
   std::string a = Folder("a");
   for (const char* name : {"b.JPG", "a.png", "c.gif", "notes.txt", "clip.mp4",
