@@ -1,6 +1,5 @@
-// The plug-in daemon's answers without its socket, asked for root: size
-// maps, the folder's photo, videos to convert (a scripted media parser),
-// convert records, and requests to refuse.
+// The plug-in daemon's answers without its socket, asked for root, with a
+// scripted media parser.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -63,9 +62,8 @@ class PluginRequestsTest : public ::testing::Test {
     return dir_.File(folder + "/" + file);
   }
 
-  // A media parser that answers GET_MEDIA_INFO from `codecs` (path ->
-  // video, audio, container), or with "success" false for other paths, and
-  // counts the questions.
+  // A media parser answering from `codecs` (path -> video, audio, container)
+  // or failing; it counts the questions.
   std::unique_ptr<ScriptedPeer> Parser(
       std::map<std::string, std::vector<std::string>> codecs) {
     config_.media_parser_socket = dir_.File("mediaparser.sock");
