@@ -1,6 +1,5 @@
-// The plug-in daemon as a real process on a private socket: asked with the
-// library's typed requests, by processes of other users (root-only files,
-// planted links), and while a media parser never answers.
+// The plug-in daemon as a real process: asked with the library's typed
+// requests, by other users, and while a media parser never answers.
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -130,9 +129,8 @@ class PluginDaemonTest : public ::testing::Test {
     return reply;
   }
 
-  // A media parser that, as the real one, reads a file as the asking process
-  // (credentials and groups of the connection) and reports its first line as
-  // the video codec, after running `meanwhile`; it counts the questions.
+  // A media parser that reads a file as the asking peer, after `meanwhile`,
+  // and reports its first line as the video codec; it counts the questions.
   void ScriptParser(std::function<void()> meanwhile = nullptr) {
     parser_ = std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd,
                                                                        int) {
@@ -241,10 +239,8 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   quvaidx::SetIndexSockets(previous);
 }
 
-// A user learns only what it could read itself (by its groups too): not
-// files in a 0700 folder nor behind a link planted towards them, not a
-// root-only video's codecs (the parser is not asked), nor a swapped one's;
-// it writes convert records, its own, only where it may write itself.
+// A user learns only what it could read itself (by its groups too), also
+// through planted links and swaps, and writes records only where it may.
 TEST_F(PluginDaemonTest, AnotherUserReadsAndWritesOnlyWhatItMayItself) {
   Make("private", nullptr, 0, 0700);
   Make("private/secret.jpg", "photo", 0, 0644);
@@ -324,9 +320,8 @@ TEST_F(PluginDaemonTest, AnotherUserReadsAndWritesOnlyWhatItMayItself) {
             std::string::npos);
 }
 
-// With requests waiting on a silent media parser, HANDSHAKE is answered and
-// a request beyond the bound refused at once; a connection's requests keep
-// their order; waiting ones time out; SIGTERM ends the daemon at once.
+// With requests waiting on a silent parser, HANDSHAKE and refusals beyond
+// the bound come at once, in order, waits time out, SIGTERM ends at once.
 TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
   Make("clip.mkv", "video", 0, 0644);
   int stuck = ListenUnix(media_, 64);
