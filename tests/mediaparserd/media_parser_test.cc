@@ -1,6 +1,5 @@
-// The media parser on real files: the fixtures of make_fixtures.sh against
-// the oracles (ffprobe, exiftool, blkid), legacy tags under the host's code
-// pages, and hostile files.
+// The media parser on make_fixtures.sh's files against ffprobe, exiftool and
+// blkid; legacy tags under the host's code pages; hostile files.
 #include "media_parser.h"
 
 #include <fcntl.h>
@@ -103,9 +102,8 @@ std::string BlkidUuid(const std::string& path) {
   return uuid;
 }
 
-// Every technical field and the tags libavformat reads correctly against
-// ffprobe, EXIF against exiftool, the file's own fields against stat; only
-// still images may look like photos (exiv2 also reads QuickTime and more).
+// Fields against ffprobe, EXIF against exiftool, the file's against stat;
+// only still images look like photos (exiv2 also reads QuickTime and more).
 class OracleTest : public MediaParserTest,
                    public ::testing::WithParamInterface<const char*> {};
 
@@ -246,9 +244,8 @@ TEST_F(MediaParserTest, FileSystemWithoutSuperblockHasNoUuid) {
   EXPECT_STREQ(media_.record.szFsUUID, "");
 }
 
-// ID3v1 texts and ID3v2 frames declared Latin-1 are decoded in the host's
-// code page; under UTF-8 they cannot be: the title becomes the file's name,
-// the album its folder's, the rest empty, never invalid UTF-8.
+// ID3v1 and Latin-1 ID3v2 texts are decoded in the host's code page; where
+// they cannot be, the title is the file's name, the album its folder's.
 TEST_F(MediaParserTest, LegacyTagsAreReadInTheHostCodePage) {
   std::string folder = Fixture("");
   folder = folder.substr(0, folder.size() - 1);
@@ -291,9 +288,8 @@ std::string Id3v2Frame(const char* id, const std::string& body) {
   return frame + std::string(2, '\0') + body;
 }
 
-// Frames of an undeclared encoding give a clean text or none, and the rest
-// still counts: the comment without a description (others hold player
-// data), numbered genres by name, the disc's leading number.
+// Frames of an undeclared encoding give clean text or none; the comment
+// without a description counts, genres by name, the disc's leading number.
 TEST_F(MediaParserTest, Id3v2FramesAreReadSafely) {
   HostCodePage host("UTF-8");
   TempDir dir;
@@ -350,9 +346,8 @@ TEST_F(MediaParserTest, ContentNotNameDecidesTheType) {
   EXPECT_STREQ(media_.record.szMake, "Canon");
 }
 
-// What is not readable media is refused with a reason, never answered with
-// a zeroed record (nor read where its mode forbids); a file cut after its
-// header tells what the header tells.
+// Non-media (or a file its mode forbids) is refused with a reason, never a
+// zeroed record; a file cut after its header tells what the header tells.
 TEST_F(MediaParserTest, NonMediaIsRefusedWithAReason) {
   TempDir dir;
   FdLeakCheck fds;
@@ -462,9 +457,8 @@ TEST_F(MediaParserTest, PicturesWithoutASizeInTheirHeader) {
   }
 }
 
-// The time and read limits end the reading with a reason naming the limit;
-// sparse files of 4 GiB and more are read within them: a song followed by
-// zeros is the song, zeros alone are nothing.
+// The time and read limits end the reading with a reason; sparse files of
+// 4 GiB and more are read within them (a song and zeros, or zeros alone).
 TEST_F(MediaParserTest, LimitsBoundTheReadingOfFilesOfAnySize) {
   ParserOptions options;
   options.read.time_ms = 0;
