@@ -204,9 +204,8 @@ TEST_F(RecordFillTest, SongTakesTheContainerRateAndCountsItsCovers) {
       "audio_bitrate": 0, "szAudioCodec": "", "szTitle": ""})");
 }
 
-// UTF-16 (zeros in Latin code units, only bytes below 0x80 in Cyrillic) is
-// converted, not read as bytes; long texts are cut before the character
-// that does not fit, UTF-16 at 125 code units without splitting a pair.
+// UTF-16 is converted, not read as bytes; long texts are cut before the
+// character that does not fit, UTF-16 at 125 units without splitting a pair.
 TEST_F(RecordFillTest, TagTextsArriveAsUTF8CutAtCharacterBoundaries) {
   std::string cyrillic;
   for (int i = 0; i < 200; ++i) cyrillic += "ж";  // two bytes each
@@ -341,9 +340,8 @@ TEST_F(RecordFillTest, PhotoFieldsAreReadAsPhotographersWriteThem) {
     photo.taken = exif;
     EXPECT_STREQ(Fill(photo).szTakenTime, taken) << exif;
   }
-  // Camera names lose their padding and are read in the host's code page;
-  // negative sizes and ISO are none; without its own size a photo takes its
-  // stream's, and has no duration and no video codec.
+  // Camera names unpadded, in the host's code page; negative sizes and ISO
+  // none; a photo without a size takes its stream's, no duration or codec.
   HostCodePage host("windows-1251");
   PhotoFacts photo;
   photo.make = std::string("Canon\0\0", 7) + "   ";
