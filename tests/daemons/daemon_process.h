@@ -4,6 +4,7 @@
 #ifndef QUVAIDX_TESTS_DAEMONS_DAEMON_PROCESS_H_
 #define QUVAIDX_TESTS_DAEMONS_DAEMON_PROCESS_H_
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <functional>
@@ -41,6 +42,12 @@ class DaemonProcess {
   std::string out_;
   std::string err_;
 };
+
+// True when `path` names anything, a link too (not followed).
+inline bool Exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
 
 // Calls `done` every 10 ms until it is true or `seconds` have passed;
 // returns its last result.

@@ -1,12 +1,10 @@
-// The plug-in daemon's answers, without its socket: size maps against the
-// files actually present, the representative photo, running plug-ins,
-// videos that need converting (with a scripted media parser), records of
-// converted copies, and requests that must be refused. Asked for root here;
-// answers for other users are tested on the daemon itself.
+// The plug-in daemon's answers without its socket, asked for root, with a
+// scripted media parser.
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
 #include <map>
 #include <memory>
 #include <string>
@@ -16,13 +14,14 @@
 
 #include "photo_fixtures.h"
 #include "plugin_requests.h"
+#include "quvaidx/daemon.h"
 #include "quvaidx/ipc.h"
 #include "support/fd_check.h"
 #include "support/scripted_peer.h"
 
+namespace quvaidx::daemon_test {
 namespace {
 
-using quvaidx::daemon_test::NamesUnder;
 using quvaidx::test::ReadFile;
 using quvaidx::test::ScriptedPeer;
 using quvaidx::test::TempDir;
@@ -54,25 +53,17 @@ class PluginRequestsTest : public ::testing::Test {
   std::string File(const std::string& folder, const std::string& file,
                    const std::map<std::string, std::string>& items = {}) {
     const std::string ea = dir_.File(folder + "/.quvameta/" + file + "/");
-    mkdir(dir_.File(folder).c_str(), 0755);
+    std::filesystem::create_directories(items.empty() ? dir_.File(folder) : ea);
     WriteFile(dir_.File(folder + "/" + file), "photo or video");
-    if (!items.empty()) {
-      mkdir(dir_.File(folder + "/.quvameta").c_str(), 0755);
-      mkdir(ea.c_str(), 0755);
-    }
     for (const auto& [name, content] : items) {
-      if (content == "<dir>") {
-        mkdir((ea + name).c_str(), 0755);
-      } else {
-        WriteFile(ea + name, content);
-      }
+      if (content != "<dir>") WriteFile(ea + name, content);
+      if (content == "<dir>") mkdir((ea + name).c_str(), 0755);
     }
     return dir_.File(folder + "/" + file);
   }
 
-  // A media parser that answers GET_MEDIA_INFO from `codecs` (path ->
-  // video, audio, container), or with "success" false for other paths, and
-  // counts the questions.
+  // A media parser answering from `codecs` (path -> video, audio, container)
+  // or failing; it counts the questions.
   std::unique_ptr<ScriptedPeer> Parser(
       std::map<std::string, std::vector<std::string>> codecs) {
     config_.media_parser_socket = dir_.File("mediaparser.sock");
@@ -82,12 +73,11 @@ class PluginRequestsTest : public ::testing::Test {
           Json::Value request;
           if (RecvPacket(fd, request) != 0) return;
           ++asked_;
-          Json::Value reply(Json::objectValue);
           auto found = codecs.find(request["path"].asString());
-          reply["success"] = found != codecs.end();
-          if (found == codecs.end()) {
-            reply["reason"] = "cannot parse";
-          } else {
+          Json::Value reply =
+              MakeResponse(found != codecs.end(),
+                           found == codecs.end() ? "cannot parse" : nullptr);
+          if (found != codecs.end()) {
             reply["media"]["szVideoCodec"] = found->second[0];
             reply["media"]["szAudioCodec"] = found->second[1];
             reply["media"]["szContainerType"] = found->second[2];
@@ -114,11 +104,11 @@ class PluginRequestsTest : public ::testing::Test {
   int asked_ = 0;
 };
 
-// The map has the bit of a size exactly when an item of that size (either
-// name) holds 2 bytes or more.
+// A size's bit is set exactly when its item (either name) holds 2 bytes or
+// more; a folder has its first photo's map.
 TEST_F(PluginRequestsTest, SizeMapsMatchTheFilesPresent) {
   const std::string jpeg(100, 'j');
-  struct Case {
+  const struct {
     const char* file;
     std::map<std::string, std::string> items;
     int map;
@@ -144,19 +134,14 @@ TEST_F(PluginRequestsTest, SizeMapsMatchTheFilesPresent) {
        0},
       {"song.mp3", {{"QUVAPHOTO_THUMB_S.jpg", jpeg}}, 0},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     Json::Value reply =
         Ask(Request("GET_THUMB_SIZE_MAP", File("p", c.file, c.items)));
     EXPECT_TRUE(reply["success"].asBool()) << c.file << " " << reply;
     EXPECT_EQ(reply["size_map"], c.map) << c.file;
   }
-}
-
-// The folder's map is that of its first web photo by bytewise name: not an
-// AppleDouble file, a link, a folder or a file of another kind. An empty
-// folder has 0 and no photo.
-TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
-  const std::string jpeg(100, 'j');
+  // A folder's map is its first web photo's by bytewise name (no AppleDouble
+  // file, link, folder or other kind); an empty folder has 0 and no photo.
   File("f", "b.jpg", {{"QUVAPHOTO_THUMB_XL.jpg", jpeg}});
   std::string first = File("f", "B.png", {{"QUVAPHOTO_THUMB_S.jpg", jpeg}});
   File("f", "._A.jpg");
@@ -167,7 +152,6 @@ TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
   EXPECT_TRUE(reply["success"].asBool()) << reply;
   EXPECT_EQ(reply["size_map"], 0x1);
   EXPECT_EQ(reply["photo"], first);
-
   mkdir(dir_.File("empty").c_str(), 0755);
   reply = Ask(Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("empty")));
   EXPECT_TRUE(reply["success"].asBool());
@@ -175,8 +159,7 @@ TEST_F(PluginRequestsTest, FolderMapIsThatOfItsFirstPhotoByName) {
   EXPECT_FALSE(reply.isMember("photo"));
 }
 
-// Requests the daemon cannot answer get "success" false and a reason,
-// never a crash or a made-up map.
+// Requests it cannot answer get "success" false and a reason, no map.
 TEST_F(PluginRequestsTest, RequestsItCannotAnswerAreRefused) {
   std::string photo = File("p", "a.jpg");
   Json::Value wrong_type = Request("GET_THUMB_SIZE_MAP", photo);
@@ -203,11 +186,10 @@ TEST_F(PluginRequestsTest, RequestsItCannotAnswerAreRefused) {
   }
 }
 
-// "result" follows the codecs the media parser reports; a converted copy
-// under any of the twenty converted-video names, or a file that is not a
-// video, settles it without asking.
+// "result" follows the parser's codecs; a converted copy under any of the
+// twenty names, or a file that is no video, settles it without asking.
 TEST_F(PluginRequestsTest, VideoNeedConvertFollowsCodecsAndConvertedCopies) {
-  struct Case {
+  const struct {
     const char* file;
     std::vector<std::string> codecs;  // video, audio, container
     int result;
@@ -223,10 +205,10 @@ TEST_F(PluginRequestsTest, VideoNeedConvertFollowsCodecsAndConvertedCopies) {
       {"unknown.avi", {"", "", ""}, 1},
   };
   std::map<std::string, std::vector<std::string>> codecs;
-  for (const Case& c : cases) codecs[File("v", c.file)] = c.codecs;
+  for (const auto& c : cases) codecs[File("v", c.file)] = c.codecs;
   auto parser = Parser(codecs);
   ASSERT_TRUE(parser->listening());
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     Json::Value reply = Ask(Request("IS_VIDEO_NEED_CONVERT",
                                     dir_.File(std::string("v/") + c.file)));
     EXPECT_TRUE(reply["success"].asBool()) << c.file << " " << reply;
@@ -252,9 +234,8 @@ TEST_F(PluginRequestsTest, VideoNeedConvertFollowsCodecsAndConvertedCopies) {
   EXPECT_EQ(asked_, 9);
 }
 
-// Without an answer from the media parser the daemon cannot tell: the reply
-// fails (the caller reads 0), and a parser that never answers, or stops in
-// the middle of its reply, costs at most the configured wait.
+// Without the parser's answer the reply fails; a parser silent or stopped
+// mid-reply costs at most the configured wait.
 TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
   std::string video = File("v", "a.mkv");
   config_.media_parser_socket = dir_.File("mediaparser.sock");
@@ -286,10 +267,8 @@ TEST_F(PluginRequestsTest, NoAnswerFromTheMediaParserFailsTheReply) {
   }
 }
 
-// The record lands beside the converted copy, complete and clean, whatever
-// path leads to the copy. A record may only go beside a real converted copy
-// of a real video: no file is ever written where a request points
-// elsewhere, nor through a link planted in the metadata directory.
+// A record lands, complete, only beside a real converted copy of a real
+// video (by any path), never elsewhere nor through a planted link.
 TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
   std::string video = File("v", "a.mkv",
                            {{"QUVAPHOTO:FILM_H.mp4", "converted video"},
@@ -301,10 +280,9 @@ TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
   mkdir(dir_.File("w").c_str(), 0755);
   WriteFile(dir_.File("w/a.mkv"), "video");
   symlink(dir_.File("v/.quvameta").c_str(), dir_.File("w/.quvameta").c_str());
-  struct Case {
+  const struct {
     const char* fault;
-    std::string source;
-    std::string copy;
+    std::string source, copy;
   } cases[] = {
       {"copy elsewhere", video, dir_.File("v/QUVAPHOTO_FILM_L.mp4")},
       {"copy not named as one", video, ea + "other.mp4"},
@@ -318,7 +296,7 @@ TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
       {"source missing", dir_.File("v/gone.mkv"), ea + "QUVAPHOTO_FILM_L.mp4"},
       {"source relative", "v/a.mkv", ea + "QUVAPHOTO_FILM_L.mp4"},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     EXPECT_FALSE(Add(c.source, c.copy)["success"].asBool()) << c.fault;
     EXPECT_NE(access((c.copy + ".json").c_str(), F_OK), 0) << c.fault;
   }
@@ -351,3 +329,4 @@ TEST_F(PluginRequestsTest, ConvertRecordIsWrittenOnlyBesideAConvertedCopy) {
 }
 
 }  // namespace
+}  // namespace quvaidx::daemon_test

@@ -1,12 +1,5 @@
-// The plug-in daemon as a real process on a private socket: asked with the
-// library's typed requests (pointed at it through the library's socket
-// seam), and by processes of other users (forked, with ids no file here
-// belongs to) about root-only files, 0700 folders, links planted in the
-// metadata directory and other users' folders; its loop answering at once
-// while requests wait on a media parser that never answers.
-//
-// Map: helpers; typed requests; answers for other users; convert records;
-// a stuck media parser.
+// The plug-in daemon as a real process: asked with the library's typed
+// requests, by other users, and while a media parser never answers.
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -35,11 +28,11 @@
 #include "support/scripted_peer.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::daemon_test {
 namespace {
 
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
-using quvaidx::daemon_test::DaemonProcess;
 using quvaidx::test::ListenUnix;
 using quvaidx::test::ReadFile;
 using quvaidx::test::RunAsUser;
@@ -49,13 +42,9 @@ using quvaidx::test::WriteFile;
 using Clock = std::chrono::steady_clock;
 
 // Users no file here belongs to and the user database does not know.
+constexpr const char* kJpeg = "a thumbnail of two bytes or more";
 constexpr unsigned kAlice = 48221;
 constexpr unsigned kMallory = 48222;
-
-bool Exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
-}
 
 Json::Value Request(const std::string& command, const std::string& path = "") {
   Json::Value request(Json::objectValue);
@@ -75,8 +64,7 @@ Json::Value ConvertAdd(const std::string& video, const std::string& copy) {
   return request;
 }
 
-// A connection to the daemon on which requests are sent and replies read
-// one by one.
+// A connection on which requests are sent and replies read one by one.
 class Client {
  public:
   explicit Client(const std::string& socket)
@@ -95,9 +83,8 @@ class Client {
   int fd_;
 };
 
-// The daemon on a private socket open to everyone, in a directory tree
-// everyone may search, with a scripted media parser beside it when a test
-// asks for one.
+// The daemon on a socket open to everyone, in a tree everyone may search,
+// with a scripted media parser when a test asks for one.
 class PluginDaemonTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -135,21 +122,15 @@ class PluginDaemonTest : public ::testing::Test {
                  : 1;  // a pipe takes it whole: the reply is a packet
     });
     close(pipe_fds[1]);
-    std::string text;
-    char buffer[4096];
-    for (ssize_t n; (n = read(pipe_fds[0], buffer, sizeof(buffer))) > 0;) {
-      text.append(buffer, static_cast<size_t>(n));
-    }
+    std::string text = ReadFile("/proc/self/fd/" + std::to_string(pipe_fds[0]));
     close(pipe_fds[0]);
     Json::Value reply;
     if (status != 0 || !Json::Reader().parse(text, reply)) return Json::Value();
     return reply;
   }
 
-  // A media parser that, as the real one, reads a file only as the process
-  // that asks could (its credentials and groups from the connection), and
-  // reports the file's first line as the video codec, having first run
-  // `meanwhile` (as a swap of the path); it counts the questions.
+  // A media parser that reads a file as the asking peer, after `meanwhile`,
+  // and reports its first line as the video codec; it counts the questions.
   void ScriptParser(std::function<void()> meanwhile = nullptr) {
     parser_ = std::make_unique<ScriptedPeer>(media_, [this, meanwhile](int& fd,
                                                                        int) {
@@ -180,20 +161,19 @@ class PluginDaemonTest : public ::testing::Test {
     chmod(media_.c_str(), 0666);  // as its socket unit leaves it
   }
 
-  // Makes `path` (and its folders) with `content`, owned by `uid`, mode
-  // `mode`.
-  void Make(const std::string& path, const std::string& content, unsigned uid,
-            mode_t mode) {
-    std::filesystem::create_directories(
-        std::filesystem::path(path).parent_path());
-    WriteFile(path, content);
-    ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
-    ASSERT_EQ(chmod(path.c_str(), mode), 0);
+  std::string Share(const std::string& name) {
+    return dir_.File("share/" + name);
   }
-  void MakeDir(const std::string& path, unsigned uid, mode_t mode) {
-    std::filesystem::create_directories(path);
-    ASSERT_EQ(chown(path.c_str(), uid, uid), 0);
-    ASSERT_EQ(chmod(path.c_str(), mode), 0);
+  // Makes `name` in the share (and its folders) with `content`, or a folder
+  // when that is null, owned by `uid` with `mode`; returns its path.
+  std::string Make(const std::string& name, const char* content, unsigned uid,
+                   mode_t mode) {
+    const std::filesystem::path path(Share(name));
+    std::filesystem::create_directories(content ? path.parent_path() : path);
+    if (content) WriteFile(path, content);
+    EXPECT_EQ(chown(path.c_str(), uid, uid), 0);
+    EXPECT_EQ(chmod(path.c_str(), mode), 0);
+    return path;
   }
 
   TempDir dir_;
@@ -205,23 +185,15 @@ class PluginDaemonTest : public ::testing::Test {
   std::atomic<int> asked_{0};
 };
 
-// ---------------------------------------------------------------------------
-// Typed requests
-
-// The daemon answers what the library's typed requests send, and the
-// library reads its answers; SIGTERM ends it with its socket and pid file
-// gone.
+// The library's typed requests get the daemon's answers; SIGTERM ends it
+// with its socket and pid file gone.
 TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
-  const std::string photo = dir_.File("share/a.jpg");
-  const std::string video = dir_.File("share/clip.mkv");
-  const std::string ea = dir_.File("share/.quvameta/");
-  const std::string copy = ea + "clip.mkv/QUVAPHOTO_FILM_M.mp4";
-  Make(photo, "photo", 0, 0644);
-  Make(video, "hevc\n", 0, 0644);
+  const std::string photo = Make("a.jpg", "photo", 0, 0644);
+  const std::string video = Make("clip.mkv", "hevc\n", 0, 0644);
+  const std::string copy = Share(".quvameta/clip.mkv/QUVAPHOTO_FILM_M.mp4");
   const quvaidx::IndexSockets previous =
       quvaidx::SetIndexSockets({media_.c_str(), socket_.c_str()});
-  // Plug-ins are named only while their pid file names a live process:
-  // not when it is missing (web_video) or names a dead one.
+  // Plug-ins are named only while their pid file names a live process.
   WriteFile(dir_.File("quvamkthumbd.pid"), std::to_string(getpid()));
   WriteFile(dir_.File("dead.pid"), "999999999");
   ASSERT_TRUE(
@@ -229,10 +201,8 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
              "--plugin", "web_video=" + dir_.File("quvamkflvd.pid"), "--plugin",
              "other=" + dir_.File("dead.pid")}))
       << daemon_.Errors();
-
-  const std::string jpeg(64, 'j');
-  Make(ea + "a.jpg/QUVAPHOTO_THUMB_XL.jpg", jpeg, 0, 0644);
-  Make(ea + "a.jpg/QUVAPHOTO:THUMB_S.jpg", jpeg, 0, 0644);
+  Make(".quvameta/a.jpg/QUVAPHOTO_THUMB_XL.jpg", kJpeg, 0, 0644);
+  Make(".quvameta/a.jpg/QUVAPHOTO:THUMB_S.jpg", kJpeg, 0, 0644);
   int map = -1;
   EXPECT_EQ(QUVAIDX_GetThumbSizeMap(photo.c_str(), THUMB_TYPE_PHOTO, &map), 0);
   EXPECT_EQ(map, 0x9);
@@ -244,10 +214,9 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
 
   ScriptParser();
   EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 1);
-  Make(copy, "converted video", 0, 0644);
+  Make(".quvameta/clip.mkv/QUVAPHOTO_FILM_M.mp4", "converted video", 0, 0644);
   EXPECT_EQ(QUVAIDX_IsVideoNeedConvert(video.c_str()), 0);
-  static __tag_QUVA_MEDIA_INFO source;
-  static __tag_QUVA_MEDIA_INFO converted;
+  static __tag_QUVA_MEDIA_INFO source, converted;
   snprintf(source.szPath, sizeof(source.szPath), "%s", video.c_str());
   snprintf(converted.szPath, sizeof(converted.szPath), "%s", copy.c_str());
   EXPECT_EQ(QUVAIDX_IndexConvertAdd(&source, &converted, Json::Value("job 7")),
@@ -261,9 +230,7 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   host.Answer(HostOp::kProcAliveByPidFile, {1});
   Json::Value names;
   EXPECT_EQ(QUVAIDX_GetAllPluginName(names), 0);
-  Json::Value expected(Json::arrayValue);
-  expected.append("photo_thumbnail");
-  EXPECT_EQ(names, expected);
+  EXPECT_EQ(Json::FastWriter().write(names), "[\"photo_thumbnail\"]\n");
 
   ASSERT_TRUE(daemon_.Signal(SIGTERM));
   EXPECT_TRUE(daemon_.WaitExit(10));
@@ -272,47 +239,48 @@ TEST_F(PluginDaemonTest, TypedRequestsGetTheDaemonsAnswers) {
   quvaidx::SetIndexSockets(previous);
 }
 
-// ---------------------------------------------------------------------------
-// Answers for other users
-
-// A user learns through the daemon only what it could read itself: not
-// whether files in a 0700 folder exist, not the names of the photos there,
-// not the thumbnails behind a link planted towards them, not the codecs of
-// a root-only video (the media parser is not even asked), nor those of one
-// swapped in by name while the media parser is asked (it is asked as the
-// user). What it may read is answered, by the groups its process holds;
-// root as before.
-TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
-  const std::string jpeg(64, 'j');
-  const std::string mine = dir_.File("share/mallory/clip.mkv");
-  MakeDir(dir_.File("share/private"), 0, 0700);
-  Make(dir_.File("share/private/secret.jpg"), "photo", 0, 0644);
-  Make(dir_.File("share/private/.quvameta/secret.jpg/QUVAPHOTO_THUMB_XL.jpg"),
-       jpeg, 0, 0644);
-  Make(dir_.File("share/private/clip.mkv"), "hevc\n", 0, 0644);
-  Make(dir_.File("share/root.mkv"), "root's codec\n", 0, 0600);
-  Make(dir_.File("share/group.mkv"), "group's codec\n", 0, 0640);
-  ASSERT_EQ(chown(dir_.File("share/group.mkv").c_str(), 0, 48300), 0);
-  MakeDir(dir_.File("share/mallory"), kMallory, 0755);
-  Make(dir_.File("share/mallory/secret.jpg"), "photo", kMallory, 0644);
-  Make(mine, "mallory's codec\n", kMallory, 0644);
-  ASSERT_EQ(symlink(dir_.File("share/private/.quvameta").c_str(),
-                    dir_.File("share/mallory/.quvameta").c_str()),
+// A user learns only what it could read itself (by its groups too), also
+// through planted links and swaps, and writes records only where it may.
+TEST_F(PluginDaemonTest, AnotherUserReadsAndWritesOnlyWhatItMayItself) {
+  Make("private", nullptr, 0, 0700);
+  Make("private/secret.jpg", "photo", 0, 0644);
+  Make("private/.quvameta/secret.jpg/QUVAPHOTO_THUMB_XL.jpg", kJpeg, 0, 0644);
+  Make("private/clip.mkv", "hevc\n", 0, 0644);
+  const std::string root = Make("root.mkv", "root's codec\n", 0, 0600);
+  Make("group.mkv", "group's codec\n", 0, 0640);
+  ASSERT_EQ(chown(Share("group.mkv").c_str(), 0, 48300), 0);
+  Make("mallory", nullptr, kMallory, 0755);
+  Make("mallory/secret.jpg", "photo", kMallory, 0644);
+  const std::string mine =
+      Make("mallory/clip.mkv", "mallory's", kMallory, 0644);
+  ASSERT_EQ(symlink(Share("private/.quvameta").c_str(),
+                    Share("mallory/.quvameta").c_str()),
+            0);
+  const std::string alice = Share("alice");
+  const std::string mallory = Share("m");
+  for (const char* dir : {"alice", "alice/.quvameta", "alice/.quvameta/a.mkv"})
+    Make(dir, nullptr, kAlice, 0755);
+  Make("alice/a.mkv", "video", kAlice, 0644);
+  const std::string copy = Make("alice/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4",
+                                "converted video", kAlice, 0644);
+  Make("m/.quvameta", nullptr, kMallory, 0755);
+  Make("m/a.mkv", "video", kMallory, 0644);
+  ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
+                    (mallory + "/.quvameta/a.mkv").c_str()),
             0);
   ScriptParser([&] {  // the name now leads to root's video
     unlink(mine.c_str());
-    symlink(dir_.File("share/root.mkv").c_str(), mine.c_str());
+    symlink(root.c_str(), mine.c_str());
   });
   ASSERT_TRUE(Start()) << daemon_.Errors();
 
   for (const Json::Value& request : {
-           Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("share/private")),
-           Request("GET_THUMB_SIZE_MAP", dir_.File("share/private/secret.jpg")),
-           Request("GET_THUMB_SIZE_MAP", dir_.File("share/private/gone.jpg")),
-           Request("IS_VIDEO_NEED_CONVERT",
-                   dir_.File("share/private/clip.mkv")),
-           Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/root.mkv")),
-           Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/group.mkv")),
+           Request("GET_DIR_THUMB_SIZE_MAP", Share("private")),
+           Request("GET_THUMB_SIZE_MAP", Share("private/secret.jpg")),
+           Request("GET_THUMB_SIZE_MAP", Share("private/gone.jpg")),
+           Request("IS_VIDEO_NEED_CONVERT", Share("private/clip.mkv")),
+           Request("IS_VIDEO_NEED_CONVERT", root),
+           Request("IS_VIDEO_NEED_CONVERT", Share("group.mkv")),
        }) {
     EXPECT_EQ(AskAs(kMallory, request),
               MakeResponse(false, "Permission denied"))
@@ -320,46 +288,20 @@ TEST_F(PluginDaemonTest, AnotherUserLearnsOnlyWhatItCouldReadItself) {
   }
   EXPECT_EQ(asked_, 0);
   Json::Value reply = AskAs(
-      kMallory,
-      Request("GET_THUMB_SIZE_MAP", dir_.File("share/mallory/secret.jpg")));
+      kMallory, Request("GET_THUMB_SIZE_MAP", Share("mallory/secret.jpg")));
   EXPECT_EQ(reply["size_map"], 0) << reply;
   reply = AskAs(kMallory, Request("IS_VIDEO_NEED_CONVERT", mine));
   EXPECT_EQ(reply, MakeResponse(false,
                                 "the media parser cannot read the "
                                 "file: Permission denied"));
-  reply = AskAs(kMallory,
-                Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/group.mkv")),
+  reply = AskAs(kMallory, Request("IS_VIDEO_NEED_CONVERT", Share("group.mkv")),
                 {48300});
   EXPECT_EQ(reply["video_codec"], "group's codec") << reply;
-  reply =
-      AskAs(0, Request("GET_DIR_THUMB_SIZE_MAP", dir_.File("share/private")));
+  reply = AskAs(0, Request("GET_DIR_THUMB_SIZE_MAP", Share("private")));
   EXPECT_EQ(reply["size_map"], 0x8);
-  EXPECT_EQ(reply["photo"], dir_.File("share/private/secret.jpg"));
-}
+  EXPECT_EQ(reply["photo"], Share("private/secret.jpg"));
 
-// ---------------------------------------------------------------------------
-// Convert records
-
-// A record is written only by a peer that may write into the video's EA
-// directory, and belongs to it: never into another user's folder, whether
-// named outright or through an EA directory planted as a link to it.
-TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
-  const std::string alice = dir_.File("share/alice");
-  const std::string mallory = dir_.File("share/mallory");
-  const std::string copy = alice + "/.quvameta/a.mkv/QUVAPHOTO_FILM_M.mp4";
-  for (const char* dir : {"", "/.quvameta", "/.quvameta/a.mkv"}) {
-    MakeDir(alice + dir, kAlice, 0755);
-  }
-  Make(alice + "/a.mkv", "video", kAlice, 0644);
-  Make(copy, "converted video", kAlice, 0644);
-  MakeDir(mallory + "/.quvameta", kMallory, 0755);
-  Make(mallory + "/a.mkv", "video", kMallory, 0644);
-  ASSERT_EQ(symlink((alice + "/.quvameta/a.mkv").c_str(),
-                    (mallory + "/.quvameta/a.mkv").c_str()),
-            0);
-  ASSERT_TRUE(Start()) << daemon_.Errors();
-
-  Json::Value reply = AskAs(kMallory, ConvertAdd(alice + "/a.mkv", copy));
+  reply = AskAs(kMallory, ConvertAdd(alice + "/a.mkv", copy));
   EXPECT_EQ(reply["reason"], "cannot create the record: Permission denied");
   reply = AskAs(kMallory,
                 ConvertAdd(mallory + "/a.mkv",
@@ -378,23 +320,17 @@ TEST_F(PluginDaemonTest, ConvertRecordsGoOnlyWhereThePeerMayWrite) {
             std::string::npos);
 }
 
-// ---------------------------------------------------------------------------
-// A stuck media parser
-
-// While requests wait on a media parser that accepts and never answers, a
-// HANDSHAKE is answered at once; a request beyond the bound is refused at
-// once; a connection's own later request waits for its earlier one; each
-// waiting request fails after the media parser's time; SIGTERM ends the
-// daemon at once however many wait.
+// With requests waiting on a silent parser, HANDSHAKE and refusals beyond
+// the bound come at once, in order, waits time out, SIGTERM ends at once.
 TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
-  Make(dir_.File("share/clip.mkv"), "video", 0, 0644);
+  Make("clip.mkv", "video", 0, 0644);
   int stuck = ListenUnix(media_, 64);
   ASSERT_GE(stuck, 0);
   ASSERT_TRUE(Start(
       {"--workers", "5", "--max-requests", "5", "--media-parser-timeout", "3"}))
       << daemon_.Errors();
   const Json::Value convert =
-      Request("IS_VIDEO_NEED_CONVERT", dir_.File("share/clip.mkv"));
+      Request("IS_VIDEO_NEED_CONVERT", Share("clip.mkv"));
   std::vector<std::unique_ptr<Client>> waiting;
   for (int i = 0; i < 4; ++i) {
     waiting.push_back(std::make_unique<Client>(socket_));
@@ -432,3 +368,4 @@ TEST_F(PluginDaemonTest, HandshakeIsAnsweredWhileRequestsWaitOnTheParser) {
 }
 
 }  // namespace
+}  // namespace quvaidx::daemon_test

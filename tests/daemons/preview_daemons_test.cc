@@ -1,9 +1,5 @@
-// The thumbnail daemon as a real process in a private directory:
-// quvamkthumbd on its own queue and pid file (woken by SIGUSR1, bad photos
-// skipped, stopped or killed in the middle of an entry and started again;
-// and, run as root over folders of other users, links planted in its way,
-// photos it must not read, a photo swapped under it). The plug-in daemon's
-// process tests are in plugind_daemon_test.cc.
+// quvamkthumbd as a real process on a private queue and pid file, also as
+// root over other users' folders (planted links, unreadable photos, swaps).
 #include <fcntl.h>
 #include <grp.h>
 #include <signal.h>
@@ -15,7 +11,6 @@
 #include <unistd.h>
 
 #include <chrono>
-
 #include <filesystem>
 #include <string>
 #include <vector>
@@ -27,41 +22,24 @@
 #include "quvaidx/system.h"
 #include "support/fd_check.h"
 
+namespace quvaidx::daemon_test {
 namespace {
 
-using quvaidx::daemon_test::ColourAt;
-using quvaidx::daemon_test::DaemonProcess;
-using quvaidx::daemon_test::kBlue;
-using quvaidx::daemon_test::kRed;
-using quvaidx::daemon_test::kUserA;
-using quvaidx::daemon_test::kUserB;
-using quvaidx::daemon_test::MakeOwnedDir;
-using quvaidx::daemon_test::NamesUnder;
-using quvaidx::daemon_test::Own;
-using quvaidx::daemon_test::Rgb;
-using quvaidx::daemon_test::ThumbItem;
-using quvaidx::daemon_test::WaitUntil;
 using quvaidx::test::ReadFile;
 using quvaidx::test::TempDir;
 using quvaidx::test::WriteFile;
 
-bool Exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
-}
-
 class ThumbDaemonTest : public ::testing::Test {
  protected:
-  // The share is the only one of the host stand-in's database, which the
-  // daemon reads from the test's directory (DaemonProcess).
+  // The share is the only one of the host stand-in's database.
   ThumbDaemonTest() {
     umask(022);  // the daemon's, which thumbnails' modes are read with
     mkdir(share_.c_str(), 0755);
-    quvaidx::daemon_test::WriteShares(dir_.path(), {{"share", share_}});
+    WriteShares(dir_.path(), {{"share", share_}});
   }
 
-  // Starts the daemon in the foreground on the private queue and pid file,
-  // pausing `throttle_ms` after each photo, and waits until its loop runs.
+  // Starts the daemon, pausing `throttle_ms` after each photo; waits until
+  // its loop runs.
   bool Start(DaemonProcess& daemon, const std::string& throttle_ms = "0") {
     return daemon.Start(
         MKTHUMBD_PATH,
@@ -71,7 +49,7 @@ class ThumbDaemonTest : public ::testing::Test {
   }
   std::string Photo(const std::string& name) {
     std::string path = share_ + "/" + name;
-    EXPECT_TRUE(quvaidx::daemon_test::WritePhoto(path, 900, 600, kRed, kBlue));
+    EXPECT_TRUE(WritePhoto(path, 900, 600, kRed, kBlue));
     return path;
   }
   bool AllThumbs(const std::string& name) {
@@ -96,7 +74,7 @@ class ThumbDaemonTest : public ::testing::Test {
   }
   std::string UserPhoto(const std::string& path, unsigned uid,
                         unsigned mode = 0644, Rgb colour = kRed) {
-    EXPECT_TRUE(quvaidx::daemon_test::WritePlainPhoto(path, 900, 600, colour));
+    EXPECT_TRUE(WritePlainPhoto(path, 900, 600, colour));
     EXPECT_TRUE(Own(path, uid, uid, mode));
     return path;
   }
@@ -114,18 +92,13 @@ class ThumbDaemonTest : public ::testing::Test {
   std::string pid_file_ = dir_.File("quvamkthumbd.pid");
 };
 
-// Asleep until SIGUSR1; then the whole queue: a truncated JPEG, a zero-byte
-// .jpg, a bomb, a photo deleted and one replaced by a FIFO after their
-// folder was listed (the pause after each photo holds the daemon while they
-// change; the FIFO is never waited on), a folder deleted while queued and
-// one outside every share are logged and skipped, the good photo made, and
-// the daemon runs on; SIGTERM ends it at once with its pid file gone.
+// Asleep until SIGUSR1; bad photos (also ones changed after the listing) and
+// entries are logged and skipped; SIGTERM ends it, its pid file gone.
 TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   std::string whole = ReadFile(Photo("a.jpg"));
   WriteFile(share_ + "/cut.jpg", whole.substr(0, whole.size() / 3));
   WriteFile(share_ + "/empty.jpg", "");
-  ASSERT_TRUE(
-      quvaidx::daemon_test::WritePngBomb(share_ + "/bomb.png", 30000, 30000));
+  ASSERT_TRUE(WritePngBomb(share_ + "/bomb.png", 30000, 30000));
   const std::string fifo = Photo("y.jpg");
   const std::string doomed = Photo("z.jpg");
   ASSERT_EQ(mkdir(dir_.File("outside").c_str(), 0755), 0);
@@ -158,13 +131,8 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   EXPECT_FALSE(Exists(pid_file_));
 }
 
-// Stopped with SIGTERM, then killed with SIGKILL, each while an entry's
-// first photo has just been made (the pause after each photo holds the
-// daemon there): the SIGTERM ends it at once and cleanly; after either the
-// entry is still queued. Started again, the daemon completes it without
-// being woken, over the killed one's pid file, and leaves no temporary
-// file, not even one that a kill while writing left beside thumbnails that
-// are up to date, nor a copy of the queue that a killed rewrite left.
+// SIGTERM or SIGKILL mid-entry leave it queued; restarted, the daemon
+// completes it and removes killed writers' temporary files and queue copies.
 TEST_F(ThumbDaemonTest, StoppedOrKilledMidEntryCompletesItWhenRestarted) {
   for (const char* name : {"1.jpg", "2.jpg", "3.jpg"}) Photo(name);
   ASSERT_EQ(WriteIndexQueue(share_.c_str(), queue_.c_str()), 0);
@@ -192,15 +160,13 @@ TEST_F(ThumbDaemonTest, StoppedOrKilledMidEntryCompletesItWhenRestarted) {
   ASSERT_TRUE(Start(again)) << again.Errors();
   ASSERT_TRUE(Served()) << again.Errors();
   EXPECT_FALSE(Exists(queue_ + ".k1lled"));
-  for (const char* name : {"1.jpg", "2.jpg", "3.jpg"}) {
+  for (const char* name : {"1.jpg", "2.jpg", "3.jpg"})
     EXPECT_TRUE(AllThumbs(name)) << name;
-  }
   EXPECT_FALSE(TemporaryFilesLeft());
 }
 
-// WriteThumbQueue signals the daemon as soon as its pid file names a live
-// process, which is before the daemon watches SIGUSR1: a wake-up then must
-// not end it (SIGUSR1's default action).
+// A SIGUSR1 between writing the pid file and the loop must not end the
+// daemon (the default action): WriteThumbQueue signals that early.
 TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
   DaemonProcess daemon;
   ASSERT_TRUE(
@@ -209,7 +175,6 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
                    dir_.path(), "mkthumbd", ""));
   ASSERT_TRUE(WaitUntil(
       10, [&] { return !ReadFile(pid_file_).empty() || !daemon.Running(); }));
-  // Wake-ups from the moment the pid file is written until the loop runs.
   WaitUntil(10, [&] {
     daemon.Signal(SIGUSR1);
     return daemon.Output().find("running") != std::string::npos ||
@@ -218,10 +183,8 @@ TEST_F(ThumbDaemonTest, EarlyWakeUpDoesNotEndTheStartingDaemon) {
   EXPECT_TRUE(daemon.Running()) << daemon.Errors();
 }
 
-// An entry during which the daemon died (killed here, as the memory limit
-// or a crash would end it) is tried again at the next start, but not a
-// fourth time: then it is logged and dropped, and the entry behind it is
-// served.
+// An entry during which the daemon died three times (killed, as by the
+// memory limit) is logged and dropped; the entry behind it is served.
 TEST_F(ThumbDaemonTest, EntryThatEndedTheDaemonThreeTimesIsDropped) {
   const std::string bad = share_ + "/bad";
   ASSERT_EQ(mkdir(bad.c_str(), 0755), 0);
@@ -252,14 +215,9 @@ TEST_F(ThumbDaemonTest, EntryThatEndedTheDaemonThreeTimesIsDropped) {
   EXPECT_TRUE(AllThumbs("good/g.jpg"));
 }
 
-// Links planted by a folder's owner where the daemon writes (at the
-// metadata directory, at a photo's EA directory, at a thumbnail's name, at
-// a leftover temporary file's), to a root-only folder, to another user's
-// photos or to a folder the owner may write itself. None is followed
-// (nothing appears, changes or goes at its target) and none is removed;
-// each refusal is logged and the folder's other thumbnails are made. A
-// queued folder that is itself a link is refused.
-TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
+// Folders are worked as their owners: planted links are neither followed nor
+// removed, root-only photos refused; thumbnails get their photo's modes.
+TEST_F(ThumbDaemonTest, OtherUsersFoldersAreWorkedAsTheirOwners) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
   const std::string vault = dir_.File("vault");
   ASSERT_TRUE(MakeOwnedDir(vault, 0, 0, 0700));
@@ -267,11 +225,9 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
   const std::string bob = UserFolder("bob", kUserB);
   WriteFile(bob + "/IMG.jpg", "bob's");
   const std::string spare = UserFolder("spare", kUserA);
-  struct Case {
+  const struct {
     const char* folder;
-    std::string link;  // in the folder
-    std::string target;
-    std::string logged;
+    std::string link, target, logged;  // link: in the folder
   } cases[] = {
       {"m1", ".quvameta", vault, "IMG.jpg: a symbolic link is in the way"},
       {"m2", ".quvameta", spare, "IMG.jpg: a symbolic link is in the way"},
@@ -285,10 +241,10 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
        vault + "/root.txt", "made thumbnails 0xf of " + share_ + "/p1/"},
   };
   std::vector<std::string> entries;
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     const std::string folder = UserFolder(c.folder, kUserA);
     UserPhoto(folder + "/IMG.jpg", kUserA);
-    // The real directories above the link, as the owner would make them.
+    // The directories above the link, as the owner would make them.
     for (size_t slash = c.link.find('/'); slash != std::string::npos;
          slash = c.link.find('/', slash + 1)) {
       ASSERT_TRUE(
@@ -300,11 +256,23 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
   }
   ASSERT_EQ(symlink((share_ + "/m1").c_str(), (share_ + "/linked").c_str()), 0);
   entries.push_back(share_ + "/linked");
+  const std::string folder = UserFolder("u", kUserA);
+  const struct {
+    const char* name;
+    unsigned uid, mode, thumb_mode;  // 0: no thumbnail
+  } photos[] = {
+      {"own.jpg", kUserA, 0640, 0640},
+      {"private.jpg", kUserA, 0400, 0600},
+      {"others.jpg", kUserB, 0644, 0644},
+      {"root.jpg", 0, 0600, 0},
+  };
+  for (const auto& p : photos) UserPhoto(folder + "/" + p.name, p.uid, p.mode);
+  entries.push_back(folder);
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon)) << daemon.Errors();
   ASSERT_TRUE(Serve(daemon, entries)) << daemon.Errors();
   const std::string log = daemon.Errors();
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.folder);
     char target[4096] = {};
     const std::string link = share_ + "/" + c.folder + "/" + c.link;
@@ -321,55 +289,25 @@ TEST_F(ThumbDaemonTest, PlantedLinksAreNeitherFollowedNorRemoved) {
   EXPECT_EQ(ReadFile(bob + "/IMG.jpg"), "bob's");
   EXPECT_TRUE(NamesUnder(spare).empty());
   EXPECT_TRUE(Exists(ThumbItem(share_ + "/i1/IMG.jpg", "S")));
-}
-
-// The daemon reads a folder's photos as the folder's owner, so a root-only
-// photo among them gets no thumbnails (the refusal logged), although root
-// could read it; and each thumbnail gets its photo's owner, group and read
-// bits (plus the owner's write bit), whoever's photo it is.
-TEST_F(ThumbDaemonTest, ThumbnailsAreNoMoreReadableThanTheirPhotos) {
-  if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
-  const std::string folder = UserFolder("u", kUserA);
-  struct Case {
-    const char* name;
-    unsigned uid, mode;
-    unsigned thumb_mode;  // 0: no thumbnail
-  } cases[] = {
-      {"own.jpg", kUserA, 0640, 0640},
-      {"private.jpg", kUserA, 0400, 0600},
-      {"others.jpg", kUserB, 0644, 0644},
-      {"root.jpg", 0, 0600, 0},
-  };
-  for (const Case& c : cases) {
-    UserPhoto(folder + "/" + c.name, c.uid, c.mode);
-  }
-  DaemonProcess daemon;
-  ASSERT_TRUE(Start(daemon)) << daemon.Errors();
-  ASSERT_TRUE(Serve(daemon, {folder})) << daemon.Errors();
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.name);
+  for (const auto& p : photos) {
+    SCOPED_TRACE(p.name);
     struct stat st;
     const bool made =
-        lstat(ThumbItem(folder + "/" + c.name, "XL").c_str(), &st) == 0;
-    ASSERT_EQ(made, c.thumb_mode != 0);
+        lstat(ThumbItem(folder + "/" + p.name, "XL").c_str(), &st) == 0;
+    ASSERT_EQ(made, p.thumb_mode != 0);
     if (!made) continue;
-    EXPECT_EQ(st.st_uid, c.uid);
-    EXPECT_EQ(st.st_gid, c.uid);
-    EXPECT_EQ(st.st_mode & 07777, c.thumb_mode);
+    EXPECT_EQ(st.st_uid, p.uid);
+    EXPECT_EQ(st.st_gid, p.uid);
+    EXPECT_EQ(st.st_mode & 07777, p.thumb_mode);
   }
-  EXPECT_NE(
-      daemon.Errors().find("skipped " + folder +
-                           "/root.jpg: cannot open it: Permission denied"),
-      std::string::npos)
-      << daemon.Errors();
+  EXPECT_NE(log.find("skipped " + folder +
+                     "/root.jpg: cannot open it: Permission denied"),
+            std::string::npos)
+      << log;
 }
 
-// While the daemon works on a folder over and over, the folder's owner
-// swaps a photo's name with a link to a root-only photo, and another's with
-// a 196-megapixel photo, by rename-exchange (at most 20 million times or 15 s).
-// No thumbnail ever shows either: each photo is opened once, without
-// following a link, as the folder's owner, and its limits are checked on
-// the very bytes that are decoded.
+// Photos swapped with a link to a root-only photo and with a bomb while the
+// daemon works: no thumbnail ever shows either.
 TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to act for other users";
   constexpr Rgb kGreen = {20, 230, 20};
@@ -382,14 +320,11 @@ TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
   ASSERT_EQ(
       symlink((vault + "/secret.jpg").c_str(), (folder + "/q.jpg").c_str()), 0);
   ASSERT_TRUE(Own(folder + "/q.jpg", kUserA, kUserA, 0));
-  ASSERT_TRUE(quvaidx::daemon_test::WritePlainPhoto(folder + "/big.jpg", 14000,
-                                                    14000, kGreen));
+  ASSERT_TRUE(WritePlainPhoto(folder + "/big.jpg", 14000, 14000, kGreen));
   ASSERT_TRUE(Own(folder + "/big.jpg", kUserA, kUserA, 0644));
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon)) << daemon.Errors();
-
-  // The swapper works from a descriptor: the test's directory above is
-  // root's alone.
+  // The swapper works from a descriptor: the directory above is root's.
   const int at = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   ASSERT_GE(at, 0);
   const pid_t swapper = fork();
@@ -421,7 +356,7 @@ TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
       const std::string thumb = ThumbItem(folder + "/" + name, "M");
       if (!Exists(thumb)) continue;
       ++made;
-      leaked += !quvaidx::daemon_test::Near(ColourAt(thumb, 0.5, 0.5), kRed);
+      leaked += !Near(ColourAt(thumb, 0.5, 0.5), kRed);
     }
   }
   int status = 0;
@@ -432,3 +367,4 @@ TEST_F(ThumbDaemonTest, SwappedPhotosLeakNothingAndBombsStayOut) {
 }
 
 }  // namespace
+}  // namespace quvaidx::daemon_test

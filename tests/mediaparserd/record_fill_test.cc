@@ -13,11 +13,9 @@
 
 #include "media_test_util.h"
 
-namespace mediaparserd {
+namespace mediaparserd::test {
 namespace {
 
-using test::HostCodePage;
-using test::IsValidUTF8;
 using Type = StreamFacts::Type;
 using Encoding = TagText::Encoding;
 constexpr MediaKind kMusic = MediaKind::kMusic;
@@ -49,8 +47,7 @@ TagText UTF16(const std::u16string& text) {
       std::string(reinterpret_cast<const char*>(text.data()), 2 * text.size())};
 }
 
-// Checks the members of the record named in `expected`, a JSON object, as
-// their JSON texts: many fields in one line.
+// Checks the record's members named in the JSON object `expected`.
 void ExpectFields(__tag_QUVA_MEDIA_INFO r, const char* expected) {
   Json::Value all, want;
   MediaInfoObject2Json(r, all);
@@ -62,8 +59,7 @@ void ExpectFields(__tag_QUVA_MEDIA_INFO r, const char* expected) {
   }
 }
 
-// The record of "/music/Album X/01 song.mp3" (5 GiB) under the code page
-// UTF-8 unless a test sets another.
+// The record of "/music/Album X/01 song.mp3" (5 GiB), under UTF-8.
 class RecordFillTest : public ::testing::Test {
  protected:
   RecordFillTest() {
@@ -94,9 +90,8 @@ class RecordFillTest : public ::testing::Test {
 // A container is media when it has an audio or video stream, not a cover;
 // the image formats but GIF, APNG and ICO go by one container name.
 TEST_F(RecordFillTest, KindAndContainerNameComeFromTheStreams) {
-  struct Case {
-    const char* format;
-    const char* streams;
+  const struct {
+    const char *format, *streams;
     bool media;
     MediaKind kind;
     const char* name;  // szContainerType
@@ -114,22 +109,22 @@ TEST_F(RecordFillTest, KindAndContainerNameComeFromTheStreams) {
       {"png_pipe", "", false, kMusic, "image2"},
       {"mp3", "c", false, kMusic, "mp3"},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
+    SCOPED_TRACE(std::string(c.format) + " " + c.streams);
     MediaKind kind = kMusic;
-    EXPECT_EQ(ClassifyContainer(Container(c.format, c.streams), &kind), c.media)
-        << c.format;
+    EXPECT_EQ(ClassifyContainer(Container(c.format, c.streams), &kind),
+              c.media);
     if (c.media) {
-      EXPECT_EQ(kind, c.kind) << c.format << " " << c.streams;
+      EXPECT_EQ(kind, c.kind);
     }
-    EXPECT_EQ(ContainerTypeName(c.format), c.name);
     EXPECT_STREQ(Fill(c.media ? c.kind : kMusic, Container(c.format, ""))
                      .szContainerType,
                  c.name);
   }
 }
 
-// Numbers beyond their field are bounded to it, and names that are not
-// UTF-8 are left out: a record never holds a wrapped number or bad text.
+// Numbers beyond their field are bounded to it, names that are not UTF-8
+// left out: a record never holds a wrapped number or bad text.
 TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
   ContainerFacts container = Container("mp\xFF", "av");
   container.streams[1].codec = "";
@@ -196,8 +191,7 @@ TEST_F(RecordFillTest, ValuesTheFieldsCannotHoldAreBoundedOrLeftOut) {
 }
 
 // A song's only stream is what the container's rate measures; covers are
-// counted but are no picture of the song; without streams there are no
-// technical fields.
+// counted, no picture; without streams there are no technical fields.
 TEST_F(RecordFillTest, SongTakesTheContainerRateAndCountsItsCovers) {
   ContainerFacts container = Container("flac", "acc");
   container.bit_rate = 171960;
@@ -210,12 +204,8 @@ TEST_F(RecordFillTest, SongTakesTheContainerRateAndCountsItsCovers) {
       "audio_bitrate": 0, "szAudioCodec": "", "szTitle": ""})");
 }
 
-// UTF-16 of Latin letters has a zero in every code unit, and Cyrillic
-// UTF-16 holds only bytes below 0x80: without the byte-order mark the first
-// would arrive as one letter and the second be taken for UTF-8 full of
-// control characters, and emptied. Texts too long for their fields are cut
-// before the character that does not fit, UTF-16 ones at 125 code units
-// without splitting a surrogate pair.
+// UTF-16 is converted, not read as bytes; long texts are cut before the
+// character that does not fit, UTF-16 at 125 units without splitting a pair.
 TEST_F(RecordFillTest, TagTextsArriveAsUTF8CutAtCharacterBoundaries) {
   std::string cyrillic;
   for (int i = 0; i < 200; ++i) cyrillic += "ж";  // two bytes each
@@ -230,12 +220,9 @@ TEST_F(RecordFillTest, TagTextsArriveAsUTF8CutAtCharacterBoundaries) {
   tags.comment = UTF16(std::u16string(300, u'x'));
   tags.genre = {Encoding::kUTF8, cyrillic};
   __tag_QUVA_MEDIA_INFO r = Fill(tags);
-  EXPECT_STREQ(r.szTitle, "Hello");
-  EXPECT_STREQ(r.szArtist, "Привет");
-  EXPECT_STREQ(r.szAlbum, "\xF0\x9F\x98\x80 emoji");
-  EXPECT_STREQ(r.szAlbumArtist, "Zoë");
-  EXPECT_EQ(r.blTitleUTF16 + r.blArtistUTF16 + r.blAlbumUTF16, 3);
-  EXPECT_EQ(r.blGenreUTF16, 0);
+  ExpectFields(r, R"({"szTitle": "Hello", "szArtist": "Привет",
+      "szAlbum": "\ud83d\ude00 emoji", "szAlbumArtist": "Zoë", "blTitleUTF16": 1,
+      "blArtistUTF16": 1, "blAlbumUTF16": 1, "blGenreUTF16": 0})");
   EXPECT_TRUE(IsValidUTF8(r.szComposer));
   EXPECT_EQ(strlen(r.szComposer), 62u * 4);  // 125 units: 62 pairs, no lead
   EXPECT_EQ(std::string(r.szComment), std::string(125, 'x'));
@@ -246,44 +233,36 @@ TEST_F(RecordFillTest, TagTextsArriveAsUTF8CutAtCharacterBoundaries) {
   r = Fill(tags);
   EXPECT_EQ(strlen(r.szAlbumArtist), 253u);
   EXPECT_TRUE(IsValidUTF8(r.szAlbumArtist));
-  EXPECT_STREQ(r.szTitle, "ab");
-  EXPECT_EQ(r.blTitleUTF16, 1);
-  EXPECT_EQ(r.blArtistUTF16, 0);  // empty texts stay unflagged
+  // Empty texts stay unflagged.
+  ExpectFields(r,
+               R"({"szTitle": "ab", "blTitleUTF16": 1, "blArtistUTF16": 0})");
   PhotoFacts photo;
   photo.model = cyrillic;
   EXPECT_EQ(strlen(Fill(photo).szModel), 98u);
 }
 
-// Tag bytes of no declared encoding are decoded in the host's code page; a
-// text too long for its field is cut where a character of that code page
-// ends: cut inside one, the whole text would not convert.
+// Undeclared tag bytes are decoded in the host's code page, a long text cut
+// where a character ends (cut inside one, none of it would convert).
 TEST_F(RecordFillTest, LegacyTagBytesAreReadInTheHostCodePage) {
   const std::string cp1251_hello = "\xCF\xF0\xE8\xE2\xE5\xF2";  // Привет
   const std::string gbk_hello = "\xC4\xE3\xBA\xC3";             // 你好
-  struct Case {
-    const char* code_page;
-    std::string bytes;
-    const char* title;         // szTitle after MediaInfoValid
-    const char* album_artist;  // cleaned apart from MediaInfoValid
-  } cases[] = {
-      {"windows-1251", cp1251_hello, "Привет", "Привет"},
-      {"windows-936", gbk_hello, "你好", "你好"},
-      // Not valid in the code page: the title falls back to the file's
-      // name, the album artist is emptied; no invalid UTF-8 either way.
-      {"UTF-8", cp1251_hello, "01 song", ""},
-      {"UTF-8", "plain ASCII", "plain ASCII", "plain ASCII"},
-  };
-  for (const Case& c : cases) {
-    HostCodePage host(c.code_page);
+  // code page, bytes, title (after MediaInfoValid), album artist: what is
+  // not valid in the code page makes the title the file's name.
+  const std::tuple<const char*, std::string, const char*, const char*> cases[] =
+      {{"windows-1251", cp1251_hello, "Привет", "Привет"},
+       {"windows-936", gbk_hello, "你好", "你好"},
+       {"UTF-8", cp1251_hello, "01 song", ""},
+       {"UTF-8", "plain ASCII", "plain ASCII", "plain ASCII"}};
+  for (const auto& [code_page, bytes, title, album_artist] : cases) {
+    HostCodePage host(code_page);
     MusicTags tags;
-    tags.title = tags.album_artist = {Encoding::kBytes, c.bytes};
+    tags.title = tags.album_artist = {Encoding::kBytes, bytes};
     __tag_QUVA_MEDIA_INFO r = Fill(tags);
-    EXPECT_STREQ(r.szTitle, c.title) << c.code_page;
-    EXPECT_STREQ(r.szAlbumArtist, c.album_artist) << c.code_page;
+    EXPECT_STREQ(r.szTitle, title) << code_page;
+    EXPECT_STREQ(r.szAlbumArtist, album_artist) << code_page;
     EXPECT_EQ(r.blTitleUTF16, 0);
   }
-  // Shift-JIS leads 0x81-0x9F and 0xE0-0xFC; GBK, Big5 and Korean
-  // 0x81-0xFE; each text is one byte too long for a whole last character.
+  // Lead bytes of each code page; one byte too long for a last character.
   const std::tuple<const char*, std::string, const char*> long_texts[] = {
       {"windows-936", "\xC4\xE3", "你"},
       {"windows-31j", "\x93\xFA", "日"},
@@ -325,30 +304,27 @@ TEST_F(RecordFillTest, ContainerTagsGiveTextsAndLeadingNumbers) {
   EXPECT_EQ(Fill(kVideo, container).year, 0);
 }
 
-// Exposure and aperture as photographers write them; nonsense gives none.
-TEST_F(RecordFillTest, ExposureAndApertureReadAsPhotographersWriteThem) {
-  struct Case {
-    int64_t exposure_num, exposure_den;
-    const char* exposure;
-    int64_t f_num, f_den;
-    const char* aperture;
-  } cases[] = {
-      {1, 125, "1/125", 28, 10, "2.8"}, {10, 2500, "1/250", 4, 1, "4.0"},
-      {1, 4, "1/4", 95, 100, "0.95"},   {3, 10, "0.3", 0, 1, ""},
-      {25, 10, "2.5", 1, 0, ""},        {30, 1, "30", -28, 10, ""},
-      {0, 1, "", kMax64, 1, ""},        {-1, 100, "", 28, -10, ""},
-      {kMax64, 1, "", 1, 1, "1.0"},     {1, kMax64, "", 10, 1, "10.0"},
-      {1, 0, "", 1, 2, "0.50"}};
-  for (const Case& c : cases) {
+// Exposure, aperture and dates as photographers write them; nonsense gives
+// none.
+TEST_F(RecordFillTest, PhotoFieldsAreReadAsPhotographersWriteThem) {
+  const std::tuple<int64_t, int64_t, const char*, int64_t, int64_t, const char*>
+      cases[] = {
+          {1, 125, "1/125", 28, 10, "2.8"}, {10, 2500, "1/250", 4, 1, "4.0"},
+          {1, 4, "1/4", 95, 100, "0.95"},   {3, 10, "0.3", 0, 1, ""},
+          {25, 10, "2.5", 1, 0, ""},        {30, 1, "30", -28, 10, ""},
+          {0, 1, "", kMax64, 1, ""},        {-1, 100, "", 28, -10, ""},
+          {kMax64, 1, "", 1, 1, "1.0"},     {1, kMax64, "", 10, 1, "10.0"},
+          {1, 0, "", 1, 2, "0.50"}};
+  for (const auto& [exposure_num, exposure_den, exposure, f_num, f_den,
+                    aperture] : cases) {
     PhotoFacts photo;
-    photo.exposure_num = c.exposure_num;
-    photo.exposure_den = c.exposure_den;
-    photo.fnumber_num = c.f_num;
-    photo.fnumber_den = c.f_den;
-    __tag_QUVA_MEDIA_INFO r = Fill(photo);
-    EXPECT_STREQ(r.szExposure, c.exposure)
-        << c.exposure_num << "/" << c.exposure_den;
-    EXPECT_STREQ(r.szAperture, c.aperture) << c.f_num << "/" << c.f_den;
+    photo.exposure_num = exposure_num;
+    photo.exposure_den = exposure_den;
+    photo.fnumber_num = f_num;
+    photo.fnumber_den = f_den;
+    EXPECT_STREQ(Fill(photo).szExposure, exposure)
+        << exposure_num << "/" << exposure_den;
+    EXPECT_STREQ(Fill(photo).szAperture, aperture) << f_num << "/" << f_den;
   }
   // Only a whole EXIF date and time is a taken time; blank dates are none.
   const std::pair<const char*, const char*> dates[] = {
@@ -364,12 +340,8 @@ TEST_F(RecordFillTest, ExposureAndApertureReadAsPhotographersWriteThem) {
     photo.taken = exif;
     EXPECT_STREQ(Fill(photo).szTakenTime, taken) << exif;
   }
-}
-
-// Camera names lose their padding and are read in the host's code page;
-// negative sizes and ISO are none. A photo without a size of its own takes
-// its picture stream's, and has no duration and no video codec.
-TEST_F(RecordFillTest, PhotoFieldsAreCleanAndSized) {
+  // Camera names unpadded, in the host's code page; negative sizes and ISO
+  // none; a photo without a size takes its stream's, no duration or codec.
   HostCodePage host("windows-1251");
   PhotoFacts photo;
   photo.make = std::string("Canon\0\0", 7) + "   ";
@@ -426,4 +398,4 @@ TEST_F(RecordFillTest, VideoMetadataIsAQuarterTurnAndAReducedAspect) {
 }
 
 }  // namespace
-}  // namespace mediaparserd
+}  // namespace mediaparserd::test
