@@ -54,26 +54,6 @@ std::string RandomSuffix() {
 
 }  // namespace
 
-std::string WriteAtomically(const std::string& path,
-                            const std::string& temp_suffix, const void* data,
-                            size_t length, mode_t mode, bool sync,
-                            const std::string& what) {
-  std::string temp = path + temp_suffix + "XXXXXX";
-  int fd = mkostemp(&temp[0], O_CLOEXEC);
-  if (fd < 0) return std::string("cannot create a file: ") + strerror(errno);
-  int err = WriteAll(fd, data, length);
-  // mkstemp makes the file private; the caller says how readable it is.
-  if (err == 0 && fchmod(fd, mode) != 0) err = errno;
-  if (err == 0 && sync && fsync(fd) != 0) err = errno;
-  if (close(fd) != 0 && err == 0) err = errno;
-  if (err == 0 && rename(temp.c_str(), path.c_str()) != 0) err = errno;
-  if (err != 0) {
-    unlink(temp.c_str());
-    return "cannot write " + what + ": " + strerror(err);
-  }
-  return "";
-}
-
 std::string WriteAtomicallyAt(int dir_fd, const std::string& name,
                               const std::string& temp_suffix, const void* data,
                               size_t length, const PrepareFile& prepare,

@@ -1,10 +1,9 @@
 // Files that readers see whole or not at all, for the reference daemons.
 //
-// Both writers put the bytes in a temporary file beside the target and
-// rename it over the target, so that a reader sees the old file or the
-// whole new one, never a part. WriteAtomicallyAt works entirely relative to
-// an open directory: it never resolves a path, so a symbolic link planted
-// in a folder a user can write is never followed.
+// The bytes go to a temporary file beside the target, renamed over the
+// target, so that a reader sees the old file or the whole new one, never a
+// part. All works relative to an open directory: no path is resolved, so a
+// symbolic link planted in a folder a user can write is never followed.
 #ifndef QUVAIDX_DAEMONS_COMMON_ATOMIC_FILE_H_
 #define QUVAIDX_DAEMONS_COMMON_ATOMIC_FILE_H_
 
@@ -15,17 +14,6 @@
 #include <string>
 
 namespace quvaidx_daemons {
-
-// Writes the `length` bytes of `data` to `path` through a temporary file
-// beside it (`path`, `temp_suffix` and six random characters), gives it
-// `mode`, syncs it when `sync`, and renames it over `path`: a reader sees
-// the old file or the whole new one. Returns "", or what failed: "cannot
-// create a file: REASON" or "cannot write WHAT: REASON", with no temporary
-// file left behind.
-std::string WriteAtomically(const std::string& path,
-                            const std::string& temp_suffix, const void* data,
-                            size_t length, mode_t mode, bool sync,
-                            const std::string& what);
 
 // Prepares the written temporary file, open as `fd`, before it is renamed
 // into place (its owner and mode, say). Returns "" or what failed.

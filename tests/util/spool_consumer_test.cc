@@ -182,6 +182,7 @@ TEST_F(SpoolConsumerTest, MissingQueueIsEmptyAndOddFilesAreRefused) {
 // a requeue makes is never executable.
 TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
   const std::string overlong(kMaxQueueEntry + 1, 'y');
+  const std::string longest(kMaxQueueEntry, 'x');
   const std::string foreign =
       "\n" + overlong + std::string("\n\n/nul\0\n/a\n", 11);
   // text, done, requeued, removed, entries after
@@ -193,7 +194,11 @@ TEST_F(SpoolConsumerTest, RemovesOnlyTheNamedHeadEntries) {
       {foreign, {"", ""}, {}, 2, "/a\n"},       // foreign lines removed as read
       {"\n\n/a\n\n/b\n", {"/a", "/b"}, {}, 2, ""},  // blank lines: no entries
       {"/a\n/b\n", {"/a"}, {"/a"}, 1, "/b\n/a\n"},  // requeue to the tail
-      {"/a\n", {"/a"}, {"", "two\nlines", overlong, "/ok"}, 1, "/ok\n"},
+      {"/a\n",
+       {"/a"},
+       {"", "two\nlines", overlong, longest, "/ok"},
+       1,
+       longest + "\n/ok\n"},
       {"/a\n", {}, {}, 0, "/a\n"},
   };
   for (const auto& [content, done, requeue, removed, live] : cases) {
