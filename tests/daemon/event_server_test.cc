@@ -23,6 +23,8 @@
 #include <tuple>
 #include <vector>
 
+#include <event2/buffer.h>
+#include <event2/bufferevent.h>
 #include <event2/event.h>
 #include <gtest/gtest.h>
 
@@ -803,3 +805,55 @@ TEST_F(DeferredReplyTest, MisusesAreRefusedAndNullOrHugeRepliesHandled) {
 }
 
 }  // namespace
+
+// The packet functions a daemon may use on connections of its own: a packet
+// is whole only once all its announced bytes are there (nothing is taken
+// while waiting), exactly one is taken at a time, a body the reader rejects
+// leaves the destination alone, and a reply is queued as one whole packet.
+TEST(BuffereventPacketTest, CheckTakeAndQueueOnePacketAtATime) {
+  struct event_base* base = event_base_new();
+  struct bufferevent* pair[2];
+  ASSERT_EQ(bufferevent_pair_new(base, 0, pair), 0);
+  struct bufferevent* bev = pair[1];  // what pair[0] writes, bev reads
+  bufferevent_enable(bev, EV_READ);
+  struct evbuffer* input = bufferevent_get_input(bev);
+  auto add = [&](const std::string& bytes) {
+    bufferevent_write(pair[0], bytes.data(), bytes.size());
+  };
+  LogCapture log(6);
+  const std::string first = Packet("{\"n\":1}\n");
+  add(first.substr(0, 3));
+  EXPECT_EQ(CheckBufferevent(bev), 0);
+  add(first.substr(3, 3));
+  EXPECT_EQ(CheckBufferevent(bev), 0);
+  add(first.substr(6) + Packet("{bad") + Packet("{\"n\":2}"));
+  EXPECT_EQ(CheckBufferevent(bev), 1);
+  EXPECT_EQ(log.Normalized(),
+            (Lines{"quvaidx_daemon:N bufferevent at least 4 bytes [3 bytes]",
+                   "quvaidx_daemon:N bufferevent hasn't arrived completely, "
+                   "and wait [arrived=6, total=12]"}));
+  Json::Value value(7);
+  for (int expected : {1, 1, 2}) {  // the rejected body changes nothing
+    ASSERT_EQ(RecvPacketEv(bev, value), 0);
+    EXPECT_EQ(value.get("n", 0), expected);
+  }
+  EXPECT_EQ(evbuffer_get_length(input), 0u);
+  add(std::string("\x15\xbe\x00\x05{}", 6));  // fewer bytes than announced
+  EXPECT_EQ(RecvPacketEv(bev, value), -1);
+  add(std::string("\x15\xbe\xff\xff", 4));  // more than a packet carries
+  EXPECT_EQ(RecvPacketEv(bev, value), -1);
+
+  Json::Value reply = MakeResponse(true, nullptr);
+  EXPECT_EQ(SendPacketEv(bev, reply), 0);
+  Json::Value huge;
+  huge["blob"] = std::string(kMaxSendBody, 'b');
+  EXPECT_EQ(SendPacketEv(bev, huge), -1);
+  bufferevent_enable(pair[0], EV_READ);
+  event_base_loop(base, EVLOOP_NONBLOCK);
+  char queued[64] = {};
+  const size_t n = bufferevent_read(pair[0], queued, sizeof queued);
+  EXPECT_EQ(std::string(queued, n), Packet(kSuccess));  // and nothing more
+  bufferevent_free(pair[0]);
+  bufferevent_free(bev);
+  event_base_free(base);
+}

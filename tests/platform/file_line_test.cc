@@ -101,7 +101,7 @@ TEST(SectionValueTest, ValuesAndBounds) {
   WriteFile(dir.File("map"),
             "top = before any section\n[video]\n  spaced   =   inner value  \n"
             "quoted = \"  kept  \"\ncrlf = yes\r\nnovalue\n[ music ]\n"
-            "guid = 99\n[video]\nlate = ignored\n");
+            "guid = 99\n[no end\nafter = x\n[video]\nlate = ignored\n");
   const struct {
     const char *section, *key;
     int size, result;
@@ -110,6 +110,7 @@ TEST(SectionValueTest, ValuesAndBounds) {
                {"video", "quoted", 256, 8, "  kept  "},
                {"video", "crlf", 256, 3, "yes"},
                {"music", "guid", 256, 2, "99"},
+               {"music", "after", 256, 1, "x"},  // "[no end" is no section
                {"video", "late", 256, -1, "untouched"},  // a repeated section
                {"video", "novalue", 256, -1, "untouched"},
                {"video", "spaced", 12, 11, "inner value"},
