@@ -201,14 +201,16 @@ TEST_F(MediaValidTest, FailedConversionsFallBackOrEmpty) {
   EXPECT_STREQ(r.szAlbumArtist, "\xE9t\xE9");
   EXPECT_EQ(host_.Calls(HostOp::kUnicodeStrCPToUTF8), 5);
   const std::string cjk = kCjk.substr(0, 300);
-  const std::string cut = cjk.substr(0, 252);  // whole characters only
+  const std::string cut = cjk.substr(0, 252);        // whole characters only
+  const std::string a254(254, 'a'), t255(255, 't');  // a field holds 254
   const std::tuple<std::string, std::string, std::string> cases[] = {
       {"/music/A/.hidden", "", "A"},
       {"/m/A/a.b.mp3", "a.b", "A"},
       {"/m/A/track", "track", "A"},
       {"song.mp3", "", ""},
       {"A/song.mp3", "song", ""},
-      {"/m/" + cjk + "/" + cjk + ".mp3", cut, cut}};
+      {"/m/" + cjk + "/" + cjk + ".mp3", cut, cut},
+      {"/m/" + a254 + "/" + t255 + ".mp3", t255.substr(1), a254}};
   for (const auto& [path, title, album] : cases) {
     r = CleanRecord(path.c_str());
     strcpy(r.szTitle, "\xE9");
