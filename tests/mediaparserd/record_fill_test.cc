@@ -364,6 +364,40 @@ TEST_F(RecordFillTest, PhotoFieldsAreReadAsPhotographersWriteThem) {
                R"({"resolutionX": 3, "szMake": ""})");
 }
 
+// A name the libraries give reaches the record only as strict UTF-8: the
+// edges of each sequence length pass; overlong forms, surrogates, code
+// points past U+10FFFF, stray or missing continuation bytes leave it out.
+TEST_F(RecordFillTest, LibraryNamesPassOnlyAsStrictUTF8) {
+  const std::pair<const char*, bool> names[] = {{"\xC2\x80", true},
+                                                {"\xDF\xBF", true},
+                                                {"\xE0\xA0\x80", true},
+                                                {"\xED\x9F\xBF", true},
+                                                {"\xEE\x80\x80", true},
+                                                {"\xEF\xBF\xBF", true},
+                                                {"\xF0\x90\x80\x80", true},
+                                                {"\xF4\x8F\xBF\xBF", true},
+                                                {"\xC1\xBF", false},
+                                                {"\xE0\x9F\xBF", false},
+                                                {"\xED\xA0\x80", false},
+                                                {"\xF0\x8F\xBF\xBF", false},
+                                                {"\xF4\x90\x80\x80", false},
+                                                {"\xF5\x80\x80\x80", false},
+                                                {"\x80", false},
+                                                {"\xC2", false},
+                                                {"\xE0\xA0", false},
+                                                {"\xC2\xC0", false}};
+  for (const auto& [name, valid] : names) {
+    ContainerFacts container = Container("matroska,webm", "v");
+    container.streams[0].codec = std::string("x") + name + "y";
+    EXPECT_STREQ(Fill(kVideo, container).szVideoCodec,
+                 valid ? container.streams[0].codec.c_str() : "")
+        << container.streams[0].codec;
+  }
+  ContainerFacts cut = Container("matroska,webm", "v");
+  cut.streams[0].codec = "x\xE0\xA0";  // ends inside a character
+  EXPECT_STREQ(Fill(kVideo, cut).szVideoCodec, "");
+}
+
 // The rotation is the clockwise quarter turn nearest the display matrix's
 // turn, the pixel aspect reduced; both are neutral when unknown.
 TEST_F(RecordFillTest, VideoMetadataIsAQuarterTurnAndAReducedAspect) {
