@@ -292,7 +292,7 @@ TEST_F(SpoolConsumerTest, FinishedEntryIsBlankedInPlaceAndCanBeQueuedAgain) {
 
 // The side file is a hint that anyone may damage, and a queue may be cut
 // and refilled in place: whatever it says, no entry is skipped. A head far
-// into the queue is remembered for the next call.
+// into the queue is remembered, and the next call starts there.
 TEST_F(SpoolConsumerTest, SideFileNeverMakesEntriesSkipped) {
   const std::string blank(70000, '\n');
   WriteFile(queue_, blank + "/a\n/b\n");
@@ -300,6 +300,11 @@ TEST_F(SpoolConsumerTest, SideFileNeverMakesEntriesSkipped) {
   quvaidx::QueueState remembered;
   ASSERT_TRUE(quvaidx::LoadQueueState(q_, &remembered));
   EXPECT_EQ(remembered.head, static_cast<int64_t>(blank.size()));
+  {  // and used: a line written into the blank head (no writer does) is
+     // not read again
+    std::fstream(queue_, std::ios::in | std::ios::out).seekp(100) << "/z";
+  }
+  EXPECT_EQ(All(), (Strings{"/a", "/b"}));
   const std::string real = PhotoQueue(40);  // 2,600 bytes of entries
   auto record = [&](int64_t head) {
     quvaidx::QueueState state = remembered;
