@@ -24,6 +24,7 @@
 #include "support/fake_host.h"
 #include "support/fd_check.h"
 #include "support/log_capture.h"
+#include "support/unprivileged.h"
 
 namespace {
 
@@ -310,7 +311,8 @@ TEST(EADirWalk, PlantedEntriesAreRefusedOrReplacedNeverFollowed) {
 }
 
 // The walk starts at the descriptor: the folder's path in file_path is not
-// opened then. Made directories take 0777 less the umask.
+// opened then. Made directories take 0777 less the umask. Descriptor 0 is
+// a descriptor like any other.
 TEST(EADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
   TempDir dir;
   const int folder = open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
@@ -327,6 +329,14 @@ TEST(EADirWalk, StartsAtTheGivenFolderAndMakesDirectoriesUnderTheUmask) {
     EXPECT_EQ(0750u, st.st_mode & 07777) << made;
   }
   EXPECT_EQ(ENOENT, OpenErrno("/no-such-folder/a.jpg", -1));
+  // In a daemon whose standard input is closed, a directory may be fd 0.
+  const std::string photo = dir.File("b.jpg");
+  EXPECT_EQ(quvaidx::test::RunInChildProcess([&] {
+              close(0);
+              const int fd = OpenEADir(photo.c_str(), -1, 1);
+              return fd == 0 ? 0 : 1;
+            }),
+            0);
 }
 
 // What the host answers for every file, set per case.
