@@ -344,8 +344,14 @@ TEST(ForkExecvTest, ChildOnDevNullMissingProgramAbortsNoChildWaitKept) {
       out;
   char* argv[] = {const_cast<char*>("sh"), const_cast<char*>("-c"),
                   const_cast<char*>(script.c_str()), nullptr};
-  EXPECT_EQ(ExitStatus(ForkExecv("/bin/sh", argv)), 0);
-  EXPECT_EQ(ReadFile(out), "/dev/null /dev/null /dev/null ");
+  for (bool stdin_closed : {false, true}) {  // then /dev/null opens as 0
+    EXPECT_EQ(quvaidx::test::RunInChildProcess([&] {
+                if (stdin_closed) close(0);
+                return ExitStatus(ForkExecv("/bin/sh", argv));
+              }),
+              0);
+    EXPECT_EQ(ReadFile(out), "/dev/null /dev/null /dev/null ");
+  }
   argv[1] = nullptr;
   int status = 0, pid = ForkExecv("/nonexistent/program", argv);
   ASSERT_GT(pid, 0);
