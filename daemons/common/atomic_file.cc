@@ -71,7 +71,7 @@ std::string WriteAtomicallyAt(int dir_fd, const std::string& name,
                 O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
     if (fd < 0 && errno != EEXIST) break;
   }
-  if (fd < 0) return std::string("cannot create a file: ") + strerror(errno);
+  if (fd < 0) return "cannot create " + what + ": " + strerror(errno);
   int err = WriteAll(fd, data, length);
   std::string problem;
   if (err == 0 && prepare) problem = prepare(fd);

@@ -26,7 +26,7 @@ using PrepareFile = std::function<std::string(int fd)>;
 // it over `name` with renameat. Nothing is ever resolved through a link.
 // A symbolic link that stands at `name` is left alone and nothing is
 // written: the caller's entry is refused, not replaced.
-// Returns "", or what failed: "cannot create a file: REASON", "cannot
+// Returns "", or what failed: "cannot create WHAT: REASON", "cannot
 // write WHAT: REASON" or "cannot write WHAT: a symbolic link is in its
 // place", with no temporary file left behind.
 std::string WriteAtomicallyAt(int dir_fd, const std::string& name,

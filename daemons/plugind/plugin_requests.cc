@@ -14,7 +14,6 @@
 #include <stdio.h>
 #include <string.h>
 #include <strings.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -31,6 +30,7 @@
 #include <quvaidx/path_rules.h>
 #include <quvaidx/system.h>
 
+#include "atomic_file.h"
 #include "media_parser_query.h"
 #include "preview_names.h"
 
@@ -339,45 +339,6 @@ Json::Value CleanRecord(const Json::Value& value, __tag_QUVA_MEDIA_INFO* out) {
   return clean;
 }
 
-// Writes `text` to the entry `name` of the directory `dir_fd` through a
-// temporary file created beside it (never through a link) and renamed into
-// place. Returns "" or what failed, with no temporary file left.
-std::string WriteRecordAt(int dir_fd, const std::string& name,
-                          const std::string& text, mode_t mode) {
-  std::string temp;
-  int fd = -1;
-  for (int attempt = 0; fd < 0 && attempt < 8; ++attempt) {
-    unsigned char random[6];
-    if (getrandom(random, sizeof(random), 0) != sizeof(random)) break;
-    char suffix[16];
-    snprintf(suffix, sizeof(suffix), "%02x%02x%02x%02x%02x%02x", random[0],
-             random[1], random[2], random[3], random[4], random[5]);
-    temp = name + ".part-" + suffix;
-    fd = openat(dir_fd, temp.c_str(),
-                O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
-    if (fd < 0 && errno != EEXIST) break;
-  }
-  if (fd < 0)
-    return std::string("cannot create the record: ") + strerror(errno);
-  int err = 0;
-  for (size_t done = 0; err == 0 && done < text.size();) {
-    ssize_t wrote = write(fd, text.data() + done, text.size() - done);
-    if (wrote < 0 && errno == EINTR) continue;  // Retry
-    if (wrote < 0) err = errno;
-    if (wrote > 0) done += static_cast<size_t>(wrote);
-  }
-  if (err == 0 && fsync(fd) != 0) err = errno;
-  if (close(fd) != 0 && err == 0) err = errno;
-  if (err == 0 && renameat(dir_fd, temp.c_str(), dir_fd, name.c_str()) != 0) {
-    err = errno;
-  }
-  if (err != 0) {
-    unlinkat(dir_fd, temp.c_str(), 0);  // ours, made just now
-    return std::string("cannot write the record: ") + strerror(err);
-  }
-  return "";
-}
-
 // The EA directory of `video` as the peer reaches it, without a link at the
 // metadata directory or below: the descriptor, or -1 with *reason set.
 int VideoEADir(const std::string& video, std::string* reason) {
@@ -455,8 +416,13 @@ int ConvertAdd(const quvaidx_daemons::FsUser& peer, const Json::Value& request,
   }
   const std::string text = record.toStyledString();
   // Readable as the copy is, no more.
-  problem = WriteRecordAt(ea_dir.get(), name + ".json", text,
-                          S_IRUSR | S_IWUSR | (item.st_mode & 0044));
+  const mode_t mode = S_IRUSR | S_IWUSR | (item.st_mode & 0044);
+  problem = quvaidx_daemons::WriteAtomicallyAt(
+      ea_dir.get(), name + ".json", ".part-", text.data(), text.size(),
+      [mode](int fd) {
+        return fchmod(fd, mode) == 0 ? "" : std::string(strerror(errno));
+      },
+      true, "the record");
   if (!problem.empty()) return Fail(reply, problem);
   *reply = MakeResponse(true, nullptr);
   (*reply)["record"] = copy + ".json";
