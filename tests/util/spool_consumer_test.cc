@@ -5,6 +5,7 @@
 #include <stdio.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -354,6 +355,13 @@ TEST_F(SpoolConsumerTest, CompactionKeepsEntriesOwnerAndModeLeavesNoCopy) {
   EXPECT_EQ(after.st_mode & 07777, 0664u);
   EXPECT_EQ(Copies(dir_.path()), 0);
   EXPECT_EQ(All().front(), "/share/Photos/album-024000/2015-summer-024000");
+  // A copy that cannot be written (a full disk) never takes the queue's
+  // place: every live entry stays.
+  WriteFile(queue_, PhotoQueue(36000));
+  quvaidx::test::RunWithSyscallsFailing(
+      {{SYS_write, ENOSPC}}, [&] { return TrimQueueHead(q_, 24000); });
+  EXPECT_TRUE(SameText(Live(ReadFile(queue_)), PhotoQueue(12000, 24000)));
+  EXPECT_EQ(Copies(dir_.path()), 0);
 }
 
 // A consumer killed at any moment of blanking and compacting loses and
