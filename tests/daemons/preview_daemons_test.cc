@@ -105,7 +105,8 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon, "500")) << daemon.Errors();
   for (const std::string& entry :
-       {share_, share_ + "/deleted-while-queued", dir_.File("outside")}) {
+       {share_, share_ + "/deleted-while-queued", dir_.File("outside"),
+        std::string("relative/folder")}) {
     ASSERT_EQ(WriteIndexQueue(entry.c_str(), queue_.c_str()), 0);
   }
   usleep(200 * 1000);
@@ -122,6 +123,7 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
            "bomb.png: 30000 x 30000 pixels",
            "deleted-while-queued': No such file",
            "outside': outside every share",
+           "'relative/folder': not an absolute path",
            "skipped " + doomed + ": it is gone",
            "skipped " + fifo + ": not a regular file"}) {
     EXPECT_NE(log.find(skipped), std::string::npos) << skipped << "\n" << log;
