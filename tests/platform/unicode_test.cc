@@ -111,6 +111,7 @@ TEST(CodePageConversionTest, TextsAndBounds) {
                {0, "\xC0\x80", 255, -1, "untouched", EILSEQ},  // overlong
                {11, "\x93", 255, -1, "untouched", EILSEQ},     // cut Shift_JIS
                {99, "abc", 255, -1, "untouched", EINVAL},
+               {1, "abc", 0, -1, "untouched", EINVAL},  // no room at all
                {1, "", 255, 0, "", 0},
                {1, "\xE9\xE9\xE9", 4, 2, "é", 0},
                {1, aaaa.c_str(), 8, 7, "aaaaaaa", 0},
