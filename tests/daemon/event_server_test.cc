@@ -388,6 +388,12 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
     if (result == 0) StopServer(path.c_str());
   }
   close(live);
+  LogCapture log;  // nowhere to bind
+  const std::string nowhere = dir_.File("none/d.sock");
+  EXPECT_EQ(BuildServer(base_, nowhere.c_str(), &args_), -1);
+  EXPECT_EQ(errno, ENOENT);
+  EXPECT_EQ(log.Normalized(), Lines{kError + "Could not create a listener: " +
+                                    nowhere + " (No such file or directory)"});
 }
 
 // A socket handed over is served only when it is a listening Unix stream
