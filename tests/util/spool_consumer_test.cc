@@ -15,6 +15,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <random>
 #include <regex>
@@ -330,6 +331,30 @@ TEST_F(SpoolConsumerTest, SideFileNeverMakesEntriesSkipped) {
     ASSERT_EQ(all.size(), 40u);
     EXPECT_EQ(all.front(), "/share/Photos/album-000000/2015-summer-000000");
     EXPECT_EQ(Remove({all.front()}), 1);
+  }
+}
+
+// A disk that fails a read, an append, a blanking or the bookkeeping makes
+// the call fail, and the queue keeps every entry it had.
+TEST_F(SpoolConsumerTest, DiskFailuresFailTheCallAndLoseNoEntry) {
+  const std::tuple<long, int, std::function<int()>> cases[] = {
+      {SYS_pread64, EIO,
+       [&] {
+         Json::Value entries;
+         return ReadQueueHead(q_, 4, entries);
+       }},
+      {SYS_write, ENOSPC, [&] { return Remove({"/a"}, {"/c"}); }},
+      {SYS_pwrite64, EIO, [&] { return Remove({"/a"}); }},
+      {SYS_pwrite64, EIO, [&] { return TrimQueueHead(q_, 1); }},
+      {SYS_pwrite64, ENOSPC, [&] { return CountQueueAttempt(q_, "/a"); }},
+  };
+  for (const auto& [call, error, operation] : cases) {
+    SCOPED_TRACE(call);
+    WriteFile(queue_, "/a\n/b\n");
+    EXPECT_EQ(quvaidx::test::RunWithSyscallsFailing(
+                  {{call, error}}, [&] { return operation() == -1 ? 0 : 1; }),
+              0);
+    EXPECT_EQ(ReadFile(queue_), "/a\n/b\n");
   }
 }
 
