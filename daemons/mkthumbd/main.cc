@@ -49,7 +49,9 @@ void OnWork(evutil_socket_t, short, void* arg) {
   using Did = mkthumbd::ThumbWorker::Did;
   Did did = daemon->worker->Step();
   if (did == Did::kNothing) {
-    daemon->working = false;  // asleep until SIGUSR1
+    daemon->working = false;
+    AppLogError(6, "%s:%d queue empty: asleep until SIGUSR1", kProgram,
+                __LINE__);
     return;
   }
   Schedule(daemon, did == Did::kPhoto ? daemon->throttle_ms : 0);

@@ -104,6 +104,9 @@ TEST_F(ThumbDaemonTest, WakesOnSigusr1AndSkipsBadPhotosWithoutStopping) {
   ASSERT_EQ(mkdir(dir_.File("outside").c_str(), 0755), 0);
   DaemonProcess daemon;
   ASSERT_TRUE(Start(daemon, "500")) << daemon.Errors();
+  ASSERT_TRUE(WaitUntil(10, [&] {  // done with what was queued before
+    return daemon.Errors().find("asleep until SIGUSR1") != std::string::npos;
+  }));
   for (const std::string& entry :
        {share_, share_ + "/deleted-while-queued", dir_.File("outside"),
         std::string("relative/folder")}) {
