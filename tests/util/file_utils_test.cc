@@ -36,6 +36,7 @@ int EntriesIn(const std::string& dir) {
 
 class FileTest : public ::testing::Test {
  protected:
+  int Rename() { return RenameFile(source_.c_str(), destination_.c_str()); }
   quvaidx::test::TempDir dir_;
   std::string source_ = dir_.File("source");
   std::string destination_ = dir_.File("destination");
@@ -61,27 +62,25 @@ TEST_F(FileTest, RealPathResolvesOrKeepsThePath) {
   EXPECT_EQ(log.Count("quvaidx_system:N [Error] GetRealPath: (null)"), 1);
 }
 
-// The source moves unless the destination exists, also when the existence
-// test cannot see it (a dangling link, like one created just after it). A
-// missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries, each followed
-// by a yield through the sleep seam.
+// Never over a destination, even a dangling link the existence test misses.
+// A missing source fails quietly, a missing folder at once, a persistent
+// failure (a folder into itself) after sixteen tries, each with a yield.
 TEST_F(FileTest, RenameNeverReplacesTheDestination) {
   LogCapture log;
   quvaidx::test::FakeSleep sleep;
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
+  EXPECT_EQ(Rename(), -1);
   EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(destination_), "s");
   EXPECT_NE(access(source_.c_str(), F_OK), 0);
   WriteFile(source_, "t");
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(source_), "t");
   EXPECT_EQ(ReadFile(destination_), "s");
   ASSERT_EQ(unlink(destination_.c_str()), 0);
   ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(source_), "t");
   char target[64] = "";
   ASSERT_GT(readlink(destination_.c_str(), target, sizeof(target) - 1), 0);
@@ -113,29 +112,19 @@ TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
   for (const auto& failures : kinds) {
     WriteFile(source_, "s");
     unlink(destination_.c_str());
-    EXPECT_EQ(
-        RunWithSyscallsFailing(
-            failures,
-            [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
-        0);
+    EXPECT_EQ(RunWithSyscallsFailing(failures, [&] { return Rename(); }), 0);
     EXPECT_EQ(ReadFile(destination_), "s");
     EXPECT_NE(access(source_.c_str(), F_OK), 0);
   }
   WriteFile(source_, "t");
   ASSERT_EQ(unlink(destination_.c_str()), 0);
   ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
-  EXPECT_EQ(
-      RunWithSyscallsFailing(
-          kinds[0],
-          [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
-      0);
+  EXPECT_EQ(RunWithSyscallsFailing(kinds[0], [&] { return Rename(); }), 0);
   EXPECT_EQ(ReadFile(source_), "t");
 }
 
-// The first n lines go (none for n <= 0), across copy blocks too; the file
-// keeps its owner and mode, and no temporary file stays. What is no regular
-// file is refused at once: a trimmer must not wait on a FIFO planted at a
-// queue path for a writer that never comes.
+// The first n lines go; owner and mode stay, no temporary file does. What is
+// no regular file is refused at once (a planted FIFO must not block).
 TEST_F(FileTest, TrimDropsTheFirstLines) {
   const std::tuple<std::string, int, std::string> kCases[] = {
       {"a\nb\nc\n", 1, "b\nc\n"},
@@ -181,10 +170,8 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
                                " is a symbolic link; not trimmed"});
 }
 
-// A disk that fills while the copy is written, or a file of another user,
-// must fail the trim and keep every line: reporting success would replace
-// the queue by a cut copy. The failed write must not be retried for ever
-// either, and the temporary file goes.
+// A full disk or a file of another user fails the trim, keeping every line
+// and no temporary file, without retrying for ever.
 TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
   std::string text;
   for (int i = 0; i < 300; ++i)
