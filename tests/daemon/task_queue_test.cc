@@ -1,5 +1,4 @@
-// Task queues on real System V message queues; every queue a test makes is
-// removed in TearDown.
+// Task queues on real System V message queues, removed in TearDown.
 #include "quvaidx/task_queue.h"
 
 #include <fcntl.h>
@@ -95,10 +94,8 @@ TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
   EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] msgsnd: Invalid argument"), 2);
 }
 
-// An empty non-blocking pop sleeps once per attempt and logs nothing; a task
-// that is not JSON is still taken off the queue. A blocking pop ignores the
-// attempts and waits: for a push, or until the queue is removed under it. A
-// pop from a queue that is gone fails at once, logged.
+// A non-blocking pop sleeps once per attempt, a blocking one waits for a push
+// or the queue's removal; a pop from a removed queue fails at once, logged.
 TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   LogCapture log;
   Json::Value out;
@@ -110,7 +107,7 @@ TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   struct {
     long type;
     char text[1024];
-  } raw = {1, "not json at all"};  // still taken off the queue
+  } raw = {1, "not json at all"};  // still taken off the queue, quietly
   ASSERT_EQ(msgsnd(id_, &raw, sizeof(raw.text), 0), 0);
   EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
   EXPECT_EQ(GetNumOfMessageInQueue(id_), 0);

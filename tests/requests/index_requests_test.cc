@@ -1,6 +1,4 @@
-// The typed index requests against scripted daemons on temporary socket
-// paths: request keys, reply keys read with guards, outputs left untouched
-// on failure, the daemon down, the index daemon's alive check.
+// The typed index requests against scripted daemons on temporary sockets.
 #include <string.h>
 #include <sys/socket.h>
 #include <unistd.h>
