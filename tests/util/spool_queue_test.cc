@@ -36,13 +36,19 @@ class IndexQueueTest : public ::testing::Test {
 };
 
 // Duplicates leave one line; entries that would corrupt the queue (a line
-// feed, over kMaxQueueEntry bytes) are refused with a line each.
+// feed, over kMaxQueueEntry bytes) are refused with a line each. A new queue
+// holds text: 0666 less the umask, never executable.
 TEST_F(IndexQueueTest, DuplicatesAndCorruptingEntries) {
   LogCapture log;
   const std::string longest(kMaxQueueEntry, 'x');
+  const mode_t old_umask = umask(0);
   for (const char* entry : {"/share/a", "/share/ab", "/share/a", "/share"}) {
     EXPECT_EQ(WriteIndexQueue(entry, queue_.c_str()), 0);
   }
+  umask(old_umask);
+  struct stat st;
+  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0666u);
   EXPECT_EQ(WriteIndexQueue("two\nlines", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue("trailing\n", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue((longest + "y").c_str(), queue_.c_str()), -1);
@@ -145,18 +151,6 @@ TEST_F(IndexQueueTest, LinkAtTheQueuePathIsNotFollowed) {
       << lines[0];
   EXPECT_EQ(lines[1], "quvaidx_system:N [Error] " + queue_ +
                           " is a symbolic link; not trimmed");
-}
-
-// A queue holds text: the writer makes it 0666 less the umask, never
-// executable.
-TEST_F(IndexQueueTest, NewQueueIsNotExecutable) {
-  const mode_t old_umask = umask(0);
-  const int result = WriteIndexQueue("/share/a", queue_.c_str());
-  umask(old_umask);
-  ASSERT_EQ(result, 0);
-  struct stat st;
-  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0666u);
 }
 
 }  // namespace
