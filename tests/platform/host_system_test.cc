@@ -12,6 +12,7 @@
 
 #include <string>
 #include <thread>
+#include <tuple>
 
 #include "fs_type.h"
 #include "host_ops.h"
@@ -64,22 +65,21 @@ TEST(ErrorStackTest, LastFailureOfThisThreadWithFileAndLine) {
 
 // Code 12 (user-space filesystems) counts as remote.
 TEST(FsTypeTest, MagicNumbersAndTheRemoteAndImageTable) {
-  const struct {
-    uint32_t magic;
-    int code, remote, image;
-  } cases[] = {{0xEF53, QUVA_FS_EXT, 0, 0},
-               {0x6969, QUVA_FS_NFS, 1, 0},
-               {0xFF534D42, QUVA_FS_CIFS, 1, 0},  // top bit set
-               {0x65735546, 12, 1, 0},
-               {0x00C36400, QUVA_FS_NETWORK_OTHER, 1, 0},
-               {0x9660, QUVA_FS_ISO9660, 0, 1},
-               {0xE0F5E1E2, QUVA_FS_ROM_IMAGE, 0, 1},
-               {0x12345678, QUVA_FS_OTHER, 0, 0}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.magic);
-    EXPECT_EQ(FSTypeCodeFromMagic(c.magic), c.code);
-    EXPECT_EQ(QUVAFSIsRemoteFS(c.code), c.remote);
-    EXPECT_EQ(QUVAFSIsImageFS(c.code), c.image);
+  // The magic number, the code, remote, image.
+  const std::tuple<uint32_t, int, int, int> cases[] = {
+      {0xEF53, QUVA_FS_EXT, 0, 0},
+      {0x6969, QUVA_FS_NFS, 1, 0},
+      {0xFF534D42, QUVA_FS_CIFS, 1, 0},  // top bit set
+      {0x65735546, 12, 1, 0},
+      {0x00C36400, QUVA_FS_NETWORK_OTHER, 1, 0},
+      {0x9660, QUVA_FS_ISO9660, 0, 1},
+      {0xE0F5E1E2, QUVA_FS_ROM_IMAGE, 0, 1},
+      {0x12345678, QUVA_FS_OTHER, 0, 0}};
+  for (const auto& [magic, code, remote, image] : cases) {
+    SCOPED_TRACE(magic);
+    EXPECT_EQ(FSTypeCodeFromMagic(magic), code);
+    EXPECT_EQ(QUVAFSIsRemoteFS(code), remote);
+    EXPECT_EQ(QUVAFSIsImageFS(code), image);
   }
   EXPECT_EQ(QUVAFSIsRemoteFS(999) + QUVAFSIsImageFS(-1), 0);
   EXPECT_EQ(QUVAGetFSType("/proc/self", 0), QUVA_FS_OTHER);

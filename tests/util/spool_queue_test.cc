@@ -94,24 +94,23 @@ TEST_F(IndexQueueTest, OpenFailuresAndRetries) {
 // write that fails outright adds nothing.
 TEST_F(IndexQueueTest, FullDiskLeavesNoTornLine) {
   const std::string kept = "/share/a\n";
-  const struct {
-    long limit;          // bytes the queue may grow to
-    const char* reason;  // in the log line
-  } kCases[] = {{static_cast<long>(kept.size()) + 3, "No space left on device"},
-                {static_cast<long>(kept.size()), "File too large"}};
-  for (const auto& c : kCases) {
+  // The size the queue may grow to, the reason logged.
+  const std::pair<long, const char*> kCases[] = {
+      {static_cast<long>(kept.size()) + 3, "No space left on device"},
+      {static_cast<long>(kept.size()), "File too large"}};
+  for (const auto& [limit, reason] : kCases) {
     WriteFile(queue_, kept);
+    const std::string logged_reason = std::string("reason=") + reason;
     auto append_fails = [&] {
       LogCapture log;
       bool failed = WriteIndexQueue("/share/bb", queue_.c_str()) == -1;
-      bool logged = log.lines().size() == 1 &&
-                    log.lines()[0].text.find(std::string("reason=") +
-                                             c.reason) != std::string::npos;
+      bool logged =
+          log.lines().size() == 1 &&
+          log.lines()[0].text.find(logged_reason) != std::string::npos;
       return (failed ? 0 : 1) | (logged ? 0 : 2);
     };
-    int code = RunWithFileSizeLimit(c.limit, append_fails);
-    EXPECT_EQ(code, 0) << c.reason;
-    EXPECT_EQ(ReadFile(queue_), kept) << c.reason;
+    EXPECT_EQ(RunWithFileSizeLimit(limit, append_fails), 0) << reason;
+    EXPECT_EQ(ReadFile(queue_), kept) << reason;
   }
   EXPECT_EQ(WriteIndexQueue("/share/bb", queue_.c_str()), 0);
   EXPECT_EQ(ReadFile(queue_), kept + "/share/bb\n");
