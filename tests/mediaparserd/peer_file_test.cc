@@ -1,5 +1,4 @@
-// Opening a peer's file and reading it within limits, through the block
-// cache.
+// Opening a peer's file and reading it within limits through the cache.
 #include "peer_file.h"
 
 #include <fcntl.h>
