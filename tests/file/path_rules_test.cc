@@ -49,9 +49,8 @@ TEST(PathNames, ReservedEntriesAndRecycleBins) {
   EXPECT_EQ(0, QUVAPathUnderRecyle(nullptr));
 }
 
-// Type 12 counts as remote even where the host's table would not say so. A
-// type that cannot be told (-1) is neither remote nor an image and takes EA
-// writes, logged at debug level.
+// Type 12 is remote even where the host's table says no; an untellable type
+// (-1) is neither remote nor an image, takes EA writes, logged at debug.
 TEST(MountTests, AnswerByFilesystemTypeCode) {
   // The code, whether the host's tables answer (else they say no), the
   // answers: remote, remote or image, EA writes.

@@ -86,9 +86,8 @@ class PeerFileTest : public ::testing::Test {
   TempDir dir_;
 };
 
-// Both ways a daemon checks a peer agree with what the peer may read, by
-// the groups the peer holds: the bit check, and an open with the peer's
-// rights after which a root daemon has its own identity back.
+// The bit check and the open with the peer's rights agree, by the peer's
+// groups, and a root daemon has its own identity back after the open.
 TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
   const std::tuple<const char*, const PeerIdentity*, bool> cases[] = {
       {"open/public", &kStranger, true},    {"open/private", &kStranger, false},
@@ -122,9 +121,8 @@ TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
 }
 
 #ifdef MEDIAPARSERD_PATH
-// The daemon itself, asked by processes that hold different groups (here
-// of users the group database does not know), answers each by the groups it
-// holds.
+// The daemon answers processes of users unknown to the group database by the
+// groups each holds.
 TEST_F(PeerFileTest, DaemonAnswersEachPeerByTheGroupsItHolds) {
   const std::string photo = dir_.File("open/shared.jpg");
   WriteFile(photo, ReadFile(mediaparserd::test::Fixture("photo_exif.jpg")));

@@ -42,17 +42,16 @@ class RequestHandlerTest : public ::testing::Test {
 TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
   const std::pair<const char*, const char*> cases[] = {
       {"[1, 2]", "unknown command"},
-      {"\"GET_MEDIA_INFO\"", "unknown command"},
+      {R"("GET_MEDIA_INFO")", "unknown command"},
       {"{}", "unknown command"},
-      {"{\"command\": 7, \"path\": \"/a.mp3\"}", "unknown command"},
-      {"{\"command\": \"get_media_info\", \"path\": \"/a.mp3\"}",
-       "unknown command"},
-      {"{\"command\": \"GET_MEDIA_INFO\"}", "missing \"path\""},
-      {"{\"command\": \"GET_VIDEO_METADATA\", \"path\": [\"/a.mp4\"]}",
-       "missing \"path\""},
-      {"{\"command\": \"GET_MEDIA_RESOLUTION\", \"path\": \"a.png\"}",
+      {R"({"command": 7, "path": "/a.mp3"})", "unknown command"},
+      {R"({"command": "get_media_info", "path": "/a.mp3"})", "unknown command"},
+      {R"({"command": "GET_MEDIA_INFO"})", R"(missing "path")"},
+      {R"({"command": "GET_VIDEO_METADATA", "path": ["/a.mp4"]})",
+       R"(missing "path")"},
+      {R"({"command": "GET_MEDIA_RESOLUTION", "path": "a.png"})",
        "path is not absolute"},
-      {"{\"command\": \"GET_MEDIA_INFO\", \"path\": \"/nonexistent/a.mp4\"}",
+      {R"({"command": "GET_MEDIA_INFO", "path": "/nonexistent/a.mp4"})",
        "No such file or directory"}};
   for (const auto& [text, reason] : cases) {
     Json::Value request = Parse(text), copy = request;

@@ -47,9 +47,8 @@ TEST(EaDirTest, PathOfFileIsHiddenDirInItsFolderWrittenOnlyWhole) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
 }
 
-// The hidden directory and the item are made when missing (an existing one
-// is success and keeps its mode), never the media folder, never over a
-// file in the way; paths that are not EA directories are refused.
+// Only what is missing is made (never the media folder, never over a file);
+// an existing one keeps its mode; paths of no EA directory are refused.
 TEST(EaDirTest, MakeDirCreatesOnlyWhatIsMissing) {
   TempDir dir;
   std::string ea = dir.File(".quvameta/x.jpg");

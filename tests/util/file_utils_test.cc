@@ -102,9 +102,8 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
               " -> " + inside}));
 }
 
-// Where the filesystem cannot rename without replacing, a hard link stands
-// in, failing instead of replacing; where it has no hard links either, the
-// plain rename after the existence test is all there is.
+// Without a no-replace rename a hard link stands in; without hard links too,
+// the plain rename after the existence test is all there is.
 TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
   const std::vector<std::pair<long, int>> kinds[] = {
       {{SYS_renameat2, EINVAL}},

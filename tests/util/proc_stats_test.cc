@@ -1,6 +1,5 @@
 // Process statistics of this process and of a missing pid, and the /proc
-// parsers on chosen texts. (The figures of another live process are checked
-// against /proc by the tool's stats test.)
+// parsers on chosen texts.
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -15,9 +14,8 @@
 
 namespace {
 
-// What "ls -l /proc/PID/fd | wc -l" prints for a caller asking about
-// itself: its descriptors, the pipe of the command, the header line. A
-// missing process has none and no memory figures.
+// What "ls -l /proc/PID/fd | wc -l" prints: the descriptors, the command's
+// pipe and the header line. A missing process has none and no memory.
 TEST(ProcStatsTest, OwnAndMissingProcess) {
   EXPECT_EQ(GetFileDescriptorNum(getpid()),
             quvaidx::test::OpenDescriptorCount() + 2);

@@ -35,9 +35,8 @@ class IndexQueueTest : public ::testing::Test {
   std::string queue_ = dir_.File("test.queue");
 };
 
-// Duplicates leave one line; entries that would corrupt the queue (a line
-// feed, over kMaxQueueEntry bytes) are refused with a line each. A new queue
-// holds text: 0666 less the umask, never executable.
+// Duplicates leave one line, corrupting entries are refused with a line each;
+// a new queue is 0666 less the umask, never executable.
 TEST_F(IndexQueueTest, DuplicatesAndCorruptingEntries) {
   LogCapture log;
   const std::string longest(kMaxQueueEntry, 'x');
@@ -89,9 +88,8 @@ TEST_F(IndexQueueTest, OpenFailuresAndRetries) {
   EXPECT_EQ(ReadFile(queue_), "");
 }
 
-// A disk that fills during the append must not leave a torn line that
-// would glue itself to the next entry: a short write is taken back, and a
-// write that fails outright adds nothing.
+// A full disk leaves no torn line to glue itself to the next entry: a short
+// write is taken back, a failed one adds nothing.
 TEST_F(IndexQueueTest, FullDiskLeavesNoTornLine) {
   const std::string kept = "/share/a\n";
   // The size the queue may grow to, the reason logged.
