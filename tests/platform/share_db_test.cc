@@ -134,20 +134,8 @@ std::string Update(const std::string& db, const char* name, unsigned status) {
   return ReadFile(db);
 }
 
+// Refused calls change nothing; an update rewrites or adds the status line.
 TEST_F(ShareDbTest, UpdateRewritesOrAddsOnlyTheStatusLine) {
-  std::string expected = kDatabase;
-  expected.replace(expected.find("status = 0x20"), 13, "status = 0x0");
-  EXPECT_EQ(Update(Db(), "video", 0), expected);
-  EXPECT_EQ(Get("video").path, "/vol1/video");
-  EXPECT_NE(Update(Db(), "movies", 0x20)
-                .find("[movies]\nstatus = 0x20\npath = /vol1/video/movies/\n"),
-            std::string::npos);
-  EXPECT_EQ(Get("movies").status, 0x20u);
-  WriteFile(Db(), "[a]\npath = /a");  // no final line end
-  EXPECT_EQ(Update(Db(), "a", 5), "[a]\nstatus = 0x5\npath = /a");
-}
-
-TEST_F(ShareDbTest, RefusedCallsChangeNothing) {
   ShareRecord* out = nullptr;
   EXPECT_EQ(QUVAShareGet("video", nullptr), -1);
   EXPECT_EQ(QUVAShareGetByAttrStr("/vol1/video", 2, &out), -1);
@@ -162,6 +150,16 @@ TEST_F(ShareDbTest, RefusedCallsChangeNothing) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
   EXPECT_EQ(QUVAShareUpdate(nullptr), -1);
   EXPECT_EQ(ReadFile(Db()), kDatabase);
+  std::string expected = kDatabase;
+  expected.replace(expected.find("status = 0x20"), 13, "status = 0x0");
+  EXPECT_EQ(Update(Db(), "video", 0), expected);
+  EXPECT_EQ(Get("video").path, "/vol1/video");
+  EXPECT_NE(Update(Db(), "movies", 0x20)
+                .find("[movies]\nstatus = 0x20\npath = /vol1/video/movies/\n"),
+            std::string::npos);
+  EXPECT_EQ(Get("movies").status, 0x20u);
+  WriteFile(Db(), "[a]\npath = /a");  // no final line end
+  EXPECT_EQ(Update(Db(), "a", 5), "[a]\nstatus = 0x5\npath = /a");
 }
 
 TEST_F(ShareDbTest, UpdateKeepsModeAndLinkAndLeavesNoTemporaryFile) {
