@@ -48,10 +48,7 @@ TEST(ExtensionPredicates, AnswerEveryListForEveryCase) {
   }
   EXPECT_EQ(0, BlQUVAIndexIsVideo(nullptr));
   EXPECT_EQ(MEDIA_TABLE_NONE, GetMediaTableTypeFromExt(nullptr));
-}
-
-// Catches a fold that misses letters or digit-and-hyphen entries.
-TEST(ExtensionLists, EveryEntryMatchesInUpperCase) {
+  // Every list entry in upper case: a fold that misses letters or digits.
   for (int l = 0; l < static_cast<int>(List::kCount); ++l) {
     for (const char* const* e = ListEntries(static_cast<List>(l)); *e; ++e) {
       std::string upper = *e;
