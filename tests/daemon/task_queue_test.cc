@@ -16,11 +16,8 @@
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 
+namespace quvaidx::test {
 namespace {
-
-using quvaidx::test::FakeSleep;
-using quvaidx::test::LogCapture;
-using quvaidx::test::TempDir;
 
 // A task whose compact JSON text, line feed included, is `size` bytes.
 Json::Value TaskOfTextSize(size_t size) {
@@ -160,3 +157,4 @@ TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeftAndMissingOnesFail) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test

@@ -17,14 +17,8 @@
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::test {
 namespace {
-
-using quvaidx::test::LogCapture;
-using quvaidx::test::ReadFile;
-using quvaidx::test::RunUnprivileged;
-using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::RunWithSyscallsFailing;
-using quvaidx::test::WriteFile;
 
 int EntriesIn(const std::string& dir) {
   int count = 0;
@@ -37,7 +31,7 @@ int EntriesIn(const std::string& dir) {
 class FileTest : public ::testing::Test {
  protected:
   int Rename() { return RenameFile(source_.c_str(), destination_.c_str()); }
-  quvaidx::test::TempDir dir_;
+  TempDir dir_;
   std::string source_ = dir_.File("source");
   std::string destination_ = dir_.File("destination");
 };
@@ -67,7 +61,7 @@ TEST_F(FileTest, RealPathResolvesOrKeepsThePath) {
 // failure (a folder into itself) after sixteen tries, each with a yield.
 TEST_F(FileTest, RenameNeverReplacesTheDestination) {
   LogCapture log;
-  quvaidx::test::FakeSleep sleep;
+  FakeSleep sleep;
   EXPECT_EQ(Rename(), -1);
   EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
@@ -136,9 +130,7 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
        std::string(70000, 's')}};  // across copy blocks
   WriteFile(source_, "");
   ASSERT_EQ(chmod(source_.c_str(), 02640), 0);
-  ASSERT_EQ(
-      chown(source_.c_str(), quvaidx::test::kNobody, quvaidx::test::kNobody),
-      0);
+  ASSERT_EQ(chown(source_.c_str(), kNobody, kNobody), 0);
   struct stat before, after;
   ASSERT_EQ(stat(source_.c_str(), &before), 0);
   for (const auto& [text, n, left] : kCases) {
@@ -189,3 +181,4 @@ TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test

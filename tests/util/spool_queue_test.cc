@@ -18,16 +18,8 @@
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::test {
 namespace {
-
-using quvaidx::test::FakeSleep;
-using quvaidx::test::LogCapture;
-using quvaidx::test::RunUnprivileged;
-using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::TempDir;
-
-using quvaidx::test::ReadFile;
-using quvaidx::test::WriteFile;
 
 class IndexQueueTest : public ::testing::Test {
  protected:
@@ -151,3 +143,4 @@ TEST_F(IndexQueueTest, LinkAtTheQueuePathIsNotFollowed) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test
