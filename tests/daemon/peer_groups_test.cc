@@ -12,12 +12,8 @@
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 
-namespace quvaidx {
+namespace quvaidx::test {
 namespace {
-
-using test::LogCapture;
-using test::TempDir;
-using test::WriteFile;
 
 const std::string kIds =
     "Name:\tsh\nUid:\t1000\t1001\t1002\t1003\nGid:\t100\t101\t102\t103\n";
@@ -92,4 +88,4 @@ TEST(PeerGroupsTest, StatusOfAnotherIdentityIsRefused) {
 }
 
 }  // namespace
-}  // namespace quvaidx
+}  // namespace quvaidx::test
