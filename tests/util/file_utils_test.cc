@@ -1,11 +1,12 @@
 // Canonical paths, non-replacing renames and head trimming on real files.
-#include <dirent.h>
 #include <limits.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <iterator>
 #include <string>
 #include <tuple>
 
@@ -20,12 +21,10 @@
 namespace quvaidx::test {
 namespace {
 
+// Every entry, hidden ones too: a temporary file left behind shows.
 int EntriesIn(const std::string& dir) {
-  int count = 0;
-  DIR* d = opendir(dir.c_str());
-  while (struct dirent* e = readdir(d)) count += e->d_name[0] != '.';
-  closedir(d);
-  return count;
+  using std::filesystem::directory_iterator;
+  return std::distance(directory_iterator(dir), directory_iterator());
 }
 
 class FileTest : public ::testing::Test {
