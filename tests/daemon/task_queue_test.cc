@@ -52,14 +52,13 @@ class TaskQueueTest : public ::testing::Test {
 // bytes of text fit none.
 TEST_F(TaskQueueTest, TextAreaSizeClasses) {
   LogCapture log;
-  for (size_t text : {1023, 1024, 4096, 8191}) {
+  const std::pair<size_t, unsigned> kAreas[] = {
+      {1023, 1024}, {1024, 4096}, {4096, 8192}, {8191, 8192}};
+  for (const auto& [text, area] : kAreas) {
     ASSERT_EQ(PushTaskToQueue(id_, TaskOfTextSize(text), 1), 0) << text;
     struct msqid_ds status;
     ASSERT_EQ(msgctl(id_, IPC_STAT, &status), 0);
-    EXPECT_EQ(status.__msg_cbytes, text < 1024   ? 1024u
-                                   : text < 4096 ? 4096u
-                                                 : 8192u)
-        << text;
+    EXPECT_EQ(status.__msg_cbytes, area) << text;
     Json::Value out;
     ASSERT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
     EXPECT_EQ(out, TaskOfTextSize(text));
