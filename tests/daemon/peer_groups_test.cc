@@ -1,11 +1,10 @@
-// The peer's groups from its status text, where the connection records
-// none: the parser's table of good and bad texts, and the refusal of a
-// process that no longer runs as the peer did.
+// The peer's groups from its status text, where the connection records none.
 #include "daemon/peer_groups.h"
 
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -13,12 +12,8 @@
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 
-namespace quvaidx {
+namespace quvaidx::test {
 namespace {
-
-using test::LogCapture;
-using test::TempDir;
-using test::WriteFile;
 
 const std::string kIds =
     "Name:\tsh\nUid:\t1000\t1001\t1002\t1003\nGid:\t100\t101\t102\t103\n";
@@ -27,11 +22,7 @@ const std::string kIds =
 // read in part.
 TEST(PeerGroupsTest, StatusTextsGiveTheirGroupsOrNone) {
   const std::vector<gid_t> none;
-  struct Case {
-    std::string text;
-    bool parsed;
-    std::vector<gid_t> groups;
-  } cases[] = {
+  const std::tuple<std::string, bool, std::vector<gid_t>> cases[] = {
       {kIds + "FDSize:\t64\nGroups:\t4 27 4294967294 \nNSpid:\t9\n",
        true,
        {4, 27, 4294967294u}},
@@ -51,12 +42,11 @@ TEST(PeerGroupsTest, StatusTextsGiveTheirGroupsOrNone) {
        none},  // a zero byte in a line
       {"", false, none},
   };
-  for (const Case& c : cases) {
+  for (const auto& [text, parsed, groups] : cases) {
     StatusIds ids;
-    EXPECT_EQ(ParseStatusIds(c.text.data(), c.text.size(), &ids), c.parsed)
-        << c.text;
-    if (!c.parsed) continue;
-    EXPECT_EQ(ids.groups, c.groups) << c.text;
+    EXPECT_EQ(ParseStatusIds(text.data(), text.size(), &ids), parsed) << text;
+    if (!parsed) continue;
+    EXPECT_EQ(ids.groups, groups) << text;
     EXPECT_EQ(ids.uid[1], 1001u);
     EXPECT_EQ(ids.gid[1], 101u);
   }
@@ -67,9 +57,8 @@ TEST(PeerGroupsTest, StatusTextsGiveTheirGroupsOrNone) {
   EXPECT_EQ(ids.groups, std::vector<gid_t>{5});
 }
 
-// The status text counts only while its process has the effective ids the
-// peer connected with: a pid that went to another user's process gives
-// nothing (logged), nor does a missing or oversized text.
+// The text counts only while its process has the peer's effective ids (a
+// reused pid is logged); a missing or oversized text gives nothing either.
 TEST(PeerGroupsTest, StatusOfAnotherIdentityIsRefused) {
   TempDir dir;
   const std::string status = dir.File("status");
@@ -99,4 +88,4 @@ TEST(PeerGroupsTest, StatusOfAnotherIdentityIsRefused) {
 }
 
 }  // namespace
-}  // namespace quvaidx
+}  // namespace quvaidx::test

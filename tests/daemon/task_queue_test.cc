@@ -1,5 +1,4 @@
-// Task queues on real System V message queues; every queue a test makes is
-// removed in TearDown.
+// Task queues on real System V message queues, removed in TearDown.
 #include "quvaidx/task_queue.h"
 
 #include <fcntl.h>
@@ -17,11 +16,8 @@
 #include "support/fd_check.h"
 #include "support/log_capture.h"
 
+namespace quvaidx::test {
 namespace {
-
-using quvaidx::test::FakeSleep;
-using quvaidx::test::LogCapture;
-using quvaidx::test::TempDir;
 
 // A task whose compact JSON text, line feed included, is `size` bytes.
 Json::Value TaskOfTextSize(size_t size) {
@@ -56,14 +52,13 @@ class TaskQueueTest : public ::testing::Test {
 // bytes of text fit none.
 TEST_F(TaskQueueTest, TextAreaSizeClasses) {
   LogCapture log;
-  for (size_t text : {1023, 1024, 4096, 8191}) {
+  const std::pair<size_t, unsigned> kAreas[] = {
+      {1023, 1024}, {1024, 4096}, {4096, 8192}, {8191, 8192}};
+  for (const auto& [text, area] : kAreas) {
     ASSERT_EQ(PushTaskToQueue(id_, TaskOfTextSize(text), 1), 0) << text;
     struct msqid_ds status;
     ASSERT_EQ(msgctl(id_, IPC_STAT, &status), 0);
-    EXPECT_EQ(status.__msg_cbytes, text < 1024   ? 1024u
-                                   : text < 4096 ? 4096u
-                                                 : 8192u)
-        << text;
+    EXPECT_EQ(status.__msg_cbytes, area) << text;
     Json::Value out;
     ASSERT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
     EXPECT_EQ(out, TaskOfTextSize(text));
@@ -95,10 +90,8 @@ TEST_F(TaskQueueTest, TypesSelectAsTheSystemDoes) {
   EXPECT_EQ(log.Count("quvaidx_daemon:N [Error] msgsnd: Invalid argument"), 2);
 }
 
-// An empty non-blocking pop sleeps once per attempt and logs nothing; a task
-// that is not JSON is still taken off the queue. A blocking pop ignores the
-// attempts and waits: for a push, or until the queue is removed under it. A
-// pop from a queue that is gone fails at once, logged.
+// A non-blocking pop sleeps once per attempt, a blocking one waits for a push
+// or the queue's removal; a pop from a removed queue fails at once, logged.
 TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   LogCapture log;
   Json::Value out;
@@ -110,7 +103,7 @@ TEST_F(TaskQueueTest, PopWaitsAsAsked) {
   struct {
     long type;
     char text[1024];
-  } raw = {1, "not json at all"};  // still taken off the queue
+  } raw = {1, "not json at all"};  // still taken off the queue, quietly
   ASSERT_EQ(msgsnd(id_, &raw, sizeof(raw.text), 0), 0);
   EXPECT_EQ(PopTaskFromQueue(id_, 0, false, 1, out), 0);
   EXPECT_EQ(GetNumOfMessageInQueue(id_), 0);
@@ -163,3 +156,4 @@ TEST_F(TaskQueueTest, CreateDiscardsWhatAnEarlierRunLeftAndMissingOnesFail) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test

@@ -48,10 +48,7 @@ TEST(ExtensionPredicates, AnswerEveryListForEveryCase) {
   }
   EXPECT_EQ(0, BlQUVAIndexIsVideo(nullptr));
   EXPECT_EQ(MEDIA_TABLE_NONE, GetMediaTableTypeFromExt(nullptr));
-}
-
-// Catches a fold that misses letters or digit-and-hyphen entries.
-TEST(ExtensionLists, EveryEntryMatchesInUpperCase) {
+  // Every list entry in upper case: a fold that misses letters or digits.
   for (int l = 0; l < static_cast<int>(List::kCount); ++l) {
     for (const char* const* e = ListEntries(static_cast<List>(l)); *e; ++e) {
       std::string upper = *e;
@@ -85,31 +82,24 @@ TEST(PathPredicates, UseTheTextAfterTheLastDotOfTheWholePath) {
   EXPECT_EQ(nullptr, QUVAIndexExtGet(nullptr));
 }
 
-struct ConvertCase {
-  const char* name;
-  int out_size;
-  int result;
-  const char* out;
-};
-
-const ConvertCase kConvertCases[] = {
-    {"QUVAPHOTO:FILM_H.mp4", 32, 1, "CONVERTA_HIGH"},
-    {"QUVAPHOTO_FILM_H264.mp4", 32, 1, ""},
-    {"QUVAPHOTO:FILM.flv", 32, 1, "GALVENTA_FLV"},
-    {"QUVAPHOTO_FILM_MOBILE_ANDROID", 8, 1, "ANDROID"},
-    {"QUVAPHOTO:FILM_M.mp4", 1, 1, ""},
-    {"quvaphoto_film_h.mp4", 32, 0, ""},     // letter case counts
-    {"/v/QUVAPHOTO_FILM_H.mp4", 32, 0, ""},  // a path never matches
-    {"QUVAPHOTO_FILM_H.mp", 32, 0, ""}};
-
 TEST(ConvertVideoType, FindsBareNamesAndCutsTheType) {
-  for (const ConvertCase& c : kConvertCases) {
-    SCOPED_TRACE(c.name);
+  // The name, the out size, the result and what out holds.
+  const std::tuple<const char*, int, int, const char*> cases[] = {
+      {"QUVAPHOTO:FILM_H.mp4", 32, 1, "CONVERTA_HIGH"},
+      {"QUVAPHOTO_FILM_H264.mp4", 32, 1, ""},
+      {"QUVAPHOTO:FILM.flv", 32, 1, "GALVENTA_FLV"},
+      {"QUVAPHOTO_FILM_MOBILE_ANDROID", 8, 1, "ANDROID"},
+      {"QUVAPHOTO:FILM_M.mp4", 1, 1, ""},
+      {"quvaphoto_film_h.mp4", 32, 0, ""},     // letter case counts
+      {"/v/QUVAPHOTO_FILM_H.mp4", 32, 0, ""},  // a path never matches
+      {"QUVAPHOTO_FILM_H.mp", 32, 0, ""}};
+  for (const auto& [name, out_size, result, written] : cases) {
+    SCOPED_TRACE(name);
     char out[40];
     memset(out, 'x', sizeof(out));
-    EXPECT_EQ(c.result, ConvertVideoTypeGet(c.name, out, c.out_size));
-    EXPECT_STREQ(c.out, out);
-    EXPECT_EQ('x', out[c.out_size]) << "wrote beyond out_size";
+    EXPECT_EQ(result, ConvertVideoTypeGet(name, out, out_size));
+    EXPECT_STREQ(written, out);
+    EXPECT_EQ('x', out[out_size]) << "wrote beyond out_size";
   }
   char out[8] = "keep";  // never written
   EXPECT_EQ(1, ConvertVideoTypeGet("QUVAPHOTO_FILM_H.mp4", out, -5));
@@ -138,13 +128,13 @@ TEST(CodecNames, GapsGiveTheDefaultAndNamesRoundTrip) {
       EXPECT_EQ(n, QUVADlnaContainerTypeGet(QUVADlnaContainerNameGet(n)));
     }
   }
-  EXPECT_EQ(0, QUVAAacObjectTypeGet("AAC_LC"));
-  EXPECT_EQ(0, QUVAAacObjectTypeGet("aac_invalid"));
+  for (const char* name : {"AAC_LC", "aac_invalid"})
+    EXPECT_EQ(0, QUVAAacObjectTypeGet(name)) << name;
   EXPECT_EQ(10, QUVADlnaContainerTypeGet("mp4"));
   EXPECT_EQ(8, QUVADlnaContainerTypeGet("mov,mp4,m4a,3gp,3g2,mj2"));
   EXPECT_EQ(0, QUVADlnaContainerTypeGet("mov"));
-  EXPECT_STREQ("unknown", QUVADlnaContainerNameGet(0));
-  EXPECT_STREQ("unknown", QUVADlnaContainerNameGet(18));
+  for (int gap : {0, 18})
+    EXPECT_STREQ("unknown", QUVADlnaContainerNameGet(gap)) << gap;
   EXPECT_STREQ("mpeg_transport_stream_dlna_no_ts",
                QUVADlnaContainerNameGet(17));
 }

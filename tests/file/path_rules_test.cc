@@ -11,6 +11,7 @@
 #include <utime.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -48,43 +49,35 @@ TEST(PathNames, ReservedEntriesAndRecycleBins) {
   EXPECT_EQ(0, QUVAPathUnderRecyle(nullptr));
 }
 
-// Type 12 counts as remote even where the host's table would not say so.
+// Type 12 is remote even where the host's table says no; an untellable type
+// (-1) is neither remote nor an image, takes EA writes, logged at debug.
 TEST(MountTests, AnswerByFilesystemTypeCode) {
-  const struct {
-    int code;
-    bool host_table;  // else the host's remote and image tables say no
-    int remote, remote_or_image, ea_write;
-  } cases[] = {
+  // The code, whether the host's tables answer (else they say no), the
+  // answers: remote, remote or image, EA writes.
+  const std::tuple<int, bool, int, int, int> cases[] = {
       {1, true, 0, 0, 1},                         // ext4
       {10, true, 1, 1, 0},                        // NFS
       {12, true, 1, 1, 0},                        // user-space filesystem
       {12, false, 1, 1, 0}, {13, true, 0, 1, 0},  // ISO 9660
-      {18, true, 0, 0, 1}                         // overlayfs
-  };
-  for (const auto& c : cases) {
+      {18, true, 0, 0, 1},                        // overlayfs
+      {-1, true, 0, 0, 1}};
+  for (const auto& [code, host_table, remote, remote_or_image, ea] : cases) {
+    SCOPED_TRACE(code);
+    LogCapture log(7);
     FakeHost host;
-    host.Answer(HostOp::kGetFSType, {c.code});
-    if (!c.host_table) {
+    if (code < 0) host.Fail(HostOp::kGetFSType, ENOENT);
+    if (code >= 0) host.Answer(HostOp::kGetFSType, {code});
+    if (!host_table) {
       host.Answer(HostOp::kFSIsRemoteFS, {0});
       host.Answer(HostOp::kFSIsImageFS, {0});
     }
-    EXPECT_EQ(c.remote, IndexIsPathRemoteMount("/x")) << c.code;
-    EXPECT_EQ(c.remote_or_image, IndexIsPathRemoteOrImageMount("/x")) << c.code;
-    EXPECT_EQ(c.ea_write, IndexIsPathSupportEAWrite("/x")) << c.code;
+    EXPECT_EQ(remote, IndexIsPathRemoteMount("/x"));
+    EXPECT_EQ(remote_or_image, IndexIsPathRemoteOrImageMount("/x"));
+    EXPECT_EQ(ea, IndexIsPathSupportEAWrite("/x"));
+    if (code >= 0) continue;
+    ASSERT_EQ(3u, log.lines().size());
+    for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
   }
-}
-
-// A path whose type cannot be told is neither remote nor an image, and
-// takes EA writes; the failure is logged at debug level.
-TEST(MountTests, FailureIsLoggedAtDebugAndAnsweredSafely) {
-  LogCapture log(7);
-  FakeHost host;
-  host.Fail(HostOp::kGetFSType, ENOENT);
-  EXPECT_EQ(0, IndexIsPathRemoteMount("/nope"));
-  EXPECT_EQ(0, IndexIsPathRemoteOrImageMount("/nope"));
-  EXPECT_EQ(1, IndexIsPathSupportEAWrite("/nope"));
-  ASSERT_EQ(3u, log.lines().size());
-  for (const auto& line : log.lines()) EXPECT_EQ(LOG_DEBUG, line.priority);
 }
 
 // Sets TZ for the rest of this test's process.

@@ -1,6 +1,5 @@
-// Shared folders on the stand-in's share database, through the fake host.
-// The host hands out a blank record even when a lookup fails, as a host
-// may: every caller releases it, so none leaks on a failed lookup either.
+// Shared folders through the fake host, which hands out a blank record even
+// when a lookup fails: every caller must release it.
 #include "quvaidx/share_folder.h"
 
 #include <errno.h>
@@ -21,8 +20,7 @@ namespace {
 using quvahost::test::HostOp;
 using quvaidx::test::LogCapture;
 
-// A share database with the share "video" at /vol1/video, and a host that
-// hands out records on failure.
+// The share "video" at /vol1/video.
 class ShareFolderTest : public ::testing::Test {
  protected:
   ShareFolderTest() {
@@ -51,24 +49,20 @@ class ShareFolderTest : public ::testing::Test {
 // Only a mark that differs is written; a missing share is -1, a failed
 // update is logged and still 0 (the next scan asks again).
 TEST_F(ShareFolderTest, IndexStatusSetsOrClearsOnlyWhatDiffers) {
-  const struct {
-    unsigned before;
-    bool set;
-    int updates;
-    unsigned after;
-  } cases[] = {{0x00, true, 1, 0x20},
-               {0x21, false, 1, 0x01},
-               {0x25, true, 0, 0x25},
-               {0x04, false, 0, 0x04}};
+  // Status before, set or clear, updates written, status after.
+  const std::tuple<unsigned, bool, int, unsigned> cases[] = {
+      {0x00, true, 1, 0x20},
+      {0x21, false, 1, 0x01},
+      {0x25, true, 0, 0x25},
+      {0x04, false, 0, 0x04}};
   int updates = 0;
-  for (const auto& c : cases) {
-    WriteShares("/vol1/video", c.before);
+  for (const auto& [before, set, written, after] : cases) {
+    WriteShares("/vol1/video", before);
     EXPECT_EQ(
-        c.set ? ShareIndexStatusSet("video") : ShareIndexStatusClear("video"),
-        0);
-    updates += c.updates;
-    EXPECT_EQ(host_.Calls(HostOp::kShareUpdate), updates) << c.before;
-    EXPECT_EQ(Status(), c.after);
+        set ? ShareIndexStatusSet("video") : ShareIndexStatusClear("video"), 0);
+    updates += written;
+    EXPECT_EQ(host_.Calls(HostOp::kShareUpdate), updates) << before;
+    EXPECT_EQ(Status(), after);
   }
   EXPECT_EQ(ShareIndexStatusSet("nope"), -1);
   EXPECT_EQ(ShareIndexStatusClear("nope"), -1);
@@ -115,9 +109,8 @@ TEST_F(ShareFolderTest, ShareRelativePathsBecomeDiskPaths) {
   EXPECT_STREQ(out, "untouched");
 }
 
-// A folder's path, name and times; the guid from the map only inside a
-// share, where a missing map entry leaves the caller's. Files, missing
-// paths and bad arguments fail, only the bad arguments logged.
+// The guid comes from the map only inside a share, a missing entry leaving
+// the caller's; only bad arguments and unresolvable paths are logged.
 TEST_F(ShareFolderTest, DirInfoOfAFolder) {
   quvaidx::test::TempDir dir;
   DirInfo info = {};

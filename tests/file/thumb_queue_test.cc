@@ -6,7 +6,6 @@
 
 #include <string>
 #include <utility>
-#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -58,9 +57,8 @@ class ThumbQueueTest : public ::testing::Test {
   quvaidx::SpoolPaths previous_;
 };
 
-// A photo queues its folder (once), a web video the file itself; a file of
-// no interest queues nothing but still wakes the daemon. Other types do
-// nothing; paths that are neither file nor folder fail.
+// A photo queues its folder (once), a web video itself; a file of no interest
+// still wakes the daemon. Other types do nothing; non-files fail.
 TEST_F(ThumbQueueTest, QueuesAndWakesTheDaemon) {
   const std::pair<std::string, int> calls[] = {
       {media_ + "/x.jpg", THUMB_TYPE_PHOTO},

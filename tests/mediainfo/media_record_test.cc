@@ -1,6 +1,4 @@
-// The media record's JSON form (round trips, 64-bit sizes, absent and
-// mistyped members, texts too long for their fields, video metadata) and its
-// two dumps, on standard output and in the system log.
+// The media record's JSON form and its dumps to standard output and syslog.
 #include <float.h>
 #include <stdio.h>
 #include <string.h>
@@ -45,10 +43,8 @@ __tag_QUVA_MEDIA_INFO Zero() {
   return r;
 }
 
-// Every member distinct and non-zero: non-ASCII texts, unsigned values above
-// INT32_MAX, negative ints, a size above 4 GiB. Compared as text, so a flag
-// written as a boolean or a real written as an integer shows; the stale
-// member must go, and a value that is no object becomes one.
+// Every member distinct, non-ASCII, above INT32_MAX or 4 GiB, compared as
+// text so a type change shows; stale members go, a non-object becomes one.
 TEST(MediaRecordTest, RoundTripKeepsEveryMemberAndItsType) {
   Json::Value in(Json::objectValue);
   int n = 0;
@@ -81,10 +77,8 @@ TEST(MediaRecordTest, RoundTripKeepsEveryMemberAndItsType) {
   }
 }
 
-// Absent members read as zero (and are added to the input as null); values
-// of another numeric type that fit are read; every mistyped or out-of-range
-// member, set alone, converts to 0 (or an empty text) instead of throwing
-// out of the library; a value that is no object is left as it is.
+// Absent members read as zero (added to the input as null), fitting numbers
+// of another type are read, mistyped or out-of-range ones read as zero.
 TEST(MediaRecordTest, AbsentAndMistypedMembersAreZeroAndFittingOnesRead) {
   Json::Value in = Parse(R"({"track": 3.9, "ID": 4294967295,
       "duration": 3.4028234663852886e38, "year": -2147483648,
@@ -171,10 +165,8 @@ TEST(VideoMetadataTest, RoundTripAndMistypedMembers) {
   }
 }
 
-// The dump of a record with edge values and zeros elsewhere: one item per
-// member, printed without a line feed, logged as one error line each
-// whatever the level. Texts are values, never formats, and end at their
-// field's capacity; fileSize prints in full.
+// One item per member, printed without line feeds, logged as error lines at
+// any level; texts are never formats and end at their capacity.
 TEST(MediaDumpTest, PrintAndSyslogWriteExactlyTheItems) {
   __tag_QUVA_MEDIA_INFO r = Zero();
   r.ID = r.video_bitrate = 4294967295u;
@@ -197,13 +189,12 @@ TEST(MediaDumpTest, PrintAndSyslogWriteExactlyTheItems) {
   std::string all;
   for (const auto& field : kMediaFields) {
     auto it = set.find(field.name);
-    std::string value = it != set.end()                  ? it->second
-                        : field.kind == FieldKind::kText ? ""
-                                                         : "0";
     char item[64];
-    snprintf(item, sizeof(item), "%-16s= %s,", field.name, value.c_str());
-    items.push_back(item);
-    all += item;
+    snprintf(item, sizeof(item), "%-16s= %s,", field.name,
+             it != set.end()                  ? it->second.c_str()
+             : field.kind == FieldKind::kText ? ""
+                                              : "0");
+    all += items.emplace_back(item);
   }
   testing::internal::CaptureStdout();
   PrintMediaInfoObject(r);

@@ -1,7 +1,5 @@
-// A peer learns about a file only when it could read the file itself: the
-// permission-bit check of a daemon that is not root, the identity a root
-// daemon takes while it opens the file, and the daemon as a real process
-// asked by processes of other users.
+// A peer learns about a file only when it could read it itself: by the mode
+// bits, by the peer's identity taken for the open, and through the daemon.
 #include "peer_access.h"
 
 #include <sys/fsuid.h>
@@ -9,7 +7,7 @@
 #include <unistd.h>
 
 #include <string>
-#include <utility>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -48,13 +46,8 @@ struct stat Status(uid_t uid, gid_t gid, mode_t mode) {
 // others) decides alone.
 TEST(PeerAccessTest, OwnerThenGroupThenOthersDecide) {
   const std::vector<gid_t> groups = {100, 200};
-  struct Case {
-    uid_t uid;
-    gid_t gid;
-    mode_t mode;
-    mode_t want;
-    bool granted;
-  } cases[] = {
+  // File owner, group and mode, the bit asked, the answer.
+  const std::tuple<uid_t, gid_t, mode_t, mode_t, bool> cases[] = {
       {7, 1, 0400, S_IROTH, true},     // owner may read
       {7, 1, 0044, S_IROTH, false},    // owner class wins, though others may
       {1, 200, 0040, S_IROTH, true},   // a supplementary group
@@ -63,10 +56,9 @@ TEST(PeerAccessTest, OwnerThenGroupThenOthersDecide) {
       {1, 1, 0006, S_IXOTH, false},    // read is no search
       {1, 1, 0001, S_IXOTH, true},
   };
-  for (const Case& c : cases) {
-    EXPECT_EQ(ModeGrants(Status(c.uid, c.gid, c.mode), 7, groups, c.want),
-              c.granted)
-        << c.uid << " " << c.gid << " " << std::oct << c.mode;
+  for (const auto& [uid, gid, mode, want, granted] : cases) {
+    EXPECT_EQ(ModeGrants(Status(uid, gid, mode), 7, groups, want), granted)
+        << uid << " " << gid << " " << std::oct << mode;
   }
 }
 
@@ -94,15 +86,10 @@ class PeerFileTest : public ::testing::Test {
   TempDir dir_;
 };
 
-// Both ways a daemon checks a peer agree with what the peer may read, by
-// the groups the peer holds: the bit check, and an open with the peer's
-// rights after which a root daemon has its own identity back.
+// The bit check and the open with the peer's rights agree, by the peer's
+// groups, and a root daemon has its own identity back after the open.
 TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
-  struct Case {
-    const char* name;
-    const PeerIdentity* peer;
-    bool readable;
-  } cases[] = {
+  const std::tuple<const char*, const PeerIdentity*, bool> cases[] = {
       {"open/public", &kStranger, true},    {"open/private", &kStranger, false},
       {"closed/public", &kStranger, false},  // the folder cannot be searched
       {"open/theirs", &kStranger, true},  // its owner's, though others may not
@@ -110,15 +97,14 @@ TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
       {"open/shared", &kOutsider, false},
   };
   int groups_before = getgroups(0, nullptr);
-  for (const Case& c : cases) {
-    SCOPED_TRACE(std::string(c.name) + " as " + std::to_string(c.peer->uid));
+  for (const auto& [name, peer, readable] : cases) {
+    SCOPED_TRACE(std::string(name) + " as " + std::to_string(peer->uid));
     std::string checked, opened;
     PeerFile file;
-    EXPECT_EQ(PeerMayRead(dir_.File(c.name), *c.peer, &checked), c.readable);
-    EXPECT_EQ(OpenPeerFile(dir_.File(c.name), &file, &opened, c.peer),
-              c.readable)
+    EXPECT_EQ(PeerMayRead(dir_.File(name), *peer, &checked), readable);
+    EXPECT_EQ(OpenPeerFile(dir_.File(name), &file, &opened, peer), readable)
         << opened;
-    if (!c.readable) {
+    if (!readable) {
       EXPECT_EQ(checked, "Permission denied");
       EXPECT_EQ(opened, "Permission denied");
     }
@@ -135,9 +121,8 @@ TEST_F(PeerFileTest, PeerIsRefusedWhatItCannotReadAndRootGetsItsOwnBack) {
 }
 
 #ifdef MEDIAPARSERD_PATH
-// The daemon itself, asked by processes that hold different groups (here
-// of users the group database does not know), answers each by the groups it
-// holds.
+// The daemon answers processes of users unknown to the group database by the
+// groups each holds.
 TEST_F(PeerFileTest, DaemonAnswersEachPeerByTheGroupsItHolds) {
   const std::string photo = dir_.File("open/shared.jpg");
   WriteFile(photo, ReadFile(mediaparserd::test::Fixture("photo_exif.jpg")));

@@ -2,6 +2,7 @@
 #include "request_handler.h"
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 #include <quvaidx/daemon.h>
@@ -41,17 +42,16 @@ class RequestHandlerTest : public ::testing::Test {
 TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
   const std::pair<const char*, const char*> cases[] = {
       {"[1, 2]", "unknown command"},
-      {"\"GET_MEDIA_INFO\"", "unknown command"},
+      {R"("GET_MEDIA_INFO")", "unknown command"},
       {"{}", "unknown command"},
-      {"{\"command\": 7, \"path\": \"/a.mp3\"}", "unknown command"},
-      {"{\"command\": \"get_media_info\", \"path\": \"/a.mp3\"}",
-       "unknown command"},
-      {"{\"command\": \"GET_MEDIA_INFO\"}", "missing \"path\""},
-      {"{\"command\": \"GET_VIDEO_METADATA\", \"path\": [\"/a.mp4\"]}",
-       "missing \"path\""},
-      {"{\"command\": \"GET_MEDIA_RESOLUTION\", \"path\": \"a.png\"}",
+      {R"({"command": 7, "path": "/a.mp3"})", "unknown command"},
+      {R"({"command": "get_media_info", "path": "/a.mp3"})", "unknown command"},
+      {R"({"command": "GET_MEDIA_INFO"})", R"(missing "path")"},
+      {R"({"command": "GET_VIDEO_METADATA", "path": ["/a.mp4"]})",
+       R"(missing "path")"},
+      {R"({"command": "GET_MEDIA_RESOLUTION", "path": "a.png"})",
        "path is not absolute"},
-      {"{\"command\": \"GET_MEDIA_INFO\", \"path\": \"/nonexistent/a.mp4\"}",
+      {R"({"command": "GET_MEDIA_INFO", "path": "/nonexistent/a.mp4"})",
        "No such file or directory"}};
   for (const auto& [text, reason] : cases) {
     Json::Value request = Parse(text), copy = request;
@@ -62,41 +62,37 @@ TEST_F(RequestHandlerTest, MalformedRequestsAreRefusedAndLeftUntouched) {
             MakeResponse(true, nullptr));
 }
 
-// Each command answers its part of the record under its reply keys: the
-// whole record (47 fields, valid UTF-8 even where legacy tags cannot be
-// decoded) and its kind, the picture size, or the rotation and pixel
-// aspect of a video, which only a video has.
+// Each command answers its part: the whole record (47 fields, valid UTF-8)
+// and kind, the picture size, or a video's rotation and pixel aspect.
 TEST_F(RequestHandlerTest, EachCommandAnswersItsPartOfTheRecord) {
   test::HostCodePage host("UTF-8");
-  const struct {
-    const char *file, *kind;
-    int width, height;
-    const char* metadata;  // null: "not a video"
-  } cases[] = {{"song_id3v1_cp1251.mp3", "music", 0, 0, nullptr},
-               {"photo_exif.jpg", "photo", 640, 480, nullptr},
-               {"video_rot90.mp4", "video", 320, 240,
-                "{\"rotation\": 90, \"par\": {\"width\": 1, \"height\": 1}}"},
-               {"video.mkv", "video", 320, 240,
-                "{\"rotation\": 0, \"par\": {\"width\": 4, \"height\": 3}}"}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.file);
-    const std::string path = Fixture(c.file);
+  // File, kind, width, height, metadata (null: "not a video").
+  const std::tuple<const char*, const char*, int, int, const char*> cases[] = {
+      {"song_id3v1_cp1251.mp3", "music", 0, 0, nullptr},
+      {"photo_exif.jpg", "photo", 640, 480, nullptr},
+      {"video_rot90.mp4", "video", 320, 240,
+       "{\"rotation\": 90, \"par\": {\"width\": 1, \"height\": 1}}"},
+      {"video.mkv", "video", 320, 240,
+       "{\"rotation\": 0, \"par\": {\"width\": 4, \"height\": 3}}"}};
+  for (const auto& [file, kind, width, height, metadata] : cases) {
+    SCOPED_TRACE(file);
+    const std::string path = Fixture(file);
     Json::Value reply = Ask("GET_MEDIA_INFO", path);
     ASSERT_TRUE(reply["success"].asBool()) << reply;
-    EXPECT_EQ(reply["media_type"].asString(), c.kind);
+    EXPECT_EQ(reply["media_type"].asString(), kind);
     EXPECT_EQ(reply["media"].size(), 47u);
     EXPECT_EQ(reply["media"]["szPath"].asString(), path);
     EXPECT_TRUE(test::IsValidUTF8(Json::FastWriter().write(reply)));
     reply = Ask("GET_MEDIA_RESOLUTION", path);
-    EXPECT_EQ(reply, Parse("{\"success\": true, \"width\": " +
-                           std::to_string(c.width) +
-                           ", \"height\": " + std::to_string(c.height) + "}"));
+    EXPECT_EQ(reply,
+              Parse("{\"success\": true, \"width\": " + std::to_string(width) +
+                    ", \"height\": " + std::to_string(height) + "}"));
     reply = Ask("GET_VIDEO_METADATA", path);
-    if (c.metadata == nullptr) {
+    if (metadata == nullptr) {
       EXPECT_EQ(reply, MakeResponse(false, "not a video"));
     } else {
       EXPECT_TRUE(reply["success"].asBool());
-      EXPECT_EQ(reply["metadata"], Parse(c.metadata));
+      EXPECT_EQ(reply["metadata"], Parse(metadata));
     }
   }
 }

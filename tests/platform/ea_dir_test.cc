@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 
 #include "support/fake_host.h"
 
@@ -19,29 +20,26 @@ bool IsDir(const std::string& path) {
 // The path is written only whole: one that does not fit leaves the buffer
 // as it was.
 TEST(EaDirTest, PathOfFileIsHiddenDirInItsFolderWrittenOnlyWhole) {
-  const struct {
-    const char* file;
-    int size;
-    const char* ea_dir;  // "untouched": failed
-    int error;
-  } cases[] = {{"/x.jpg", 64, "/.quvameta/x.jpg", 0},
-               {"x.jpg", 64, ".quvameta/x.jpg", 0},
-               {"/share/a/dir//", 64, "/share/a/.quvameta/dir", 0},
-               {"/share/a/x.jpg", 25, "/share/a/.quvameta/x.jpg", 0},
-               {"/share/a/x.jpg", 24, "untouched", ERANGE},
-               {"/", 64, "untouched", EINVAL},
-               {"/share/a/..", 64, "untouched", EINVAL},
-               {"/share/a/.quvameta", 64, "untouched", EINVAL},
-               {"/share/a/.quvameta/x.jpg", 64, "untouched", EINVAL},
-               {"/a/b", -5, "untouched", EINVAL}};
-  for (const auto& c : cases) {
+  // File, buffer size, the buffer after ("untouched": failed), errno.
+  const std::tuple<const char*, int, const char*, int> cases[] = {
+      {"/x.jpg", 64, "/.quvameta/x.jpg", 0},
+      {"x.jpg", 64, ".quvameta/x.jpg", 0},
+      {"/share/a/dir//", 64, "/share/a/.quvameta/dir", 0},
+      {"/share/a/x.jpg", 25, "/share/a/.quvameta/x.jpg", 0},
+      {"/share/a/x.jpg", 24, "untouched", ERANGE},
+      {"/", 64, "untouched", EINVAL},
+      {"/share/a/..", 64, "untouched", EINVAL},
+      {"/share/a/.quvameta", 64, "untouched", EINVAL},
+      {"/share/a/.quvameta/x.jpg", 64, "untouched", EINVAL},
+      {"/a/b", -5, "untouched", EINVAL}};
+  for (const auto& [file, size, ea_dir, error] : cases) {
+    SCOPED_TRACE(file);
     char buffer[65] = "untouched";
     memset(buffer + 10, '#', sizeof buffer - 10);
-    bool ok = c.error == 0;
-    EXPECT_EQ(QUVAEADirPath(0, c.file, buffer, c.size), ok ? 0 : -1) << c.file;
-    EXPECT_STREQ(buffer, c.ea_dir);
-    EXPECT_EQ(buffer[c.size < 0 ? 64 : c.size], '#') << c.file;
-    EXPECT_TRUE(ok || QLIBCErrGet() == c.error) << c.file;
+    EXPECT_EQ(QUVAEADirPath(0, file, buffer, size), error == 0 ? 0 : -1);
+    EXPECT_STREQ(buffer, ea_dir);
+    EXPECT_EQ(buffer[size < 0 ? 64 : size], '#');
+    EXPECT_TRUE(error == 0 || QLIBCErrGet() == error);
   }
   char buffer[64];
   EXPECT_EQ(QUVAEADirPath(1, "/a/b", buffer, sizeof buffer), -1);
@@ -49,9 +47,8 @@ TEST(EaDirTest, PathOfFileIsHiddenDirInItsFolderWrittenOnlyWhole) {
   EXPECT_EQ(QLIBCErrGet(), EINVAL);
 }
 
-// The hidden directory and the item are made when missing (an existing one
-// is success and keeps its mode), never the media folder, never over a
-// file in the way; paths that are not EA directories are refused.
+// Only what is missing is made (never the media folder, never over a file);
+// an existing one keeps its mode; paths of no EA directory are refused.
 TEST(EaDirTest, MakeDirCreatesOnlyWhatIsMissing) {
   TempDir dir;
   std::string ea = dir.File(".quvameta/x.jpg");

@@ -1,6 +1,4 @@
-// The typed index requests against scripted daemons on temporary socket
-// paths: request keys, reply keys read with guards, outputs left untouched
-// on failure, the daemon down, the index daemon's alive check.
+// The typed index requests against scripted daemons on temporary sockets.
 #include <string.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -22,15 +20,11 @@
 #include "support/log_capture.h"
 #include "support/scripted_peer.h"
 
+namespace quvaidx::test {
 namespace {
 
 using quvahost::test::FakeHost;
 using quvahost::test::HostOp;
-using quvaidx::test::FakeSleep;
-using quvaidx::test::FdLeakCheck;
-using quvaidx::test::LogCapture;
-using quvaidx::test::ScriptedPeer;
-using quvaidx::test::TempDir;
 
 Json::Value Parse(const char* text) {
   Json::Value value;
@@ -199,7 +193,7 @@ TEST_F(IndexRequestsTest, DaemonDownFailsAfterEveryAttemptWithItsLine) {
 // A user who bound a daemon's fixed path while it was down receives
 // nothing, and the call fails at once instead of trying for half an hour.
 TEST_F(IndexRequestsTest, StrangerOnTheSocketGetsNothing) {
-  int squatter = quvaidx::test::ListenUnixAs(plugin_path_, 4, 65534);
+  int squatter = ListenUnixAs(plugin_path_, 4, 65534);
   ASSERT_GE(squatter, 0);
   LogCapture log;
   int map = 7;
@@ -243,3 +237,4 @@ TEST_F(IndexRequestsTest, AllPluginNamesOnlyWhileTheIndexDaemonLives) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test

@@ -1,6 +1,5 @@
-// The shared command-line parser: values are checked before they reach their
-// targets, errors name the option as the user wrote it, and --help/--version
-// come from the one description.
+// The shared command-line parser: checked values, errors naming the option as
+// written, --help and --version from the one description.
 #include "options.h"
 
 #include <stdio.h>
@@ -82,34 +81,24 @@ TEST(OptionsTest, ValuesReachTheirTargetsInAnySpellingAndOrder) {
 }
 
 TEST(OptionsTest, RefusedValuesNameTheOptionAndLeaveTheTarget) {
-  struct Case {
-    std::vector<std::string> args;
-    std::string error;
-  } cases[] = {
-      {{"--bogus"}, "prog sub: unrecognised option '--bogus'\n"},
-      {{"--bogus=1"}, "prog sub: unrecognised option '--bogus'\n"},
-      {{"-x"}, "prog sub: unrecognised option '-x'\n"},
-      {{"--text"}, "prog sub: option '--text' needs a value\n"},
-      {{"-n"}, "prog sub: option '-n' needs a value\n"},
-      {{"-n", "10"},
-       "prog sub: invalid value '10' for '--number': a whole number from 1 "
-       "to 9\n"},
-      {{"--number=1x"},
-       "prog sub: invalid value '1x' for '--number': a whole number from 1 "
-       "to 9\n"},
-      {{"--text="}, "prog sub: invalid value '' for '--text': empty\n"},
-      {{"--timeout", "0"},
-       "prog sub: invalid value '0' for '--timeout': a number of seconds "
-       "above 0, at most 60\n"},
-      {{"--timeout", "nan"},
-       "prog sub: invalid value 'nan' for '--timeout': a number of seconds "
-       "above 0, at most 60\n"},
-  };
-  for (const Case& c : cases) {
+  const std::string number = "': a whole number from 1 to 9",
+                    seconds = "': a number of seconds above 0, at most 60";
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"--bogus"}, "unrecognised option '--bogus'"},
+      {{"--bogus=1"}, "unrecognised option '--bogus'"},
+      {{"-x"}, "unrecognised option '-x'"},
+      {{"--text"}, "option '--text' needs a value"},
+      {{"-n"}, "option '-n' needs a value"},
+      {{"-n", "10"}, "invalid value '10' for '--number" + number},
+      {{"--number=1x"}, "invalid value '1x' for '--number" + number},
+      {{"--text="}, "invalid value '' for '--text': empty"},
+      {{"--timeout", "0"}, "invalid value '0' for '--timeout" + seconds},
+      {{"--timeout", "nan"}, "invalid value 'nan' for '--timeout" + seconds}};
+  for (const auto& [args, error] : cases) {
     Targets t;
-    Parsed p = Parse(MakeLine(&t), c.args);
-    EXPECT_EQ(p.status, kExitError) << c.args[0];
-    EXPECT_EQ(p.err, c.error + "Try 'prog sub --help'.\n");
+    Parsed p = Parse(MakeLine(&t), args);
+    EXPECT_EQ(p.status, kExitError) << args[0];
+    EXPECT_EQ(p.err, "prog sub: " + error + "\nTry 'prog sub --help'.\n");
     EXPECT_EQ(t.text, "unset");
     EXPECT_EQ(t.number, -1);
   }

@@ -1,11 +1,12 @@
 // Canonical paths, non-replacing renames and head trimming on real files.
-#include <dirent.h>
 #include <limits.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <iterator>
 #include <string>
 #include <tuple>
 
@@ -17,26 +18,19 @@
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::test {
 namespace {
 
-using quvaidx::test::LogCapture;
-using quvaidx::test::ReadFile;
-using quvaidx::test::RunUnprivileged;
-using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::RunWithSyscallsFailing;
-using quvaidx::test::WriteFile;
-
+// Every entry, hidden ones too: a temporary file left behind shows.
 int EntriesIn(const std::string& dir) {
-  int count = 0;
-  DIR* d = opendir(dir.c_str());
-  while (struct dirent* e = readdir(d)) count += e->d_name[0] != '.';
-  closedir(d);
-  return count;
+  using std::filesystem::directory_iterator;
+  return std::distance(directory_iterator(dir), directory_iterator());
 }
 
 class FileTest : public ::testing::Test {
  protected:
-  quvaidx::test::TempDir dir_;
+  int Rename() { return RenameFile(source_.c_str(), destination_.c_str()); }
+  TempDir dir_;
   std::string source_ = dir_.File("source");
   std::string destination_ = dir_.File("destination");
 };
@@ -61,27 +55,25 @@ TEST_F(FileTest, RealPathResolvesOrKeepsThePath) {
   EXPECT_EQ(log.Count("quvaidx_system:N [Error] GetRealPath: (null)"), 1);
 }
 
-// The source moves unless the destination exists, also when the existence
-// test cannot see it (a dangling link, like one created just after it). A
-// missing source fails quietly, a missing folder at once, a persistent
-// failure (a folder into itself: EINVAL) after sixteen tries, each followed
-// by a yield through the sleep seam.
+// Never over a destination, even a dangling link the existence test misses.
+// A missing source fails quietly, a missing folder at once, a persistent
+// failure (a folder into itself) after sixteen tries, each with a yield.
 TEST_F(FileTest, RenameNeverReplacesTheDestination) {
   LogCapture log;
-  quvaidx::test::FakeSleep sleep;
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), -1);
+  FakeSleep sleep;
+  EXPECT_EQ(Rename(), -1);
   EXPECT_TRUE(log.lines().empty());
   WriteFile(source_, "s");
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(destination_), "s");
   EXPECT_NE(access(source_.c_str(), F_OK), 0);
   WriteFile(source_, "t");
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(source_), "t");
   EXPECT_EQ(ReadFile(destination_), "s");
   ASSERT_EQ(unlink(destination_.c_str()), 0);
   ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
-  EXPECT_EQ(RenameFile(source_.c_str(), destination_.c_str()), 0);
+  EXPECT_EQ(Rename(), 0);
   EXPECT_EQ(ReadFile(source_), "t");
   char target[64] = "";
   ASSERT_GT(readlink(destination_.c_str(), target, sizeof(target) - 1), 0);
@@ -103,9 +95,8 @@ TEST_F(FileTest, RenameNeverReplacesTheDestination) {
               " -> " + inside}));
 }
 
-// Where the filesystem cannot rename without replacing, a hard link stands
-// in, failing instead of replacing; where it has no hard links either, the
-// plain rename after the existence test is all there is.
+// Without a no-replace rename a hard link stands in; without hard links too,
+// the plain rename after the existence test is all there is.
 TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
   const std::vector<std::pair<long, int>> kinds[] = {
       {{SYS_renameat2, EINVAL}},
@@ -113,29 +104,19 @@ TEST_F(FileTest, RenameWhereTheFilesystemLacksNoReplaceOrLinks) {
   for (const auto& failures : kinds) {
     WriteFile(source_, "s");
     unlink(destination_.c_str());
-    EXPECT_EQ(
-        RunWithSyscallsFailing(
-            failures,
-            [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
-        0);
+    EXPECT_EQ(RunWithSyscallsFailing(failures, [&] { return Rename(); }), 0);
     EXPECT_EQ(ReadFile(destination_), "s");
     EXPECT_NE(access(source_.c_str(), F_OK), 0);
   }
   WriteFile(source_, "t");
   ASSERT_EQ(unlink(destination_.c_str()), 0);
   ASSERT_EQ(symlink("nowhere", destination_.c_str()), 0);
-  EXPECT_EQ(
-      RunWithSyscallsFailing(
-          kinds[0],
-          [&] { return RenameFile(source_.c_str(), destination_.c_str()); }),
-      0);
+  EXPECT_EQ(RunWithSyscallsFailing(kinds[0], [&] { return Rename(); }), 0);
   EXPECT_EQ(ReadFile(source_), "t");
 }
 
-// The first n lines go (none for n <= 0), across copy blocks too; the file
-// keeps its owner and mode, and no temporary file stays. What is no regular
-// file is refused at once: a trimmer must not wait on a FIFO planted at a
-// queue path for a writer that never comes.
+// The first n lines go; owner and mode stay, no temporary file does. What is
+// no regular file is refused at once (a planted FIFO must not block).
 TEST_F(FileTest, TrimDropsTheFirstLines) {
   const std::tuple<std::string, int, std::string> kCases[] = {
       {"a\nb\nc\n", 1, "b\nc\n"},
@@ -148,9 +129,7 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
        std::string(70000, 's')}};  // across copy blocks
   WriteFile(source_, "");
   ASSERT_EQ(chmod(source_.c_str(), 02640), 0);
-  ASSERT_EQ(
-      chown(source_.c_str(), quvaidx::test::kNobody, quvaidx::test::kNobody),
-      0);
+  ASSERT_EQ(chown(source_.c_str(), kNobody, kNobody), 0);
   struct stat before, after;
   ASSERT_EQ(stat(source_.c_str(), &before), 0);
   for (const auto& [text, n, left] : kCases) {
@@ -181,10 +160,8 @@ TEST_F(FileTest, TrimDropsTheFirstLines) {
                                " is a symbolic link; not trimmed"});
 }
 
-// A disk that fills while the copy is written, or a file of another user,
-// must fail the trim and keep every line: reporting success would replace
-// the queue by a cut copy. The failed write must not be retried for ever
-// either, and the temporary file goes.
+// A full disk or a file of another user fails the trim, keeping every line
+// and no temporary file, without retrying for ever.
 TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
   std::string text;
   for (int i = 0; i < 300; ++i)
@@ -203,3 +180,4 @@ TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
 }
 
 }  // namespace
+}  // namespace quvaidx::test

@@ -1,10 +1,10 @@
 // Process statistics of this process and of a missing pid, and the /proc
-// parsers on chosen texts. (The figures of another live process are checked
-// against /proc by the tool's stats test.)
+// parsers on chosen texts.
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -14,9 +14,8 @@
 
 namespace {
 
-// What "ls -l /proc/PID/fd | wc -l" prints for a caller asking about
-// itself: its descriptors, the pipe of the command, the header line. A
-// missing process has none and no memory figures.
+// What "ls -l /proc/PID/fd | wc -l" prints: the descriptors, the command's
+// pipe and the header line. A missing process has none and no memory.
 TEST(ProcStatsTest, OwnAndMissingProcess) {
   EXPECT_EQ(GetFileDescriptorNum(getpid()),
             quvaidx::test::OpenDescriptorCount() + 2);
@@ -38,25 +37,20 @@ TEST(ProcStatsTest, OwnAndMissingProcess) {
 // A label is found anywhere in a line, and counts without a number; only
 // the first 4 KiB are read; the first MemTotal counts.
 TEST(ProcParseTest, StatusAndMemInfoLines) {
-  const struct {
-    std::string text;
-    bool found;
-    long rss, vmsize;
-  } kCases[] = {
+  const std::tuple<std::string, bool, long, long> kCases[] = {
       {"Name:\tx\nVmSize:\t  2048 kB\nVmRSS:\t   512 kB\n", true, 512, 2048},
       {"Name:\tkthreadd\nState:\tS\n", false, -1, -1},  // a kernel thread
       {"VmRSS:\nVmSize:\t9 kB\n", true, -1, 9},         // label, no number
       {"xVmRSS: 1 kB\nVmSize:x 2 kB\n", true, 1, 2},    // found anywhere
       {"VmRSS: 1 kB\n", false, 1, -1},
       {std::string(4090, 'x') + "\nVmRSS: 1 kB\n", false, -1, -1}};  // > 4 KiB
-  for (const auto& c : kCases) {
+  for (const auto& [text, found, expected_rss, expected_vmsize] : kCases) {
+    SCOPED_TRACE(text.substr(0, 40));
     long rss = 0, vmsize = 0;
-    EXPECT_EQ(
-        quvaidx::ParseProcStatus(c.text.data(), c.text.size(), &rss, &vmsize),
-        c.found)
-        << c.text.substr(0, 40);
-    EXPECT_EQ(rss, c.rss) << c.text.substr(0, 40);
-    EXPECT_EQ(vmsize, c.vmsize) << c.text.substr(0, 40);
+    EXPECT_EQ(quvaidx::ParseProcStatus(text.data(), text.size(), &rss, &vmsize),
+              found);
+    EXPECT_EQ(rss, expected_rss);
+    EXPECT_EQ(vmsize, expected_vmsize);
   }
   std::string text = "MemFree: 1 kB\nMemTotal:  24000000 kB\nMemTotal: 3\n";
   long total = 0;

@@ -18,16 +18,8 @@
 #include "support/log_capture.h"
 #include "support/unprivileged.h"
 
+namespace quvaidx::test {
 namespace {
-
-using quvaidx::test::FakeSleep;
-using quvaidx::test::LogCapture;
-using quvaidx::test::RunUnprivileged;
-using quvaidx::test::RunWithFileSizeLimit;
-using quvaidx::test::TempDir;
-
-using quvaidx::test::ReadFile;
-using quvaidx::test::WriteFile;
 
 class IndexQueueTest : public ::testing::Test {
  protected:
@@ -35,14 +27,19 @@ class IndexQueueTest : public ::testing::Test {
   std::string queue_ = dir_.File("test.queue");
 };
 
-// Duplicates leave one line; entries that would corrupt the queue (a line
-// feed, over kMaxQueueEntry bytes) are refused with a line each.
+// Duplicates leave one line, corrupting entries are refused with a line each;
+// a new queue is 0666 less the umask, never executable.
 TEST_F(IndexQueueTest, DuplicatesAndCorruptingEntries) {
   LogCapture log;
   const std::string longest(kMaxQueueEntry, 'x');
+  const mode_t old_umask = umask(0);
   for (const char* entry : {"/share/a", "/share/ab", "/share/a", "/share"}) {
     EXPECT_EQ(WriteIndexQueue(entry, queue_.c_str()), 0);
   }
+  umask(old_umask);
+  struct stat st;
+  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0666u);
   EXPECT_EQ(WriteIndexQueue("two\nlines", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue("trailing\n", queue_.c_str()), -1);
   EXPECT_EQ(WriteIndexQueue((longest + "y").c_str(), queue_.c_str()), -1);
@@ -83,29 +80,27 @@ TEST_F(IndexQueueTest, OpenFailuresAndRetries) {
   EXPECT_EQ(ReadFile(queue_), "");
 }
 
-// A disk that fills during the append must not leave a torn line that
-// would glue itself to the next entry: a short write is taken back, and a
-// write that fails outright adds nothing.
+// A full disk leaves no torn line to glue itself to the next entry: a short
+// write is taken back, a failed one adds nothing.
 TEST_F(IndexQueueTest, FullDiskLeavesNoTornLine) {
   const std::string kept = "/share/a\n";
-  const struct {
-    long limit;          // bytes the queue may grow to
-    const char* reason;  // in the log line
-  } kCases[] = {{static_cast<long>(kept.size()) + 3, "No space left on device"},
-                {static_cast<long>(kept.size()), "File too large"}};
-  for (const auto& c : kCases) {
+  // The size the queue may grow to, the reason logged.
+  const std::pair<long, const char*> kCases[] = {
+      {static_cast<long>(kept.size()) + 3, "No space left on device"},
+      {static_cast<long>(kept.size()), "File too large"}};
+  for (const auto& [limit, reason] : kCases) {
     WriteFile(queue_, kept);
+    const std::string logged_reason = std::string("reason=") + reason;
     auto append_fails = [&] {
       LogCapture log;
       bool failed = WriteIndexQueue("/share/bb", queue_.c_str()) == -1;
-      bool logged = log.lines().size() == 1 &&
-                    log.lines()[0].text.find(std::string("reason=") +
-                                             c.reason) != std::string::npos;
+      bool logged =
+          log.lines().size() == 1 &&
+          log.lines()[0].text.find(logged_reason) != std::string::npos;
       return (failed ? 0 : 1) | (logged ? 0 : 2);
     };
-    int code = RunWithFileSizeLimit(c.limit, append_fails);
-    EXPECT_EQ(code, 0) << c.reason;
-    EXPECT_EQ(ReadFile(queue_), kept) << c.reason;
+    EXPECT_EQ(RunWithFileSizeLimit(limit, append_fails), 0) << reason;
+    EXPECT_EQ(ReadFile(queue_), kept) << reason;
   }
   EXPECT_EQ(WriteIndexQueue("/share/bb", queue_.c_str()), 0);
   EXPECT_EQ(ReadFile(queue_), kept + "/share/bb\n");
@@ -147,16 +142,5 @@ TEST_F(IndexQueueTest, LinkAtTheQueuePathIsNotFollowed) {
                           " is a symbolic link; not trimmed");
 }
 
-// A queue holds text: the writer makes it 0666 less the umask, never
-// executable.
-TEST_F(IndexQueueTest, NewQueueIsNotExecutable) {
-  const mode_t old_umask = umask(0);
-  const int result = WriteIndexQueue("/share/a", queue_.c_str());
-  umask(old_umask);
-  ASSERT_EQ(result, 0);
-  struct stat st;
-  ASSERT_EQ(stat(queue_.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0666u);
-}
-
 }  // namespace
+}  // namespace quvaidx::test
