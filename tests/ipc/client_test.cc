@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -157,6 +158,14 @@ TEST_F(ClientTest, ConnectDaemonSaysWhyAndRefusesStrangers) {
                          : 0;
             }),
             EACCES);
+  EXPECT_EQ(quvaidx::test::RunWithSyscallsFailing(  // out of descriptors
+                {{SYS_socket, EMFILE}},
+                [&] {
+                  return ConnectDaemon(dir_.File("mine.sock").c_str(), 50) < 0
+                             ? errno
+                             : 0;
+                }),
+            EMFILE);
   for (int fd : queued) close(fd);
   for (int fd : {mine, stranger, full}) close(fd);
 }
