@@ -352,10 +352,19 @@ TEST_F(SpoolConsumerTest, DiskFailuresFailTheCallAndLoseNoEntry) {
     SCOPED_TRACE(call);
     WriteFile(queue_, "/a\n/b\n");
     EXPECT_EQ(quvaidx::test::RunWithSyscallsFailing(
-                  {{call, error}}, [&] { return operation() == -1 ? 0 : 1; }),
-              0);
+                  {{call, error}},
+                  [&] {
+                    LogCapture log;
+                    return operation() == -1 ? log.lines().size() : 9;
+                  }),
+              1);  // and one line says why
     EXPECT_EQ(ReadFile(queue_), "/a\n/b\n");
   }
+  // Bookkeeping that cannot be opened for writing (a folder in its place).
+  const std::string side = quvaidx::QueueStatePath(q_);
+  unlink(side.c_str());
+  ASSERT_EQ(mkdir(side.c_str(), 0700), 0);
+  EXPECT_EQ(CountQueueAttempt(q_, "/a"), -1);
 }
 
 // A mostly blank queue is compacted into a new file: the entries left, in
