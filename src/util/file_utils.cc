@@ -157,7 +157,11 @@ int FileRemoveHeadingLine(const char* path, int n) {
     unlink(temp_path.c_str());
     return -1;
   }
-  if (close(out) != 0) return -1;  // the temporary file stays
-  if (rename(temp_path.c_str(), path) != 0) return -1;
+  if (close(out) != 0 || rename(temp_path.c_str(), path) != 0) {
+    const int err = errno;
+    unlink(temp_path.c_str());  // the queue itself is untouched
+    errno = err;
+    return -1;
+  }
   return 0;
 }

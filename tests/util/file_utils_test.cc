@@ -171,6 +171,10 @@ TEST_F(FileTest, TrimThatCannotWriteItsCopyKeepsEveryLine) {
     return FileRemoveHeadingLine(source_.c_str(), 1) == -1 ? 0 : 1;
   };
   EXPECT_EQ(RunWithFileSizeLimit(1000, trim_fails), 0);
+  EXPECT_EQ(RunWithSyscallsFailing(  // a copy that cannot be renamed in
+                {{SYS_rename, EIO}, {SYS_renameat, EIO}, {SYS_renameat2, EIO}},
+                trim_fails),
+            0);
   chmod(dir_.path().c_str(), 0777);  // the trimmer may create its copy
   if (getuid() == 0) {
     EXPECT_EQ(RunUnprivileged(trim_fails), 0);
