@@ -11,6 +11,7 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -394,6 +395,16 @@ TEST_F(EventServerTest, OnlyAStaleSocketIsReplaced) {
   EXPECT_EQ(errno, ENOENT);
   EXPECT_EQ(log.Normalized(), Lines{kError + "Could not create a listener: " +
                                     nowhere + " (No such file or directory)"});
+  const std::string refused = dir_.File("refused.sock");  // listen() fails
+  EXPECT_EQ(quvaidx::test::RunWithSyscallsFailing(
+                {{SYS_listen, EACCES}},
+                [&] {
+                  return BuildServer(base_, refused.c_str(), &args_) == -1
+                             ? errno
+                             : 0;
+                }),
+            EACCES);
+  EXPECT_NE(access(refused.c_str(), F_OK), 0);  // its socket file removed
 }
 
 // A socket handed over is served only when it is a listening Unix stream

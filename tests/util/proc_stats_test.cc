@@ -17,8 +17,10 @@ namespace {
 // What "ls -l /proc/PID/fd | wc -l" prints: the descriptors, the command's
 // pipe and the header line. A missing process has none and no memory.
 TEST(ProcStatsTest, OwnAndMissingProcess) {
+  quvaidx::test::FdLeakCheck leaks;  // the listing is closed again
   EXPECT_EQ(GetFileDescriptorNum(getpid()),
             quvaidx::test::OpenDescriptorCount() + 2);
+  EXPECT_TRUE(leaks.NoLeak());
   long rss = 0, vmsize = 0, total = 0;
   ASSERT_EQ(GetMemoryUsagekb(getpid(), rss, vmsize), 0);
   EXPECT_GT(rss, 0);
